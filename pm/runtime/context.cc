@@ -1,0 +1,57 @@
+#include "pm/runtime/context.h"
+
+#include <dlfcn.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+
+namespace pm {
+namespace {
+
+std::atomic<Context*> g_context{nullptr};
+
+void DefaultSink(LogType, const char* line) {
+  // One write, so lines from several threads do not mix.
+  const std::size_t n = std::strlen(line);
+  [[maybe_unused]] ssize_t written = ::write(STDERR_FILENO, line, n);
+}
+
+}  // namespace
+
+Context* GetContext() {
+  if (Context* cached = g_context.load(std::memory_order_acquire)) return cached;
+  static std::mutex mutex;
+  std::lock_guard<std::mutex> guard(mutex);
+  if (Context* cached = g_context.load(std::memory_order_acquire)) return cached;
+
+  Context* context = nullptr;
+  if (void* symbol = ::dlsym(RTLD_DEFAULT, kContextExportName)) {
+    auto exported = reinterpret_cast<ContextExport>(symbol);
+    context = exported();
+    if (context == nullptr) context = new Context();
+    context->fromHost = true;
+  } else {
+    context = new Context();  // private to this module; never destroyed
+  }
+  g_context.store(context, std::memory_order_release);
+  return context;
+}
+
+Context::LogSink CurrentLogSink() {
+  Context* context = GetContext();
+  if (!context->logSink) context->logSink = DefaultSink;
+  return context->logSink;
+}
+
+std::shared_ptr<Context::SingletonBase> FindSingleton(
+    const std::string& name,
+    const std::function<std::shared_ptr<Context::SingletonBase>()>& create) {
+  Context* context = GetContext();
+  std::lock_guard<std::mutex> guard(context->registryLock);
+  std::shared_ptr<Context::SingletonBase>& entry = context->registry[name];
+  if (!entry && create) entry = create();
+  return entry;
+}
+
+}  // namespace pm

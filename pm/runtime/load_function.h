@@ -1,0 +1,11 @@
+#pragma once
+// Loads a shared library by name (dlopen) and looks a function up in it
+// (dlsym). Returns null when either step fails. The library stays loaded for
+// the life of the process.
+#include <string>
+
+namespace pm {
+
+void* LoadFunction(const std::string& library, const std::string& function);
+
+}  // namespace pm

@@ -1,0 +1,35 @@
+// GetContext in a process that exports the context, as the runner does: every
+// module that asks finds the exported block.
+#include <gtest/gtest.h>
+
+#include "pm/runtime/context.h"
+
+namespace {
+pm::Context g_exported;
+int g_calls = 0;
+}  // namespace
+
+extern "C" __attribute__((visibility("default"))) pm::Context* QFProcessManagementGlobals() {
+  ++g_calls;
+  return &g_exported;
+}
+
+namespace {
+
+TEST(ContextWithExport, IsTheExportedBlockMarkedFromHost) {
+  pm::Context* context = pm::GetContext();
+  EXPECT_EQ(context, &g_exported);
+  EXPECT_TRUE(context->fromHost);
+  EXPECT_EQ(pm::GetContext(), context);
+  EXPECT_EQ(g_calls, 1);  // looked up once, then cached
+}
+
+TEST(ContextWithExport, TheHostsSinkReceivesTheLines) {
+  std::string seen;
+  pm::GetContext()->logSink = [&](pm::LogType, const char* line) { seen += line; };
+  pm::Log(pm::LogType::Normal, "", "to the host %d", 1);
+  pm::GetContext()->logSink = nullptr;
+  EXPECT_EQ(seen, "to the host 1\n");
+}
+
+}  // namespace

@@ -1,0 +1,49 @@
+// GetContext in a process without the context export: a private context.
+#include <gtest/gtest.h>
+
+#include <thread>
+
+#include "pm/runtime/context.h"
+#include "pm/runtime/load_function.h"
+
+namespace {
+
+struct Thing : pm::Context::SingletonBase {
+  int value = 0;
+};
+
+TEST(ContextWithoutExport, IsPrivateAndTheSameOnEveryCall) {
+  pm::Context* seen[4] = {};
+  std::thread threads[4];
+  for (int i = 0; i < 4; ++i) threads[i] = std::thread([&, i] { seen[i] = pm::GetContext(); });
+  for (auto& t : threads) t.join();
+  for (auto* c : seen) EXPECT_EQ(c, pm::GetContext());
+  EXPECT_FALSE(pm::GetContext()->fromHost);
+}
+
+TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
+  int created = 0;
+  auto make = [&] {
+    ++created;
+    auto t = std::make_shared<Thing>();
+    t->value = 9;
+    return std::shared_ptr<pm::Context::SingletonBase>(t);
+  };
+  auto a = pm::FindSingleton("registry-test", make);
+  auto b = pm::FindSingleton("registry-test", make);
+  EXPECT_EQ(a, b);
+  EXPECT_EQ(created, 1);
+  EXPECT_EQ(std::dynamic_pointer_cast<Thing>(a)->value, 9);
+
+  auto none = pm::FindSingleton("registry-empty", [] { return nullptr; });
+  EXPECT_EQ(none, nullptr);
+  EXPECT_EQ(pm::GetContext()->registry.count("registry-empty"), 1u);
+}
+
+TEST(LoadFunction, FindsALibraryFunctionAndReportsMissingOnes) {
+  EXPECT_NE(pm::LoadFunction("libc.so.6", "strlen"), nullptr);
+  EXPECT_EQ(pm::LoadFunction("libc.so.6", "no_such_function_here"), nullptr);
+  EXPECT_EQ(pm::LoadFunction("libno-such-library.so", "strlen"), nullptr);
+}
+
+}  // namespace

@@ -1,0 +1,107 @@
+// pmjson::Parse and the lenient readers.
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <random>
+
+#include "pm/runtime/json.h"
+#include "support/log_capture.h"
+
+namespace {
+
+using pmjson::Json;
+
+TEST(Parse, EmptyTextIsNullWithoutALogLine) {
+  pmtest::LogCapture capture;
+  EXPECT_TRUE(pmjson::Parse("", "label").is_null());
+  EXPECT_TRUE(capture.Lines().empty());
+}
+
+TEST(Parse, BadTextLogsLabelAndTextAndIsNull) {
+  pmtest::LogCapture capture;
+  EXPECT_TRUE(pmjson::Parse("{\"a\":", "validate_gui").is_null());
+  EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"pmjson::Parse failed: validate_gui '{\"a\":'\n"}));
+}
+
+TEST(Parse, GarbageOfAnyKindNeverThrows) {
+  pmtest::LogCapture capture;
+  EXPECT_TRUE(pmjson::Parse("\"\xC3\x28\"", "utf8").is_null());  // invalid UTF-8 in a string
+  EXPECT_TRUE(pmjson::Parse(std::string("\0\1\2", 3), "nul").is_null());
+  EXPECT_TRUE(pmjson::Parse(std::string(100000, '['), "deep").is_null());
+  std::mt19937 random(7);
+  std::string garbage(1 << 20, '\0');
+  for (char& c : garbage) c = static_cast<char>(random());
+  EXPECT_TRUE(pmjson::Parse(garbage, "garbage").is_null());
+  EXPECT_EQ(capture.Lines().size(), 4u);
+}
+
+TEST(Parse, ValidTextKeepsKeysInByteOrder) {
+  const Json j = pmjson::Parse("{\"b\":1,\"a\":[true,null],\"B\":2.5}", "x");
+  EXPECT_EQ(pmjson::Dump(j), "{\"B\":2.5,\"a\":[true,null],\"b\":1}");
+}
+
+struct Row {
+  Json value;
+  bool asBool;
+  std::int64_t asInteger;
+  double asDouble;
+  std::string asString;
+};
+
+TEST(LenientReaders, ReadEveryJsonType) {
+  const Row rows[] = {
+      {"Yes", true, 0, 0.0, "Yes"},
+      {"yes please", false, 0, 0.0, "yes please"},
+      {"TRUE", true, 0, 0.0, "TRUE"},
+      {"1", true, 1, 1.0, "1"},
+      {"42abc", false, 42, 42.0, "42abc"},
+      {" -7.5x", false, -7, -7.5, " -7.5x"},
+      {"", false, 0, 0.0, ""},
+      {12, true, 12, 12.0, "12"},
+      {-3, true, -3, -3.0, "-3"},
+      {0, false, 0, 0.0, "0"},
+      {18446744073709551615u, true, -1, 18446744073709551615.0, "18446744073709551615"},
+      {2.9, true, 2, 2.9, "2.9"},
+      {-2.9, true, -2, -2.9, "-2.9"},
+      {0.5, true, 0, 0.5, "0.5"},
+      {0.0, false, 0, 0.0, "0"},
+      {1234567.0, true, 1234567, 1234567.0, "1.23457e+06"},
+      {true, true, 1, 1.0, "1"},
+      {false, false, 0, 0.0, "0"},
+      {nullptr, false, 0, 0.0, ""},
+      {Json::array({1, 2}), false, 0, 0.0, ""},
+      {Json::object({{"a", 1}}), false, 0, 0.0, ""},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.value.dump());
+    EXPECT_EQ(pmjson::AsBool(row.value), row.asBool);
+    EXPECT_EQ(pmjson::AsInteger(row.value), row.asInteger);
+    EXPECT_DOUBLE_EQ(pmjson::AsDouble(row.value), row.asDouble);
+    EXPECT_EQ(pmjson::AsString(row.value), row.asString);
+  }
+}
+
+TEST(LenientReaders, OutOfRangeNumbersHaveDefinedResults) {
+  EXPECT_EQ(pmjson::AsInteger(Json(1e300)), 0);
+  EXPECT_EQ(pmjson::AsInteger(Json(std::nan(""))), 0);
+  EXPECT_TRUE(pmjson::AsBool(Json(std::nan(""))));
+  EXPECT_EQ(pmjson::AsInteger(Json("99999999999999999999999")), INT64_MAX);
+}
+
+TEST(FieldReaders, UseTheDefaultForMissingKeysAndNonObjects) {
+  const Json request = {{"unique_id", 5}, {"command", "zoom"}, {"zoom", "0.25"}};
+  EXPECT_EQ(pmjson::FieldAsString(request, "unique_id", ""), "5");
+  EXPECT_EQ(pmjson::FieldAsString(request, "missing", "dflt"), "dflt");
+  EXPECT_DOUBLE_EQ(pmjson::FieldAsDouble(request, "zoom", 0.0), 0.25);
+  EXPECT_EQ(pmjson::FieldAsInteger(request, "preset", 7), 7);
+  EXPECT_EQ(pmjson::FieldAsString(Json::array({"unique_id"}), "unique_id", "d"), "d");
+  EXPECT_EQ(pmjson::FieldAsString(Json(nullptr), "unique_id", "d"), "d");
+  EXPECT_EQ(pmjson::FieldAsInteger(Json("text"), "x", 3), 3);
+}
+
+TEST(Dump, NeverThrowsOnInvalidUtf8) {
+  const Json j = std::string("a\xFF");
+  EXPECT_NO_THROW(pmjson::Dump(j));
+}
+
+}  // namespace
