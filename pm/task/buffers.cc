@@ -1,0 +1,1 @@
+#include "pm/task/buffers.h"

@@ -1,0 +1,1 @@
+#include "pm/task/formats.h"

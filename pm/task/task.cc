@@ -1,0 +1,1 @@
+// The task object: TaskBase and Task.
