@@ -1,0 +1,126 @@
+// The media clock, driven by a test clock: audio time, video steps that follow
+// the audio clock, the fallback before any audio, and resets.
+#include <gtest/gtest.h>
+
+#include "pm/task/media_clock.h"
+
+namespace {
+
+constexpr std::int64_t kSecondNs = 1000000000;
+
+struct TestClock {
+  std::int64_t now = 5 * kSecondNs;
+  pm::MediaClock::NowFn Fn() {
+    return [this] { return now; };
+  }
+};
+
+constexpr std::uint32_t Rate(std::uint32_t frames, std::uint32_t seconds) { return frames | seconds << 16; }
+
+TEST(MediaClock, CurrentTimeCountsTicksFromTheEpoch) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  EXPECT_EQ(clock.CurrentTime(), 0);
+  t.now += kSecondNs;
+  EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
+  t.now += 1;  // 1 ns is 0.7056 ticks: truncated
+  EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
+}
+
+TEST(MediaClock, AudioTimeOfOneSecondOfSamples) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  EXPECT_EQ(clock.AudioTime(48000), 0);
+  for (int i = 0; i < 30; ++i) clock.AudioSent(1600);
+  EXPECT_EQ(clock.AudioTime(48000), 705600000);
+  clock.AudioSent(44100);  // 92,100 samples in all: 2,088,435 whole microseconds at 44.1 kHz
+  EXPECT_EQ(clock.AudioTime(44100), 1473599736);
+}
+
+TEST(MediaClock, AudioTimeWithoutARateFollowsTheSteadyClock) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  clock.AudioSent(48000);
+  t.now += kSecondNs / 2;
+  EXPECT_EQ(clock.AudioTime(0), pm::kTicksPerSecond / 2);
+  EXPECT_EQ(clock.AudioTime(-1), pm::kTicksPerSecond / 2);
+}
+
+TEST(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  for (std::int64_t i = 1; i <= 10; ++i) {
+    EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(i, true));
+  }
+  t.now += 2 * kSecondNs;
+  EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(2 * pm::kTicksPerSecond, false));
+}
+
+TEST(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  // 48 kHz audio in 1601/1602-sample buffers, video at 30000/1001.
+  std::int64_t previous = -1;
+  for (int frame = 0; frame < 300; ++frame) {
+    clock.AudioSent(frame % 5 == 0 ? 1602 : 1601);
+    clock.AudioTime(48000);
+    const auto [time, discontinuity] = clock.NextVideoTime(Rate(30000, 1001));
+    EXPECT_FALSE(discontinuity) << frame;
+    if (previous >= 0) {
+      EXPECT_EQ(time - previous, 23543520) << frame;
+    }
+    previous = time;
+  }
+}
+
+TEST(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  clock.AudioSent(1600);
+  clock.AudioTime(48000);
+  const auto first = clock.NextVideoTime(Rate(30, 1));
+  for (int i = 0; i < 300; ++i) clock.AudioSent(1600);  // ten seconds of audio at once
+  const std::int64_t audio = clock.AudioTime(48000);
+  const auto second = clock.NextVideoTime(Rate(30, 1));
+  EXPECT_NE(second.first, first.first + pm::kTicksPerSecond / 30);
+  EXPECT_EQ(second.first, audio);
+  EXPECT_FALSE(second.second);
+}
+
+TEST(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  for (int i = 0; i < 100; ++i) clock.AudioSent(1600);
+  clock.AudioTime(48000);
+  const auto first = clock.NextVideoTime(Rate(30, 1));
+  // The audio clock goes back (a shorter count after a rate change): far
+  // outside the window and behind the last video time.
+  clock.AudioTime(96000);
+  const auto second = clock.NextVideoTime(Rate(30, 1));
+  EXPECT_EQ(second, std::make_pair(first.first + 1, true));
+}
+
+TEST(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  clock.AudioSent(4800);
+  const std::int64_t audio = clock.AudioTime(48000);
+  EXPECT_EQ(clock.NextVideoTime(Rate(0, 1)), std::make_pair(audio, false));
+  EXPECT_EQ(clock.NextVideoTime(Rate(30, 0)), std::make_pair(audio, false));
+  EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(audio, false));  // first real one
+}
+
+TEST(MediaClock, ResetStartsTheEpochAgainAndReturnsToTheFallback) {
+  TestClock t;
+  pm::MediaClock clock(t.Fn());
+  clock.AudioSent(48000);
+  clock.AudioTime(48000);
+  clock.NextVideoTime(Rate(25, 1));
+  t.now += 10 * kSecondNs;
+  clock.Reset();
+  EXPECT_EQ(clock.CurrentTime(), 0);
+  EXPECT_EQ(clock.NextVideoTime(Rate(25, 1)), std::make_pair(std::int64_t{1}, true));
+  EXPECT_EQ(clock.AudioTime(48000), 0);
+}
+
+}  // namespace
