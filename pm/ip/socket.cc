@@ -1,0 +1,1 @@
+#include "pm/ip/socket.h"

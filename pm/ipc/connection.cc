@@ -1,0 +1,1 @@
+#include "pm/ipc/connection.h"
