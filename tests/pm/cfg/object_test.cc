@@ -231,16 +231,6 @@ TEST(Members, ScalarGivenAnArrayKeepsTheLastElementAndEmptyArrayClears) {
   EXPECT_EQ(m.s.value, "");
 }
 
-TEST(Members, WriteTheirJsonType) {
-  Values m;
-  Json out;
-  m.ToJson(out);
-  EXPECT_TRUE(out["b"].is_boolean());
-  EXPECT_TRUE(out["i"].is_number_integer());
-  EXPECT_TRUE(out["s"].is_string());
-  EXPECT_EQ(out["v"], Json::array({"x", "y"}));
-}
-
 TEST(Members, EnumKeepsValuesTheEnumerationDoesNotName) {
   struct E : pm::cfg::Object {
     E() : Object(nullptr, "", "e", false) {}

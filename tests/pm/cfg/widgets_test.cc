@@ -57,19 +57,6 @@ TEST(WidgetJson, FreshWidgetsWriteEveryKeyWithItsType) {
   EXPECT_TRUE(out["reconnect"]["action"].is_number_integer());
 }
 
-TEST(WidgetJson, ActionCodeAndEnumeratorsHaveTheirCharacterCodes) {
-  EXPECT_EQ(pm::cfg::kActionCustom, 0x63757374);
-  EXPECT_EQ(static_cast<std::int64_t>(pm::cfg::Justify::Left), 108);
-  EXPECT_EQ(static_cast<std::int64_t>(pm::cfg::VisualIndication::None), 0);
-  EXPECT_EQ(static_cast<std::int64_t>(pm::cfg::VisualIndication::Error), 101);
-}
-
-TEST(WidgetJson, ErrorIndicationIsWrittenAsItsCode) {
-  SourceGui gui;
-  gui.status.indication = pm::cfg::VisualIndication::Error;
-  EXPECT_EQ(Write(gui)["status"]["indication"], 101);
-}
-
 // ---------------------------------------------------------------------------
 // What FromJson reads
 
@@ -119,14 +106,6 @@ TEST(WidgetFromJson, ButtonHasNoValueAndReadingChangesNothing) {
   EXPECT_EQ(Write(gui)["reconnect"], before);
   EXPECT_TRUE(gui.reconnect.ValueJson().is_null());
   EXPECT_EQ(gui.reconnect.FindMember("value"), nullptr);
-}
-
-TEST(WidgetFromJson, ValueJsonIsTheValueMembersJson) {
-  SourceGui gui;
-  gui.bandwidth.value = 1;
-  gui.status.value = "x";
-  EXPECT_EQ(gui.bandwidth.ValueJson(), Json(1));
-  EXPECT_EQ(gui.status.ValueJson(), Json("x"));
 }
 
 // ---------------------------------------------------------------------------
