@@ -30,7 +30,9 @@ void Object::ToJson(Json& out) {
   for (Object* child : children_) {
     Json j;
     child->ToJson(j);
-    if (ordered_) j["pm::order"] = index;
+    // A child that writes something other than an object (only a derived
+    // ToJson could) has no place for its order; writing one would throw.
+    if (ordered_ && (j.is_null() || j.is_object())) j["pm::order"] = index;
     out[child->key_] = std::move(j);
     ++index;
   }

@@ -99,6 +99,20 @@ TEST(ObjectToJson, EmptyChildOfOrderedParentStillGetsItsOrder) {
   EXPECT_EQ(out, (Json{{"e", {{"pm::order", 0}}}}));
 }
 
+TEST(ObjectToJson, ChildWritingANonObjectInOrderedParentDoesNotThrow) {
+  struct ArrayChild : pm::cfg::Object {
+    explicit ArrayChild(Object* parent) : Object(parent, "", "arr", false) {}
+    void ToJson(Json& out) override { out = Json::array({1}); }
+  };
+  struct R : pm::cfg::Object {
+    R() : Object(nullptr, "", "r", true) {}
+    ArrayChild child{this};
+  } root;
+  Json out;
+  EXPECT_NO_THROW(root.ToJson(out));
+  EXPECT_EQ(out, (Json{{"arr", {1}}}));
+}
+
 TEST(ObjectToJson, ChildKeyReplacesMemberOfTheSameName) {
   struct R : pm::cfg::Object {
     R() : Object(nullptr, "", "r", false) {}
