@@ -12,7 +12,20 @@
 //
 // Which thread calls this: Send, SendMessage and Close from any thread (they
 // take the connection's lock); ReadFromSocket from one reader thread at a time
-// (it takes no lock).
+// (it takes no lock). WaitReadableConnections from any thread.
+//
+// Closing and the descriptor: Close clears `connected` and shuts the socket
+// down in both directions, which wakes a reader blocked in ReadFromSocket or
+// in WaitReadableConnections (it sees the socket hang up) and a sender blocked
+// in a full socket buffer, and sends the peer its end of stream. The
+// descriptor number itself stays reserved until the Connection is destroyed,
+// that is until its last shared owner lets go: on Linux a closed number can be
+// handed to the next open() at once, and a reader that is still inside a call
+// must never read from an unrelated file. Close never waits behind a sender
+// that is blocked on a peer that does not read.
+//
+// Lock: lock_ guards the socket's writes; nothing else is locked while it is
+// held (it is the innermost lock; the queue producer's lock comes before it).
 
 #include <atomic>
 #include <cstdint>
@@ -38,8 +51,8 @@ class Connection {
   // Connects to 127.0.0.1:port. None on failure (logged).
   static std::unique_ptr<Connection> Open(int port);
 
-  // Marks the connection closed and closes the socket; wakes a reader blocked
-  // in ReadFromSocket.
+  // Marks the connection closed and shuts the socket down; wakes a reader
+  // blocked in ReadFromSocket (see above for the descriptor).
   void Close();
   // Sends the buffers back to back as one write, atomically with respect to
   // other senders. False when not connected or when the write failed.
@@ -48,6 +61,9 @@ class Connection {
   static bool SendMessage(std::shared_ptr<Connection> connection, const std::string& text);
   // Reads exactly `length` bytes. False when not connected, on timeout (the
   // connection stays usable) or when the peer has gone (connected turns false).
+  // Bytes of a block that arrived only in part before the timeout are kept
+  // and begin the next read, so the stream never loses its place. A timeout
+  // of kNoTimeout (INT64_MAX) or 0 waits for ever.
   bool ReadFromSocket(void* destination, std::size_t length, std::int64_t timeoutMs);
 
   bool IsConnected() const;
@@ -60,10 +76,12 @@ class Connection {
 
  private:
   friend class Server;
-  ip::Socket socket_;
+  ip::Socket socket_;  // its descriptor is fixed from Open/Accept until destruction
   std::mutex lock_;  // serialises Send and Close (the socket's writes and its closing)
   std::atomic<bool> connected_{false};
-  std::int64_t receiveTimeoutMs_ = INT64_MAX;  // used by the reader thread only
+  // Reader thread only:
+  std::int64_t receiveTimeoutMs_ = INT64_MAX;  // the SO_RCVTIMEO last applied
+  std::vector<std::uint8_t> carry_;            // start of a block cut short by a timeout
 };
 
 }  // namespace pm::ipc
