@@ -1,0 +1,314 @@
+#include "ndi-loopback/receiver.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+
+#include "ndi-loopback/net.h"
+#include "ndi-loopback/registry.h"
+#include "pm/runtime/log.h"
+#include "pm/runtime/syscall.h"
+#include "pm/runtime/thread_name.h"
+
+namespace ndilb {
+namespace {
+
+constexpr int kSendTimeoutMs = 1000;
+constexpr int kConnectTimeoutMs = 500;
+
+int Slot(std::int32_t type) {
+  switch (type) {
+    case kNdiFrameVideo: return 0;
+    case kNdiFrameAudio: return 1;
+    case kNdiFrameMetadata: return 2;
+    default: return -1;
+  }
+}
+
+int MaxOf(int slot) {
+  return slot == 0 ? Receiver::kMaxVideo : slot == 1 ? Receiver::kMaxAudio : Receiver::kMaxMetadata;
+}
+
+}  // namespace
+
+std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values) {
+  std::string xml = std::string("<ptz_command name=\"") + name + "\"";
+  for (const auto& [key, value] : values) {
+    char number[64];
+    std::snprintf(number, sizeof number, "%.9g", value);
+    xml += std::string(" ") + key + "=\"" + number + "\"";
+  }
+  return xml + "/>";
+}
+
+Receiver::Receiver(const ndi_recv_create& settings)
+    : name_(settings.source_to_connect_to.ndi_name != nullptr ? settings.source_to_connect_to.ndi_name : ""),
+      url_(settings.source_to_connect_to.url_address != nullptr ? settings.source_to_connect_to.url_address : ""),
+      bandwidth_(settings.bandwidth),
+      pool_(std::make_shared<BufferPool>(4)) {
+  wake_fd_ = MakeWakeFd();
+  thread_ = std::thread([this] { Run(); });
+}
+
+Receiver::~Receiver() {
+  stop_ = true;
+  if (wake_fd_ >= 0) Wake(wake_fd_);
+  if (thread_.joinable()) thread_.join();
+  if (wake_fd_ >= 0) ::close(wake_fd_);
+}
+
+std::string Receiver::ResolveUrl() const {
+  // The name wins: a sender that comes back may listen on a new port.
+  if (!name_.empty()) {
+    for (const RegistryEntry& e : ListRegistry()) {
+      if (e.name == name_) return e.url;
+    }
+    return {};
+  }
+  return url_;
+}
+
+void Receiver::Run() {
+  pm::SetThreadName("ndi-lb receiver");
+  while (!stop_) {
+    const std::string url = ResolveUrl();
+    const int fd = url.empty() ? -1 : ConnectTo(url, kConnectTimeoutMs);
+    if (fd >= 0) {
+      Serve(fd);
+      connected_ = false;
+      ptz_ = false;
+    }
+    if (stop_) break;
+    if (wake_fd_ < 0) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(kRetryMs));
+    } else {
+      WaitWake(wake_fd_, kRetryMs);
+    }
+  }
+  pm::ClearThreadName();
+}
+
+void Receiver::Serve(int fd) {
+  TuneConnection(fd, kSendTimeoutMs);
+  {
+    std::lock_guard<std::mutex> lock(write_mutex_);
+    EncodedHead hello = EncodeHello(bandwidth_, tally_.on_program, tally_.on_preview);
+    iovec iov{hello.bytes, hello.size};
+    if (!WriteAll(fd, &iov, 1)) {
+      ::close(fd);
+      return;
+    }
+    fd_ = fd;
+  }
+  Decoder decoder(ReceiverSideLimits(), pool_);
+  bool open = true;
+  while (open && !stop_) {
+    std::span<std::uint8_t> span = decoder.WritableSpan();
+    const ssize_t n = pm::RetryEintr([&] { return ::recv(fd, span.data(), span.size(), MSG_DONTWAIT); });
+    if (n == 0) break;
+    if (n < 0) {
+      if (errno != EAGAIN && errno != EWOULDBLOCK) break;
+      pollfd p[2] = {{fd, POLLIN, 0}, {wake_fd_, POLLIN, 0}};
+      pm::RetryEintr([&] { return ::poll(p, wake_fd_ >= 0 ? 2 : 1, 250); });
+      continue;
+    }
+    if (!decoder.Commit(static_cast<std::size_t>(n))) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: receiver of %s dropped its connection: %s",
+              name_.empty() ? url_.c_str() : name_.c_str(), decoder.error().c_str());
+      break;
+    }
+    while (auto message = decoder.Pop()) {
+      auto item = std::make_unique<Item>();
+      switch (message->type) {
+        case MessageType::Video:
+          if (bandwidth_ == kNdiBandwidthAudioOnly || bandwidth_ == kNdiBandwidthMetadataOnly) continue;
+          item->type = kNdiFrameVideo;
+          break;
+        case MessageType::Audio:
+          if (bandwidth_ == kNdiBandwidthMetadataOnly) continue;
+          item->type = kNdiFrameAudio;
+          break;
+        case MessageType::Metadata:
+        case MessageType::ConnMetadata:
+          item->type = kNdiFrameMetadata;
+          break;
+        case MessageType::Ready:
+          ptz_ = message->ptz_supported;
+          connected_ = true;
+          item->type = kNdiFrameStatusChange;
+          break;
+        default:
+          continue;  // the decoder admits no other type
+      }
+      item->message = std::move(*message);
+      Enqueue(std::move(item));
+    }
+  }
+  {
+    std::lock_guard<std::mutex> lock(write_mutex_);
+    ::close(fd);
+    fd_ = -1;
+  }
+  // Frames of the connection that are still queued stay capturable.
+}
+
+void Receiver::Enqueue(std::unique_ptr<Item> item) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  const int slot = Slot(item->type);
+  if (slot >= 0) {
+    if (queued_[slot] >= MaxOf(slot)) {
+      for (auto it = queue_.begin(); it != queue_.end(); ++it) {
+        if ((*it)->type != item->type) continue;
+        pool_->Release(std::move((*it)->message.payload));
+        queue_.erase(it);
+        --queued_[slot];
+        break;
+      }
+    }
+    ++queued_[slot];
+  }
+  queue_.push_back(std::move(item));
+  cv_.notify_all();
+}
+
+std::int32_t Receiver::Capture(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata,
+                               std::uint32_t timeout_ms) {
+  auto wanted = [&](const Item& item) {
+    switch (item.type) {
+      case kNdiFrameVideo: return video != nullptr;
+      case kNdiFrameAudio: return audio != nullptr;
+      case kNdiFrameMetadata: return metadata != nullptr;
+      default: return true;
+    }
+  };
+  std::unique_lock<std::mutex> lock(mutex_);
+  std::deque<std::unique_ptr<Item>>::iterator found;
+  auto find = [&] {
+    for (found = queue_.begin(); found != queue_.end(); ++found) {
+      if (wanted(**found)) return true;
+    }
+    return false;
+  };
+  if (!cv_.wait_for(lock, std::chrono::milliseconds(timeout_ms), find)) return kNdiFrameNone;
+  std::unique_ptr<Item> item = std::move(*found);
+  queue_.erase(found);
+  const int slot = Slot(item->type);
+  if (slot >= 0) --queued_[slot];
+  const std::int32_t type = item->type;
+  Message& m = item->message;
+  const void* key = nullptr;
+  switch (type) {
+    case kNdiFrameVideo:
+      *video = ndi_video_frame_v2{};
+      video->xres = m.video.xres;
+      video->yres = m.video.yres;
+      video->FourCC = m.video.fourcc;
+      video->frame_rate_N = m.video.frame_rate_N;
+      video->frame_rate_D = m.video.frame_rate_D;
+      video->picture_aspect_ratio = m.video.aspect;
+      video->frame_format_type = m.video.frame_format;
+      video->timecode = m.video.timecode;
+      video->data = m.payload.data();
+      video->line_stride_in_bytes = m.video.line_stride;
+      video->metadata = m.text.empty() ? nullptr : m.text.c_str();
+      video->timestamp = m.video.timestamp;
+      key = video->data;
+      break;
+    case kNdiFrameAudio:
+      *audio = ndi_audio_frame_v2{};
+      audio->sample_rate = m.audio.sample_rate;
+      audio->no_channels = m.audio.channels;
+      audio->no_samples = m.audio.samples;
+      audio->timecode = m.audio.timecode;
+      audio->data = reinterpret_cast<float*>(m.payload.data());
+      audio->channel_stride_in_bytes = m.audio.samples * 4;
+      audio->metadata = m.text.empty() ? nullptr : m.text.c_str();
+      audio->timestamp = m.audio.timestamp;
+      key = audio->data;
+      break;
+    case kNdiFrameMetadata:
+      *metadata = ndi_metadata_frame{};
+      metadata->length = static_cast<int>(m.text.size() + 1);
+      metadata->timecode = m.timecode;
+      metadata->data = m.text.data();
+      key = metadata->data;
+      break;
+    default:
+      return type;  // status change: nothing to hold
+  }
+  held_.emplace(key, std::move(item));
+  return type;
+}
+
+void Receiver::FreeVideo(const ndi_video_frame_v2& frame) {
+  std::unique_ptr<Item> item;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    auto it = held_.find(frame.data);
+    if (it == held_.end() || it->second->type != kNdiFrameVideo) return;
+    item = std::move(it->second);
+    held_.erase(it);
+  }
+  pool_->Release(std::move(item->message.payload));
+}
+
+void Receiver::FreeAudio(const ndi_audio_frame_v2& frame) {
+  std::unique_ptr<Item> item;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    auto it = held_.find(frame.data);
+    if (it == held_.end() || it->second->type != kNdiFrameAudio) return;
+    item = std::move(it->second);
+    held_.erase(it);
+  }
+  pool_->Release(std::move(item->message.payload));
+}
+
+void Receiver::FreeMetadata(const ndi_metadata_frame& frame) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  auto it = held_.find(frame.data);
+  if (it == held_.end() || it->second->type != kNdiFrameMetadata) return;
+  held_.erase(it);
+}
+
+bool Receiver::WriteMessage(const void* head, std::size_t head_size, const std::string& text) {
+  // Called with write_mutex_ held.
+  if (fd_ < 0) return false;
+  iovec iov[2] = {{const_cast<void*>(head), head_size}, {const_cast<char*>(text.data()), text.size()}};
+  if (WriteAll(fd_, iov, 2)) return true;
+  ::shutdown(fd_, SHUT_RDWR);  // the network thread notices and reconnects
+  return false;
+}
+
+bool Receiver::SetTally(const ndi_tally& tally) {
+  std::lock_guard<std::mutex> lock(write_mutex_);
+  tally_ = tally;  // also sent with the hello of every later connection
+  if (!connected_) return false;
+  EncodedHead head = EncodeTally(tally.on_program, tally.on_preview);
+  return WriteMessage(head.bytes, head.size, std::string());
+}
+
+bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
+  if (frame.data == nullptr) return false;
+  const std::string text = frame.length > 0
+                               ? std::string(frame.data, ::strnlen(frame.data, static_cast<std::size_t>(frame.length)))
+                               : std::string(frame.data);
+  if (text.size() > (1u << 20)) return false;
+  std::lock_guard<std::mutex> lock(write_mutex_);
+  if (!connected_) return false;
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, frame.timecode, static_cast<std::uint32_t>(text.size()));
+  return WriteMessage(head.bytes, head.size, text);
+}
+
+bool Receiver::SendPtz(const std::string& xml) {
+  std::lock_guard<std::mutex> lock(write_mutex_);
+  if (!connected_ || !ptz_) return false;
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, 0, static_cast<std::uint32_t>(xml.size()));
+  return WriteMessage(head.bytes, head.size, xml);
+}
+
+}  // namespace ndilb

@@ -1,0 +1,92 @@
+#pragma once
+// The receiving side of the loopback runtime. One network thread per
+// receiver ("ndi-lb receiver") finds the sender by name in the registry,
+// connects, and reads frames straight into pooled buffers; whole frames go
+// into a bounded queue (the oldest frame of a kind is dropped when full) from
+// which Capture hands them out. When the sender goes, the thread looks the
+// name up again every 150 ms and reconnects, also to a new URL.
+//
+// Threads: any thread may call the public operations; the network thread is
+// started by the constructor and joined by the destructor.
+// Lock order: write_mutex_ and mutex_ are never held together.
+#include <atomic>
+#include <condition_variable>
+#include <cstdint>
+#include <deque>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+
+#include "ndi-loopback/wire.h"
+#include "taskndisource/ndi_abi.h"
+
+namespace ndilb {
+
+class Receiver {
+ public:
+  // Depth of the queues between the network and Capture.
+  static constexpr int kMaxVideo = 8;
+  static constexpr int kMaxAudio = 32;
+  static constexpr int kMaxMetadata = 128;
+  // How often a disconnected receiver looks for its sender.
+  static constexpr int kRetryMs = 150;
+
+  explicit Receiver(const ndi_recv_create& settings);
+  ~Receiver();
+  Receiver(const Receiver&) = delete;
+  Receiver& operator=(const Receiver&) = delete;
+
+  int Connections() const { return connected_.load() ? 1 : 0; }
+  std::int32_t Capture(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata,
+                       std::uint32_t timeout_ms);
+  void FreeVideo(const ndi_video_frame_v2& frame);
+  void FreeAudio(const ndi_audio_frame_v2& frame);
+  void FreeMetadata(const ndi_metadata_frame& frame);
+  bool SetTally(const ndi_tally& tally);
+  bool SendMetadata(const ndi_metadata_frame& frame);
+  bool PtzSupported() const { return connected_.load() && ptz_.load(); }
+  // Sends a PTZ command document; false when not connected or the sender
+  // does not accept PTZ.
+  bool SendPtz(const std::string& xml);
+
+ private:
+  struct Item {
+    std::int32_t type = kNdiFrameNone;  // video, audio, metadata or status change
+    Message message;
+  };
+
+  void Run();
+  std::string ResolveUrl() const;
+  // Reads until the connection ends or the receiver stops.
+  void Serve(int fd);
+  void Enqueue(std::unique_ptr<Item> item);
+  bool WriteMessage(const void* head, std::size_t head_size, const std::string& text);
+
+  const std::string name_;
+  const std::string url_;
+  const std::int32_t bandwidth_;
+  const std::shared_ptr<BufferPool> pool_;
+  int wake_fd_ = -1;
+  std::atomic<bool> stop_{false};
+  std::atomic<bool> connected_{false};
+  std::atomic<bool> ptz_{false};
+  std::thread thread_;
+
+  std::mutex write_mutex_;  // guards fd_ (for writes; closed under it) and tally_
+  int fd_ = -1;
+  ndi_tally tally_{false, false};
+
+  mutable std::mutex mutex_;  // guards the queue, the counts and held_
+  std::condition_variable cv_;
+  std::deque<std::unique_ptr<Item>> queue_;
+  int queued_[3] = {0, 0, 0};  // video, audio, metadata items in queue_
+  std::map<const void*, std::unique_ptr<Item>> held_;  // captured, not yet freed
+};
+
+// The PTZ command document of the loopback runtime:
+// <ptz_command name="NAME" key="value" .../> with values printed "%.9g".
+std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values);
+
+}  // namespace ndilb

@@ -1,0 +1,436 @@
+#include "ndi-loopback/sender.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+
+#include "ndi-loopback/net.h"
+#include "ndi-loopback/picture.h"
+#include "ndi-loopback/registry.h"
+#include "pm/runtime/clock.h"
+#include "pm/runtime/log.h"
+#include "pm/runtime/syscall.h"
+#include "pm/runtime/thread_name.h"
+
+namespace ndilb {
+namespace {
+
+constexpr int kSendTimeoutMs = 2000;
+constexpr std::size_t kMaxInbox = 256;
+constexpr std::size_t kMaxConnectionMetadata = 64;
+
+std::string TextOf(const ndi_metadata_frame& frame) {
+  if (frame.data == nullptr) return {};
+  // length counts the terminating zero; stop at the first zero either way.
+  if (frame.length > 0) return std::string(frame.data, ::strnlen(frame.data, static_cast<std::size_t>(frame.length)));
+  return std::string(frame.data);
+}
+
+iovec Iov(const void* p, std::size_t n) { return iovec{const_cast<void*>(p), n}; }
+
+}  // namespace
+
+std::int64_t NowTimestamp() {
+  timespec ts{};
+  ::clock_gettime(CLOCK_REALTIME, &ts);
+  return static_cast<std::int64_t>(ts.tv_sec) * 10'000'000 + ts.tv_nsec / 100;
+}
+
+bool AnnouncesPtz(const std::string& xml) {
+  const std::size_t at = xml.find("<ptz_capabilities");
+  if (at == std::string::npos) return false;
+  const std::size_t end = xml.find('>', at);
+  const std::string element = xml.substr(at, end == std::string::npos ? std::string::npos : end - at);
+  return element.find("supported=\"true\"") != std::string::npos ||
+         element.find("supported='true'") != std::string::npos;
+}
+
+std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
+  std::unique_ptr<Sender> s(new Sender());
+  const std::string short_name = settings.ndi_name != nullptr && settings.ndi_name[0] != '\0'
+                                     ? settings.ndi_name
+                                     : "sender " + std::to_string(::getpid());
+  s->name_ = FullSourceName(short_name);
+  s->clock_video_ = settings.clock_video;
+  int port = 0;
+  s->listen_fd_ = ListenLoopback(&port);
+  if (s->listen_fd_ < 0) return nullptr;
+  s->wake_fd_ = MakeWakeFd();
+  if (s->wake_fd_ < 0) {
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: eventfd failed: %s", pm::ErrnoText(errno).c_str());
+    return nullptr;
+  }
+  s->url_ = "127.0.0.1:" + std::to_string(port);
+  s->thread_ = std::thread([p = s.get()] { p->Run(); });
+  s->registry_path_ = WriteRegistryEntry(RegistryEntry{s->name_, s->url_, static_cast<int>(::getpid())});
+  if (s->registry_path_.empty()) return nullptr;  // the destructor stops the thread
+  return s;
+}
+
+Sender::~Sender() {
+  RemoveRegistryEntry(registry_path_);
+  stop_ = true;
+  if (wake_fd_ >= 0) Wake(wake_fd_);
+  if (thread_.joinable()) thread_.join();
+  std::vector<std::shared_ptr<Conn>> conns;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    conns.swap(conns_);
+  }
+  for (auto& c : conns) {
+    std::lock_guard<std::mutex> lock(c->write_mutex);
+    if (c->fd >= 0) ::close(c->fd);
+    c->fd = -1;
+    c->dead = true;
+  }
+  if (listen_fd_ >= 0) ::close(listen_fd_);
+  if (wake_fd_ >= 0) ::close(wake_fd_);
+}
+
+void Sender::Run() {
+  pm::SetThreadName("ndi-lb sender");
+  std::vector<pollfd> fds;
+  std::vector<std::shared_ptr<Conn>> polled;
+  while (!stop_) {
+    fds.clear();
+    polled.clear();
+    fds.push_back({wake_fd_, POLLIN, 0});
+    fds.push_back({listen_fd_, POLLIN, 0});
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      polled = conns_;
+    }
+    for (auto& c : polled) fds.push_back({c->fd, POLLIN, 0});
+    const int n = pm::RetryEintr([&] { return ::poll(fds.data(), fds.size(), -1); });
+    if (n < 0) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: sender poll failed: %s", pm::ErrnoText(errno).c_str());
+      break;
+    }
+    if (fds[0].revents != 0) Drain(wake_fd_);
+    if (stop_) break;
+    if (fds[1].revents != 0) Accept();
+    for (std::size_t i = 0; i < polled.size(); ++i) {
+      if (fds[i + 2].revents == 0) continue;
+      if (!ReadFrom(*polled[i])) Drop(polled[i]);
+    }
+  }
+  pm::ClearThreadName();
+}
+
+void Sender::Accept() {
+  const int fd = pm::RetryEintr([&] { return ::accept4(listen_fd_, nullptr, nullptr, SOCK_CLOEXEC); });
+  if (fd < 0) return;
+  TuneConnection(fd, kSendTimeoutMs);
+  std::lock_guard<std::mutex> lock(mutex_);
+  conns_.push_back(std::make_shared<Conn>(fd));
+}
+
+bool Sender::ReadFrom(Conn& conn) {
+  for (;;) {
+    std::span<std::uint8_t> span = conn.decoder.WritableSpan();
+    if (span.empty()) return false;
+    const ssize_t n = pm::RetryEintr([&] { return ::recv(conn.fd, span.data(), span.size(), MSG_DONTWAIT); });
+    if (n == 0) return false;
+    if (n < 0) return errno == EAGAIN || errno == EWOULDBLOCK;
+    if (!conn.decoder.Commit(static_cast<std::size_t>(n))) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a receiver connection: %s", name_.c_str(),
+              conn.decoder.error().c_str());
+      return false;
+    }
+    while (auto message = conn.decoder.Pop()) {
+      if (!Handle(conn, *message)) return false;
+    }
+  }
+}
+
+bool Sender::Handle(Conn& conn, Message& m) {
+  if (!conn.hello) {
+    if (m.type != MessageType::Hello) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a receiver that did not say hello", name_.c_str());
+      return false;
+    }
+    conn.hello = true;
+    conn.bandwidth = m.bandwidth;
+    std::vector<std::string> metadata;
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      metadata = conn_metadata_;
+      conn.on_program = m.on_program;
+      conn.on_preview = m.on_preview;
+    }
+    bool ptz = false;
+    {
+      std::lock_guard<std::mutex> lock(conn.write_mutex);
+      for (const std::string& xml : metadata) {
+        ptz = ptz || AnnouncesPtz(xml);
+        EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, NowTimestamp(), static_cast<std::uint32_t>(xml.size()));
+        iovec iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+        if (conn.dead || !WriteAll(conn.fd, iov, 2)) return false;
+      }
+      EncodedHead ready = EncodeReady(ptz);
+      iovec iov[1] = {Iov(ready.bytes, ready.size)};
+      if (conn.dead || !WriteAll(conn.fd, iov, 1)) return false;
+    }
+    std::lock_guard<std::mutex> lock(mutex_);
+    conn.active = true;
+    ++active_count_;
+    UpdateTallyLocked();
+    cv_.notify_all();
+    return true;
+  }
+  switch (m.type) {
+    case MessageType::Tally: {
+      std::lock_guard<std::mutex> lock(mutex_);
+      conn.on_program = m.on_program;
+      conn.on_preview = m.on_preview;
+      UpdateTallyLocked();
+      return true;
+    }
+    case MessageType::Metadata: {
+      std::lock_guard<std::mutex> lock(mutex_);
+      if (inbox_.size() >= kMaxInbox) {
+        inbox_.pop_front();
+        pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped metadata nobody captured", name_.c_str());
+      }
+      inbox_.emplace_back(std::move(m.text), m.timecode);
+      cv_.notify_all();
+      return true;
+    }
+    default:
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a receiver that said hello twice", name_.c_str());
+      return false;
+  }
+}
+
+void Sender::UpdateTallyLocked() {
+  ndi_tally combined{false, false};
+  for (const auto& c : conns_) {
+    if (!c->active) continue;
+    combined.on_program = combined.on_program || c->on_program;
+    combined.on_preview = combined.on_preview || c->on_preview;
+  }
+  if (combined.on_program != tally_.on_program || combined.on_preview != tally_.on_preview) {
+    tally_ = combined;
+    ++tally_version_;
+    cv_.notify_all();
+  }
+}
+
+void Sender::Drop(const std::shared_ptr<Conn>& conn) {
+  {
+    std::lock_guard<std::mutex> lock(conn->write_mutex);
+    if (conn->fd >= 0) ::close(conn->fd);
+    conn->fd = -1;
+    conn->dead = true;
+  }
+  std::lock_guard<std::mutex> lock(mutex_);
+  for (auto it = conns_.begin(); it != conns_.end(); ++it) {
+    if (*it != conn) continue;
+    conns_.erase(it);
+    if (conn->active) --active_count_;
+    conn->active = false;
+    UpdateTallyLocked();
+    cv_.notify_all();
+    break;
+  }
+}
+
+bool Sender::WriteTo(Conn& conn, iovec* iov, int count) {
+  std::lock_guard<std::mutex> lock(conn.write_mutex);
+  if (conn.dead) return false;
+  if (WriteAll(conn.fd, iov, count)) return true;
+  // The I/O thread sees the shut-down socket and drops the connection.
+  conn.dead = true;
+  ::shutdown(conn.fd, SHUT_RDWR);
+  return false;
+}
+
+std::vector<std::shared_ptr<Sender::Conn>> Sender::ActiveConns() {
+  std::vector<std::shared_ptr<Conn>> out;
+  std::lock_guard<std::mutex> lock(mutex_);
+  for (const auto& c : conns_) {
+    if (c->active) out.push_back(c);
+  }
+  return out;
+}
+
+void Sender::PaceVideo(const ndi_video_frame_v2& frame) {
+  if (!clock_video_ || frame.frame_rate_N <= 0 || frame.frame_rate_D <= 0) return;
+  const std::int64_t period =
+      static_cast<std::int64_t>(1'000'000'000.0 * frame.frame_rate_D / frame.frame_rate_N);
+  std::int64_t wake = 0;
+  {
+    std::lock_guard<std::mutex> lock(pace_mutex_);
+    const std::int64_t now = pm::SteadyNowNs();
+    // Behind by more than a frame (a stall, or the first frame): start over.
+    if (next_video_ns_ == 0 || now > next_video_ns_ + period || next_video_ns_ > now + 2 * period) {
+      next_video_ns_ = now;
+    }
+    wake = next_video_ns_;
+    next_video_ns_ += period;
+  }
+  const std::int64_t now = pm::SteadyNowNs();
+  if (wake > now) std::this_thread::sleep_for(std::chrono::nanoseconds(wake - now));
+}
+
+void Sender::SendVideo(const ndi_video_frame_v2& frame) {
+  if (frame.data == nullptr) return;
+  const int stride = frame.line_stride_in_bytes > 0 ? frame.line_stride_in_bytes
+                                                    : DefaultStride(frame.FourCC, frame.xres);
+  const std::uint64_t bytes = PictureBytes(frame.FourCC, frame.xres, frame.yres, stride);
+  if (bytes == 0) {
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a video frame it cannot describe (%dx%d, stride %d)",
+            name_.c_str(), frame.xres, frame.yres, stride);
+    return;
+  }
+  PaceVideo(frame);
+  VideoInfo info;
+  info.xres = frame.xres;
+  info.yres = frame.yres;
+  info.fourcc = frame.FourCC;
+  info.frame_rate_N = frame.frame_rate_N;
+  info.frame_rate_D = frame.frame_rate_D;
+  info.aspect = frame.picture_aspect_ratio;
+  info.frame_format = frame.frame_format_type;
+  info.line_stride = stride;
+  info.timestamp = NowTimestamp();
+  info.timecode = frame.timecode == kNdiSendTimecodeSynthesize ? info.timestamp : frame.timecode;
+  const std::string text = frame.metadata != nullptr ? std::string(frame.metadata) : std::string();
+  if (text.size() > (1u << 20)) return;
+
+  const auto conns = ActiveConns();
+  HalfPicture half;
+  bool half_done = false, half_ok = false;
+  for (const auto& c : conns) {
+    if (c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly) {
+      EncodedHead head = EncodeVideo(info, static_cast<std::uint32_t>(text.size()), bytes);
+      iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(frame.data, bytes)};
+      WriteTo(*c, iov, 3);
+    } else if (c->bandwidth == kNdiBandwidthLowest) {
+      if (!half_done) {
+        half_done = true;
+        half_ok = HalvePicture(frame.FourCC, frame.xres, frame.yres, stride, frame.data, &half);
+      }
+      if (!half_ok) continue;
+      VideoInfo small = info;
+      small.xres = half.xres;
+      small.yres = half.yres;
+      small.line_stride = half.stride;
+      EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), half.bytes.size());
+      iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()),
+                      Iov(half.bytes.data(), half.bytes.size())};
+      WriteTo(*c, iov, 3);
+    }
+    // audio only and metadata only: no video
+  }
+}
+
+void Sender::SendAudio(const ndi_audio_frame_v2& frame) {
+  if (frame.data == nullptr || frame.sample_rate <= 0 || frame.no_channels <= 0 ||
+      frame.no_channels > kMaxAudioChannels || frame.no_samples <= 0) {
+    return;
+  }
+  const std::size_t plane = static_cast<std::size_t>(frame.no_samples) * 4;
+  const std::size_t stride = frame.channel_stride_in_bytes > 0 ? static_cast<std::size_t>(frame.channel_stride_in_bytes) : plane;
+  if (stride < plane) {
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped an audio frame whose channel stride is too short",
+            name_.c_str());
+    return;
+  }
+  const std::uint64_t bytes = plane * static_cast<std::size_t>(frame.no_channels);
+  AudioInfo info;
+  info.sample_rate = frame.sample_rate;
+  info.channels = frame.no_channels;
+  info.samples = frame.no_samples;
+  info.timestamp = NowTimestamp();
+  info.timecode = frame.timecode == kNdiSendTimecodeSynthesize ? info.timestamp : frame.timecode;
+  const std::string text = frame.metadata != nullptr ? std::string(frame.metadata) : std::string();
+  if (text.size() > (1u << 20)) return;
+  const auto conns = ActiveConns();
+  if (conns.empty()) return;
+  // Channels padded apart are packed once; packed ones go out as they are.
+  std::vector<std::uint8_t> packed;
+  const std::uint8_t* data = reinterpret_cast<const std::uint8_t*>(frame.data);
+  if (stride != plane) {
+    packed.resize(bytes);
+    for (int c = 0; c < frame.no_channels; ++c) {
+      std::memcpy(packed.data() + plane * static_cast<std::size_t>(c), data + stride * static_cast<std::size_t>(c), plane);
+    }
+    data = packed.data();
+  }
+  for (const auto& c : conns) {
+    if (c->bandwidth == kNdiBandwidthMetadataOnly) continue;
+    EncodedHead head = EncodeAudio(info, static_cast<std::uint32_t>(text.size()), bytes);
+    iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(data, bytes)};
+    WriteTo(*c, iov, 3);
+  }
+}
+
+void Sender::SendMetadata(const ndi_metadata_frame& frame) {
+  const std::string text = TextOf(frame);
+  if (text.size() > (1u << 20)) return;
+  const std::int64_t timecode = frame.timecode == kNdiSendTimecodeSynthesize ? NowTimestamp() : frame.timecode;
+  for (const auto& c : ActiveConns()) {
+    EncodedHead head = EncodeMetadata(MessageType::Metadata, timecode, static_cast<std::uint32_t>(text.size()));
+    iovec iov[2] = {Iov(head.bytes, head.size), Iov(text.data(), text.size())};
+    WriteTo(*c, iov, 2);
+  }
+}
+
+std::int32_t Sender::Capture(ndi_metadata_frame* frame, std::uint32_t timeout_ms) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (!cv_.wait_for(lock, std::chrono::milliseconds(timeout_ms), [&] { return !inbox_.empty(); })) {
+    return kNdiFrameNone;
+  }
+  if (frame == nullptr) return kNdiFrameNone;
+  auto [text, timecode] = std::move(inbox_.front());
+  inbox_.pop_front();
+  Held held;
+  held.data = std::make_unique<char[]>(text.size() + 1);
+  std::memcpy(held.data.get(), text.data(), text.size());
+  held.data[text.size()] = '\0';
+  frame->data = held.data.get();
+  frame->length = static_cast<int>(text.size() + 1);
+  frame->timecode = timecode;
+  held_.emplace(frame->data, std::move(held));
+  return kNdiFrameMetadata;
+}
+
+void Sender::FreeMetadata(const ndi_metadata_frame& frame) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  held_.erase(frame.data);
+}
+
+bool Sender::GetTally(ndi_tally* tally, std::uint32_t timeout_ms) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  const bool changed = cv_.wait_for(lock, std::chrono::milliseconds(timeout_ms),
+                                    [&] { return tally_version_ != tally_reported_; });
+  tally_reported_ = tally_version_;
+  if (tally != nullptr) *tally = tally_;
+  return changed;
+}
+
+int Sender::GetConnections(std::uint32_t timeout_ms) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  cv_.wait_for(lock, std::chrono::milliseconds(timeout_ms), [&] { return active_count_ > 0; });
+  return active_count_;
+}
+
+void Sender::AddConnectionMetadata(const ndi_metadata_frame& frame) {
+  std::string text = TextOf(frame);
+  if (text.empty() || text.size() > (1u << 20)) return;
+  std::lock_guard<std::mutex> lock(mutex_);
+  if (conn_metadata_.size() >= kMaxConnectionMetadata) return;
+  conn_metadata_.push_back(std::move(text));
+}
+
+void Sender::ClearConnectionMetadata() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  conn_metadata_.clear();
+}
+
+}  // namespace ndilb

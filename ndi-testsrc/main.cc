@@ -1,0 +1,318 @@
+// ndi-testsrc: an NDI sender of test pictures and sound, written only against
+// the NDI C interface (taskndisource/ndi_abi.h), so that it runs unchanged on
+// any runtime that exports it. Every event it sees is one JSON line on stdout.
+#include <signal.h>
+#include <tinyxml2.h>
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <atomic>
+#include <chrono>
+#include <cmath>
+#include <cstdio>
+#include <cstring>
+#include <mutex>
+#include <nlohmann/json.hpp>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "ndi-testsrc/pattern.h"
+#include "taskndisource/ndi_abi.h"
+
+namespace {
+
+std::atomic<bool> g_stop{false};
+
+void OnSignal(int) { g_stop = true; }
+
+struct Options {
+  std::string name;
+  int width = 1280;
+  int height = 720;
+  std::string fps = "30/1";
+  std::string format = "uyvy";
+  std::string pattern = "bars";
+  int audio_rate = 48000;
+  int audio_channels = 2;
+  int audio_samples = 0;  // 0: one video frame's worth
+  bool no_audio = false;
+  bool ptz = false;
+  std::string model;
+  std::int64_t frames = -1;
+  double seconds = -1;
+};
+
+std::mutex g_out_mutex;  // guards stdout
+void Emit(const nlohmann::json& event) {
+  const std::string line = event.dump() + "\n";
+  std::lock_guard<std::mutex> lock(g_out_mutex);
+  std::fwrite(line.data(), 1, line.size(), stdout);
+  std::fflush(stdout);
+}
+
+bool ParseRate(const std::string& text, int* n, int* d) {
+  int a = 0, b = 1;
+  char slash = 0;
+  const int got = std::sscanf(text.c_str(), "%d%c%d", &a, &slash, &b);
+  if (got == 1) b = 1;
+  else if (got != 3 || slash != '/') return false;
+  if (a < 0 || b <= 0) return false;
+  *n = a;
+  *d = b;
+  return true;
+}
+
+std::string UpperHost() {
+  char host[256] = {};
+  if (::gethostname(host, sizeof host - 1) != 0 || host[0] == '\0') std::strcpy(host, "localhost");
+  std::string s = host;
+  for (char& c : s) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+  return s;
+}
+
+// Our own URL, as discovery sees it: the entry of our name that was not there
+// before the sender was made.
+std::string FindOwnUrl(const std::string& full_name, const std::set<std::string>& before) {
+  ndi_find_create settings{true, nullptr, nullptr};
+  void* finder = NDIlib_find_create_v2(&settings);
+  if (finder == nullptr) return {};
+  std::string url;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(2);
+  while (url.empty() && std::chrono::steady_clock::now() < deadline) {
+    std::uint32_t count = 0;
+    const ndi_source* sources = NDIlib_find_get_current_sources(finder, &count);
+    for (std::uint32_t i = 0; i < count; ++i) {
+      if (sources[i].ndi_name == nullptr || sources[i].url_address == nullptr) continue;
+      if (full_name == sources[i].ndi_name && before.count(sources[i].url_address) == 0) url = sources[i].url_address;
+    }
+    if (url.empty()) NDIlib_find_wait_for_sources(finder, 100);
+  }
+  NDIlib_find_destroy(finder);
+  return url;
+}
+
+std::set<std::string> UrlsOf(const std::string& full_name) {
+  std::set<std::string> urls;
+  ndi_find_create settings{true, nullptr, nullptr};
+  void* finder = NDIlib_find_create_v2(&settings);
+  if (finder == nullptr) return urls;
+  std::uint32_t count = 0;
+  const ndi_source* sources = NDIlib_find_get_current_sources(finder, &count);
+  for (std::uint32_t i = 0; i < count; ++i) {
+    if (sources[i].ndi_name != nullptr && sources[i].url_address != nullptr && full_name == sources[i].ndi_name) {
+      urls.insert(sources[i].url_address);
+    }
+  }
+  NDIlib_find_destroy(finder);
+  return urls;
+}
+
+// One metadata text from a receiver: a PTZ command or plain metadata.
+void ReportMetadata(const std::string& xml) {
+  tinyxml2::XMLDocument doc;
+  if (doc.Parse(xml.c_str(), xml.size()) == tinyxml2::XML_SUCCESS && doc.RootElement() != nullptr &&
+      std::strcmp(doc.RootElement()->Name(), "ptz_command") == 0) {
+    const tinyxml2::XMLElement* root = doc.RootElement();
+    const char* command = root->Attribute("name");
+    nlohmann::json values = nlohmann::json::object();
+    for (const tinyxml2::XMLAttribute* a = root->FirstAttribute(); a != nullptr; a = a->Next()) {
+      if (std::strcmp(a->Name(), "name") == 0) continue;
+      double v = 0;
+      if (a->QueryDoubleValue(&v) == tinyxml2::XML_SUCCESS) {
+        values[a->Name()] = v;
+      } else {
+        values[a->Name()] = a->Value();
+      }
+    }
+    Emit({{"event", "ptz"}, {"command", command != nullptr ? command : ""}, {"values", values}, {"xml", xml}});
+    return;
+  }
+  Emit({{"event", "metadata"}, {"xml", xml}});
+}
+
+// Reports what receivers send back until `done`.
+void WatchEvents(void* sender, const std::atomic<bool>& done) {
+  int connections = 0;
+  while (!done) {
+    ndi_metadata_frame frame{};
+    if (NDIlib_send_capture(sender, &frame, 20) == kNdiFrameMetadata) {
+      std::string xml;
+      if (frame.data != nullptr && frame.length > 0) {
+        xml.assign(frame.data, ::strnlen(frame.data, static_cast<std::size_t>(frame.length)));
+      }
+      NDIlib_send_free_metadata(sender, &frame);
+      ReportMetadata(xml);
+    }
+    ndi_tally tally{};
+    if (NDIlib_send_get_tally(sender, &tally, 0)) {
+      Emit({{"event", "tally"}, {"program", tally.on_program}, {"preview", tally.on_preview}});
+    }
+    const int now = NDIlib_send_get_no_connections(sender, 0);
+    if (now != connections) {
+      connections = now;
+      Emit({{"event", "connections"}, {"count", now}});
+    }
+  }
+}
+
+// What one video frame looks like. Kept per frame so that a stream can later
+// change its size mid-way.
+struct Geometry {
+  std::uint32_t fourcc = 0;
+  int width = 0;
+  int height = 0;
+  bool operator==(const Geometry&) const = default;
+};
+
+int Run(const Options& o) {
+  int rate_n = 0, rate_d = 1;
+  if (!ParseRate(o.fps, &rate_n, &rate_d)) {
+    std::fprintf(stderr, "ndi-testsrc: bad --fps %s (N or N/D)\n", o.fps.c_str());
+    return 2;
+  }
+  const Geometry geometry{ndits::FourCCFromName(o.format), o.width, o.height};
+  std::vector<ndits::Plane> planes = ndits::PictureLayout(geometry.fourcc, geometry.width, geometry.height);
+  if (planes.empty()) {
+    std::fprintf(stderr, "ndi-testsrc: %s cannot be %dx%d\n", o.format.c_str(), o.width, o.height);
+    return 2;
+  }
+  const bool ramp = o.pattern == "ramp";
+  int audio_samples = o.audio_samples;
+  if (audio_samples <= 0) {
+    audio_samples = rate_n > 0 ? static_cast<int>(static_cast<std::int64_t>(o.audio_rate) * rate_d / rate_n) : 1600;
+    audio_samples = std::max(1, audio_samples);
+  }
+
+  if (!NDIlib_initialize()) {
+    std::fprintf(stderr, "ndi-testsrc: the NDI runtime did not initialise\n");
+    return 1;
+  }
+  const std::string full_name = UpperHost() + " (" + o.name + ")";
+  const std::set<std::string> before = UrlsOf(full_name);
+  ndi_send_create settings{o.name.c_str(), nullptr, rate_n > 0, false};
+  void* sender = NDIlib_send_create(&settings);
+  if (sender == nullptr) {
+    std::fprintf(stderr, "ndi-testsrc: cannot create the sender\n");
+    NDIlib_destroy();
+    return 1;
+  }
+  auto add_connection_metadata = [&](const std::string& xml) {
+    std::vector<char> text(xml.begin(), xml.end());
+    text.push_back('\0');
+    ndi_metadata_frame frame{static_cast<int>(text.size()), kNdiSendTimecodeSynthesize, text.data()};
+    NDIlib_send_add_connection_metadata(sender, &frame);
+  };
+  if (!o.model.empty()) {
+    tinyxml2::XMLDocument doc;
+    tinyxml2::XMLElement* product = doc.NewElement("ndi_product");
+    product->SetAttribute("model_name", o.model.c_str());
+    doc.InsertFirstChild(product);
+    tinyxml2::XMLPrinter printer(nullptr, true);
+    doc.Print(&printer);
+    add_connection_metadata(printer.CStr());
+  }
+  if (o.ptz) add_connection_metadata("<ptz_capabilities supported=\"true\"/>");
+
+  Emit({{"event", "ready"}, {"name", full_name}, {"url", FindOwnUrl(full_name, before)}});
+
+  std::atomic<bool> done{false};
+  std::thread events([&] { WatchEvents(sender, done); });
+
+  std::vector<std::uint8_t> picture(ndits::PictureSize(planes));
+  const ndits::Bars bars(geometry.fourcc, geometry.width, geometry.height);
+  const int channels = o.audio_channels;
+  const int channel_stride = (audio_samples + 16) * 4;  // padded apart, as capture cards do
+  std::vector<float> audio(static_cast<std::size_t>(channel_stride / 4) * channels);
+  std::int64_t samples_sent = 0;
+
+  const auto start = std::chrono::steady_clock::now();
+  std::int64_t n = 0;
+  while (!g_stop) {
+    if (o.frames >= 0 && n >= o.frames) break;
+    if (o.seconds >= 0 && std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count() >= o.seconds) {
+      break;
+    }
+    if (!o.no_audio && channels > 0) {
+      // Sound keeps pace with the pictures: everything due by the end of frame n.
+      const std::int64_t due = rate_n > 0 ? (n + 1) * o.audio_rate * rate_d / rate_n : samples_sent + audio_samples;
+      while (samples_sent + audio_samples <= due) {
+        for (int c = 0; c < channels; ++c) {
+          float* out = audio.data() + static_cast<std::size_t>(c) * (channel_stride / 4);
+          for (int s = 0; s < audio_samples; ++s) {
+            const std::int64_t t = samples_sent + s;
+            out[s] = ramp ? ndits::AudioRampSample(t, c)
+                          : 0.25f * static_cast<float>(std::sin(2.0 * M_PI * 1000.0 * static_cast<double>(t) / o.audio_rate));
+          }
+        }
+        ndi_audio_frame_v2 frame{};
+        frame.sample_rate = o.audio_rate;
+        frame.no_channels = channels;
+        frame.no_samples = audio_samples;
+        frame.timecode = kNdiSendTimecodeSynthesize;
+        frame.data = audio.data();
+        frame.channel_stride_in_bytes = channel_stride;
+        NDIlib_send_send_audio_v2(sender, &frame);
+        samples_sent += audio_samples;
+      }
+    }
+    if (ramp) {
+      ndits::FillRamp(planes, n, picture.data());
+    } else {
+      bars.Fill(n, picture.data());
+    }
+    ndi_video_frame_v2 frame{};
+    frame.xres = geometry.width;
+    frame.yres = geometry.height;
+    frame.FourCC = geometry.fourcc;
+    frame.frame_rate_N = rate_n > 0 ? rate_n : 60;
+    frame.frame_rate_D = rate_n > 0 ? rate_d : 1;
+    frame.picture_aspect_ratio = static_cast<float>(geometry.width) / static_cast<float>(geometry.height);
+    frame.frame_format_type = kNdiFrameFormatProgressive;
+    frame.timecode = kNdiSendTimecodeSynthesize;
+    frame.data = picture.data();
+    frame.line_stride_in_bytes = planes[0].stride;
+    NDIlib_send_send_video_v2(sender, &frame);  // paced by the runtime when clock_video is set
+    ++n;
+  }
+
+  done = true;
+  events.join();
+  NDIlib_send_destroy(sender);  // removes the sender from discovery
+  NDIlib_destroy();
+  Emit({{"event", "exit"}, {"frames", n}});
+  return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options o;
+  CLI::App app{"ndi-testsrc: an NDI sender of test pictures and sound"};
+  app.add_option("--name", o.name, "NDI source name (the part in parentheses)")->required();
+  app.add_option("--width", o.width, "picture width")->check(CLI::Range(2, 16384));
+  app.add_option("--height", o.height, "picture height")->check(CLI::Range(2, 16384));
+  app.add_option("--fps", o.fps, "frame rate N or N/D; 0 = as fast as possible");
+  app.add_option("--format", o.format, "picture format")
+      ->check(CLI::IsMember({"uyvy", "uyva", "nv12", "i420", "yv12", "bgra", "bgrx", "rgba", "rgbx"}));
+  app.add_option("--pattern", o.pattern, "test pattern")->check(CLI::IsMember({"bars", "ramp"}));
+  app.add_option("--audio-rate", o.audio_rate, "audio sample rate")->check(CLI::Range(1, 384000));
+  app.add_option("--audio-channels", o.audio_channels, "audio channels")->check(CLI::Range(1, 1024));
+  app.add_option("--audio-samples", o.audio_samples, "samples per audio frame (default: one video frame)")
+      ->check(CLI::Range(1, 1 << 20));
+  app.add_flag("--no-audio", o.no_audio, "send no audio");
+  app.add_flag("--ptz", o.ptz, "accept PTZ commands (reported as events)");
+  app.add_option("--model", o.model, "model name sent as connection metadata");
+  auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")->check(CLI::NonNegativeNumber);
+  auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")->check(CLI::NonNegativeNumber);
+  frames->excludes(seconds);
+  CLI11_PARSE(app, argc, argv);
+
+  struct sigaction action {};
+  action.sa_handler = OnSignal;
+  sigemptyset(&action.sa_mask);
+  sigaction(SIGTERM, &action, nullptr);
+  sigaction(SIGINT, &action, nullptr);
+  return Run(o);
+}

@@ -1,0 +1,602 @@
+// The loopback runtime across processes: a child ndi-testsrc sends, the test
+// receives through the NDI C interface. Each case has its own registry folder.
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <cstring>
+#include <fstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "child.h"
+#include "ndi-loopback/registry.h"
+#include "ndi-loopback/wire.h"
+#include "ndi-testsrc/pattern.h"
+#include "support/wait.h"
+#include "taskndisource/ndi_abi.h"
+
+namespace {
+
+using namespace std::chrono_literals;
+using ndilbtest::TestSource;
+using nlohmann::json;
+
+std::vector<std::string> SourceNames() {
+  void* finder = NDIlib_find_create_v2(nullptr);
+  std::uint32_t count = 0;
+  const ndi_source* sources = NDIlib_find_get_current_sources(finder, &count);
+  std::vector<std::string> names;
+  for (std::uint32_t i = 0; i < count; ++i) names.push_back(std::string(sources[i].ndi_name) + "@" + sources[i].url_address);
+  NDIlib_find_destroy(finder);
+  return names;
+}
+
+bool Listed(const std::string& name) {
+  for (const std::string& n : SourceNames()) {
+    if (n.rfind(name + "@", 0) == 0) return true;
+  }
+  return false;
+}
+
+// A receiver that frees what it captures unless told to keep it.
+class Receiver {
+ public:
+  explicit Receiver(const std::string& name, std::int32_t bandwidth = kNdiBandwidthHighest, const char* url = nullptr) {
+    ndi_recv_create settings{};
+    settings.source_to_connect_to.ndi_name = name.empty() ? nullptr : name.c_str();
+    settings.source_to_connect_to.url_address = url;
+    settings.color_format = kNdiColorUyvyBgra;
+    settings.bandwidth = bandwidth;
+    handle_ = NDIlib_recv_create_v2(&settings);
+  }
+  ~Receiver() { NDIlib_recv_destroy(handle_); }
+  void* get() const { return handle_; }
+  int Connections() const { return NDIlib_recv_get_no_connections(handle_); }
+  bool WaitConnected(std::chrono::milliseconds timeout = 5s) const {
+    return pmtest::WaitFor([&] { return Connections() == 1; }, timeout);
+  }
+  // Captures until a frame of `type` arrives (others are freed); false on timeout.
+  bool CaptureType(std::int32_t type, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
+                   std::chrono::milliseconds timeout = 5s) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      ndi_video_frame_v2 vv{};
+      ndi_audio_frame_v2 aa{};
+      ndi_metadata_frame mm{};
+      const std::int32_t got = NDIlib_recv_capture_v2(handle_, &vv, &aa, &mm, 100);
+      if (got == type) {
+        if (v != nullptr) *v = vv;
+        if (a != nullptr) *a = aa;
+        if (m != nullptr) *m = mm;
+        if (got == kNdiFrameStatusChange) return true;
+        if (v == nullptr && got == kNdiFrameVideo) NDIlib_recv_free_video_v2(handle_, &vv);
+        if (a == nullptr && got == kNdiFrameAudio) NDIlib_recv_free_audio_v2(handle_, &aa);
+        if (m == nullptr && got == kNdiFrameMetadata) NDIlib_recv_free_metadata(handle_, &mm);
+        return true;
+      }
+      if (got == kNdiFrameVideo) NDIlib_recv_free_video_v2(handle_, &vv);
+      if (got == kNdiFrameAudio) NDIlib_recv_free_audio_v2(handle_, &aa);
+      if (got == kNdiFrameMetadata) NDIlib_recv_free_metadata(handle_, &mm);
+    }
+    return false;
+  }
+
+ private:
+  void* handle_ = nullptr;
+};
+
+std::vector<std::string> Args(const std::string& name, std::initializer_list<std::string> more) {
+  std::vector<std::string> a = {"--name", name};
+  a.insert(a.end(), more);
+  return a;
+}
+
+auto IsEvent(const std::string& kind) {
+  return [kind](const json& e) { return e.value("event", "") == kind; };
+}
+
+class Loopback : public ::testing::Test {
+ protected:
+  ndilbtest::RegistryDir dir_;
+};
+
+// --- discovery ------------------------------------------------------------
+
+TEST_F(Loopback, DiscoveryShowsASenderAndLosesItWithinOneSecondOfItsExit) {
+  TestSource src(Args("Disc", {"--width", "16", "--height", "8", "--fps", "10"}));
+  ASSERT_TRUE(src.WaitReady());
+  EXPECT_NE(src.name().find(" (Disc)"), std::string::npos);
+  EXPECT_EQ(src.url().rfind("127.0.0.1:", 0), 0u) << src.url();
+  EXPECT_TRUE(pmtest::WaitFor([&] { return Listed(src.name()); }, 1s));
+  src.Signal(SIGTERM);
+  EXPECT_TRUE(pmtest::WaitFor([&] { return !Listed(src.name()); }, 1s));
+  EXPECT_EQ(src.Wait(), 0) << "SIGTERM ends the sender cleanly";
+}
+
+TEST_F(Loopback, DiscoveryLosesAKilledSenderWithinOneSecondEvenBeforeItIsReaped) {
+  TestSource src(Args("Killed", {"--width", "16", "--height", "8", "--fps", "10"}));
+  ASSERT_TRUE(src.WaitReady());
+  void* finder = NDIlib_find_create_v2(nullptr);
+  std::uint32_t count = 0;
+  NDIlib_find_get_current_sources(finder, &count);
+  EXPECT_EQ(count, 1u);
+  src.Signal(SIGKILL);  // leaves its entry behind, and a zombie until reaped
+  EXPECT_TRUE(NDIlib_find_wait_for_sources(finder, 1000)) << "the change is seen within a second";
+  NDIlib_find_get_current_sources(finder, &count);
+  EXPECT_EQ(count, 0u);
+  EXPECT_FALSE(NDIlib_find_wait_for_sources(finder, 100)) << "no change, no wake-up";
+  NDIlib_find_destroy(finder);
+}
+
+TEST_F(Loopback, DiscoverySkipsMalformedEntriesAndEntriesOfDeadProcesses) {
+  pid_t dead = fork();
+  if (dead == 0) _exit(0);
+  ASSERT_GT(dead, 0);
+  waitpid(dead, nullptr, 0);
+  auto write = [&](const std::string& file, const std::string& text) {
+    std::ofstream(dir_.path() + "/" + file) << text;
+  };
+  write("1-1.ndi", "garbage\n");
+  write("2-2.ndi", "ndi-loopback 1\nname=NO PID\nurl=127.0.0.1:1\n");
+  write("3-3.ndi", std::string(10000, 'x'));
+  write("4-4.ndi", "ndi-loopback 1\nname=DEAD (x)\nurl=127.0.0.1:4\npid=" + std::to_string(dead) + "\n");
+  write("5-5.ndi", "ndi-loopback 1\nname=ALIVE (x)\nurl=127.0.0.1:5\npid=" + std::to_string(getpid()) + "\n");
+  write("notes.txt", "ndi-loopback 1\nname=OTHER FILE\nurl=127.0.0.1:6\npid=" + std::to_string(getpid()) + "\n");
+  EXPECT_EQ(SourceNames(), std::vector<std::string>{"ALIVE (x)@127.0.0.1:5"});
+}
+
+// --- video, audio -------------------------------------------------------------
+
+TEST_F(Loopback, RampFramesArriveIntactInEveryFormat) {
+  for (const std::string format : {"uyvy", "uyva", "nv12", "i420", "yv12", "bgra", "bgrx", "rgba", "rgbx"}) {
+    SCOPED_TRACE(format);
+    TestSource src(Args("Ramp " + format, {"--width", "64", "--height", "36", "--fps", "100", "--format", format,
+                                           "--pattern", "ramp", "--no-audio", "--seconds", "10"}));
+    ASSERT_TRUE(src.WaitReady());
+    Receiver rx(src.name());
+    std::int64_t last = -1, last_stamp = 0;
+    for (int i = 0; i < 5; ++i) {
+      ndi_video_frame_v2 v{};
+      ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &v, nullptr, nullptr));
+      EXPECT_EQ(v.FourCC, ndits::FourCCFromName(format)) << "delivered in the sender's format";
+      EXPECT_EQ(v.xres, 64);
+      EXPECT_EQ(v.yres, 36);
+      EXPECT_EQ(v.frame_rate_N, 100);
+      std::int64_t n = -1;
+      EXPECT_EQ(ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, &n), "");
+      EXPECT_GT(n, last);
+      last = n;
+      // The sender's clock, in 100 ns units.
+      const std::int64_t now = std::chrono::duration_cast<std::chrono::microseconds>(
+                                   std::chrono::system_clock::now().time_since_epoch()).count() * 10;
+      EXPECT_GT(v.timestamp, last_stamp);
+      EXPECT_LT(std::llabs(now - v.timestamp), 50'000'000) << "within 5 s of now";
+      last_stamp = v.timestamp;
+      NDIlib_recv_free_video_v2(rx.get(), &v);
+    }
+  }
+}
+
+TEST_F(Loopback, AudioArrivesPlanarAndInterleavesThroughTheUtility) {
+  TestSource src(Args("Audio", {"--width", "16", "--height", "8", "--fps", "50", "--pattern", "ramp",
+                                "--audio-channels", "3", "--audio-samples", "480", "--seconds", "10"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver rx(src.name());
+  std::int64_t expect_next = -1;
+  for (int f = 0; f < 4; ++f) {
+    ndi_audio_frame_v2 a{};
+    ASSERT_TRUE(rx.CaptureType(kNdiFrameAudio, nullptr, &a, nullptr));
+    ASSERT_EQ(a.no_channels, 3);
+    ASSERT_EQ(a.no_samples, 480);
+    EXPECT_EQ(a.sample_rate, 48000);
+    ASSERT_GE(a.channel_stride_in_bytes, 480 * 4);
+    auto at = [&](int c, int s) {
+      return reinterpret_cast<const float*>(reinterpret_cast<const std::uint8_t*>(a.data) +
+                                            static_cast<std::size_t>(c) * a.channel_stride_in_bytes)[s];
+    };
+    const std::int64_t start = static_cast<std::int64_t>(at(0, 0) * 1024.0f);
+    if (expect_next >= 0) {
+      EXPECT_EQ(start, expect_next % 1024) << "audio frames follow each other";
+    }
+    expect_next = start + 480;
+    for (int c = 0; c < 3; ++c) {
+      for (int s = 0; s < 480; ++s) ASSERT_EQ(at(c, s), ndits::AudioRampSample(start + s, c)) << c << "/" << s;
+    }
+    std::vector<float> out(3 * 480);
+    ndi_audio_frame_interleaved_32f dst{a.sample_rate, 3, 480, 0, out.data()};
+    NDIlib_util_audio_to_interleaved_32f_v2(&a, &dst);
+    for (int s = 0; s < 480; ++s) {
+      for (int c = 0; c < 3; ++c) ASSERT_EQ(out[static_cast<std::size_t>(s) * 3 + c], at(c, s));
+    }
+    NDIlib_recv_free_audio_v2(rx.get(), &a);
+  }
+}
+
+// --- metadata, tally, PTZ -------------------------------------------------------
+
+TEST_F(Loopback, ConnectionMetadataComesFirstAndMetadataReachesTheSender) {
+  TestSource src(Args("Meta", {"--width", "16", "--height", "8", "--fps", "10", "--model", "Studio Cam 9"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver rx(src.name());
+  ndi_metadata_frame m{};
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameMetadata, nullptr, nullptr, &m));
+  EXPECT_EQ(std::string(m.data), "<ndi_product model_name=\"Studio Cam 9\"/>");
+  EXPECT_EQ(m.length, static_cast<int>(std::strlen(m.data) + 1));
+  NDIlib_recv_free_metadata(rx.get(), &m);
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr));
+  EXPECT_EQ(rx.Connections(), 1);
+
+  const std::string xml = "<metadata>\n    <receiver_info name=\"x &amp; y\"/>\n</metadata>\n";
+  ndi_metadata_frame out{static_cast<int>(xml.size() + 1), 0, const_cast<char*>(xml.c_str())};
+  EXPECT_TRUE(NDIlib_recv_send_metadata(rx.get(), &out));
+  json got = src.WaitEvent(IsEvent("metadata"));
+  EXPECT_EQ(got.value("xml", ""), xml) << "exactly as sent";
+  EXPECT_FALSE(src.WaitEvent(IsEvent("ptz"), 100ms).is_object()) << "plain metadata is not a PTZ command";
+}
+
+TEST_F(Loopback, MetadataFromAnInProcessSenderReachesTheReceiver) {
+  ndi_send_create settings{"Local", nullptr, false, false};
+  void* sender = NDIlib_send_create(&settings);
+  ASSERT_NE(sender, nullptr);
+  Receiver rx(ndilb::FullSourceName("Local"));
+  ASSERT_TRUE(rx.WaitConnected());
+  EXPECT_EQ(NDIlib_send_get_no_connections(sender, 1000), 1);
+  std::string xml = "<shot value=\"1\"/>";
+  ndi_metadata_frame frame{static_cast<int>(xml.size() + 1), 77, xml.data()};
+  NDIlib_send_send_metadata(sender, &frame);
+  ndi_metadata_frame m{};
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameMetadata, nullptr, nullptr, &m));
+  EXPECT_EQ(std::string(m.data), xml);
+  EXPECT_EQ(m.timecode, 77);
+  NDIlib_recv_free_metadata(rx.get(), &m);
+  NDIlib_send_destroy(sender);
+  EXPECT_TRUE(pmtest::WaitFor([&] { return rx.Connections() == 0; }, 1s));
+}
+
+TEST_F(Loopback, TallyChangesReachTheSender) {
+  TestSource src(Args("Tally", {"--width", "16", "--height", "8", "--fps", "10"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver rx(src.name());
+  ndi_tally program{true, false};
+  EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_recv_set_tally(rx.get(), &program); }, 5s))
+      << "accepted once connected";
+  std::size_t from = 0;
+  json t = src.WaitEvent(IsEvent("tally"), 5s, &from);
+  EXPECT_EQ(t.value("program", false), true);
+  EXPECT_EQ(t.value("preview", true), false);
+  ndi_tally preview{false, true};
+  EXPECT_TRUE(NDIlib_recv_set_tally(rx.get(), &preview));
+  t = src.WaitEvent(IsEvent("tally"), 5s, &from);
+  EXPECT_EQ(t.value("program", true), false);
+  EXPECT_EQ(t.value("preview", false), true);
+  EXPECT_TRUE(src.WaitEvent(IsEvent("connections")).is_object());
+}
+
+TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncement) {
+  for (bool ptz : {false, true}) {
+    SCOPED_TRACE(ptz);
+    std::vector<std::string> args = Args(ptz ? "With PTZ" : "No PTZ", {"--width", "16", "--height", "8", "--fps", "10"});
+    if (ptz) args.push_back("--ptz");
+    TestSource src(args);
+    ASSERT_TRUE(src.WaitReady());
+    Receiver rx(src.name());
+    EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.get())) << "unknown before the connection";
+    ASSERT_TRUE(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr));
+    EXPECT_EQ(NDIlib_recv_ptz_is_supported(rx.get()), ptz);
+    EXPECT_EQ(NDIlib_recv_ptz_zoom(rx.get(), 0.5f), ptz);
+  }
+}
+
+TEST_F(Loopback, EveryPtzCallReachesTheSenderAsItsOwnCommand) {
+  TestSource src(Args("Ptz", {"--width", "16", "--height", "8", "--fps", "10", "--ptz"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver rx(src.name());
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr));
+  ASSERT_TRUE(NDIlib_recv_ptz_is_supported(rx.get()));
+  void* r = rx.get();
+  EXPECT_TRUE(NDIlib_recv_ptz_recall_preset(r, 3, 0.25f));
+  EXPECT_TRUE(NDIlib_recv_ptz_store_preset(r, 7));
+  EXPECT_TRUE(NDIlib_recv_ptz_pan_tilt(r, -0.5f, 0.75f));
+  EXPECT_TRUE(NDIlib_recv_ptz_pan_tilt_speed(r, 0.125f, -1.0f));
+  EXPECT_TRUE(NDIlib_recv_ptz_zoom(r, 0.5f));
+  EXPECT_TRUE(NDIlib_recv_ptz_focus(r, 0.3f));
+  EXPECT_TRUE(NDIlib_recv_ptz_focus_speed(r, -0.2f));
+  EXPECT_TRUE(NDIlib_recv_ptz_auto_focus(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_exposure_auto(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_exposure_manual(r, 0.6f));
+  EXPECT_TRUE(NDIlib_recv_ptz_white_balance_auto(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_white_balance_indoor(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_white_balance_outdoor(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_white_balance_oneshot(r));
+  EXPECT_TRUE(NDIlib_recv_ptz_white_balance_manual(r, 0.4f, 0.9f));
+  const std::vector<std::pair<std::string, json>> expected = {
+      {"recall_preset", {{"preset", 3}, {"speed", 0.25}}},
+      {"store_preset", {{"preset", 7}}},
+      {"pan_tilt", {{"pan", -0.5}, {"tilt", 0.75}}},
+      {"pan_tilt_speed", {{"pan_speed", 0.125}, {"tilt_speed", -1.0}}},
+      {"zoom", {{"zoom", 0.5}}},
+      {"focus", {{"focus", 0.3f}}},
+      {"focus_speed", {{"focus_speed", -0.2f}}},
+      {"auto_focus", json::object()},
+      {"exposure_auto", json::object()},
+      {"exposure_manual", {{"level", 0.6f}}},
+      {"white_balance_auto", json::object()},
+      {"white_balance_indoor", json::object()},
+      {"white_balance_outdoor", json::object()},
+      {"white_balance_oneshot", json::object()},
+      {"white_balance_manual", {{"red", 0.4f}, {"blue", 0.9f}}},
+  };
+  std::size_t from = 0;
+  for (const auto& [command, values] : expected) {
+    json e = src.WaitEvent(IsEvent("ptz"), 5s, &from);
+    ASSERT_TRUE(e.is_object()) << "missing " << command;
+    EXPECT_EQ(e.value("command", ""), command);
+    ASSERT_EQ(e["values"].size(), values.size()) << command;
+    for (const auto& [key, value] : values.items()) {
+      EXPECT_FLOAT_EQ(e["values"].value(key, 1e9f), value.get<float>()) << command << " " << key;
+    }
+  }
+}
+
+// --- connection life --------------------------------------------------------------
+
+TEST_F(Loopback, ReceiverReconnectsByItselfWhenItsSenderReturnsAtANewUrl) {
+  auto args = Args("Phoenix", {"--width", "32", "--height", "16", "--fps", "50", "--pattern", "ramp", "--no-audio"});
+  auto first = std::make_unique<TestSource>(args);
+  ASSERT_TRUE(first->WaitReady());
+  const std::string name = first->name(), first_url = first->url();
+  Receiver rx(name);
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, nullptr, nullptr, nullptr));
+  EXPECT_EQ(rx.Connections(), 1);
+
+  first->Signal(SIGKILL);  // mid-stream, possibly mid-frame
+  EXPECT_TRUE(pmtest::WaitFor([&] { return rx.Connections() == 0; }, 1s));
+  first.reset();
+  ndi_tally tally{true, false};
+  EXPECT_FALSE(NDIlib_recv_set_tally(rx.get(), &tally)) << "nobody to take it";
+  // Whatever was queued is whole; then nothing while the sender is away.
+  for (;;) {
+    ndi_video_frame_v2 v{};
+    const std::int32_t got = NDIlib_recv_capture_v2(rx.get(), &v, nullptr, nullptr, 300);
+    if (got == kNdiFrameNone) break;
+    if (got == kNdiFrameVideo) {
+      EXPECT_EQ(ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, nullptr), "");
+      NDIlib_recv_free_video_v2(rx.get(), &v);
+    }
+  }
+
+  TestSource second(args);
+  ASSERT_TRUE(second.WaitReady());
+  EXPECT_EQ(second.name(), name);
+  EXPECT_NE(second.url(), first_url);
+  EXPECT_TRUE(rx.WaitConnected(2s));
+  ndi_video_frame_v2 v{};
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &v, nullptr, nullptr));
+  EXPECT_EQ(ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, nullptr), "");
+  NDIlib_recv_free_video_v2(rx.get(), &v);
+  EXPECT_TRUE(NDIlib_recv_set_tally(rx.get(), &tally));
+  EXPECT_TRUE(second.WaitEvent(IsEvent("tally")).is_object());
+}
+
+TEST_F(Loopback, BandwidthAudioOnlyCarriesNoVideoAndLowestHalvesThePicture) {
+  TestSource src(Args("Bw", {"--width", "64", "--height", "36", "--fps", "50", "--pattern", "ramp", "--audio-samples",
+                             "480", "--seconds", "10"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver audio_only(src.name(), kNdiBandwidthAudioOnly);
+  Receiver metadata_only(src.name(), kNdiBandwidthMetadataOnly);
+  Receiver lowest(src.name(), kNdiBandwidthLowest);
+  ndi_video_frame_v2 v{};
+  ASSERT_TRUE(lowest.CaptureType(kNdiFrameVideo, &v, nullptr, nullptr));
+  EXPECT_EQ(v.xres, 32);
+  EXPECT_EQ(v.yres, 18);
+  EXPECT_EQ(v.FourCC, kNdiFourCCUYVY);
+  NDIlib_recv_free_video_v2(lowest.get(), &v);
+
+  int audio = 0;
+  const auto until = std::chrono::steady_clock::now() + 600ms;
+  while (std::chrono::steady_clock::now() < until) {
+    ndi_video_frame_v2 vv{};
+    ndi_audio_frame_v2 aa{};
+    ndi_metadata_frame mm{};
+    std::int32_t got = NDIlib_recv_capture_v2(audio_only.get(), &vv, &aa, &mm, 50);
+    EXPECT_NE(got, kNdiFrameVideo) << "audio only";
+    if (got == kNdiFrameAudio) {
+      ++audio;
+      NDIlib_recv_free_audio_v2(audio_only.get(), &aa);
+    }
+    got = NDIlib_recv_capture_v2(metadata_only.get(), &vv, &aa, &mm, 0);
+    EXPECT_TRUE(got != kNdiFrameVideo && got != kNdiFrameAudio) << "metadata only";
+  }
+  EXPECT_GT(audio, 5);
+  EXPECT_EQ(metadata_only.Connections(), 1);
+}
+
+TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact) {
+  ndi_send_create settings{"Flood", nullptr, false, false};
+  void* sender = NDIlib_send_create(&settings);
+  ASSERT_NE(sender, nullptr);
+  Receiver rx(ndilb::FullSourceName("Flood"));
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr));
+  const auto planes = ndits::PictureLayout(kNdiFourCCUYVY, 64, 16);
+  std::vector<std::uint8_t> picture(ndits::PictureSize(planes));
+  auto send = [&](std::int64_t n) {
+    ndits::FillRamp(planes, n, picture.data());
+    ndi_video_frame_v2 f{};
+    f.xres = 64;
+    f.yres = 16;
+    f.FourCC = kNdiFourCCUYVY;
+    f.frame_rate_N = 30;
+    f.frame_rate_D = 1;
+    f.data = picture.data();
+    f.line_stride_in_bytes = 128;
+    NDIlib_send_send_video_v2(sender, &f);
+  };
+  // Two frames held by the caller while twenty more go through.
+  send(0);
+  send(1);
+  ndi_video_frame_v2 held[2]{};
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &held[0], nullptr, nullptr));
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &held[1], nullptr, nullptr));
+  for (int n = 2; n < 22; ++n) send(n);
+  std::this_thread::sleep_for(200ms);  // let the network thread queue everything
+  std::vector<std::int64_t> numbers;
+  for (;;) {
+    ndi_video_frame_v2 v{};
+    if (NDIlib_recv_capture_v2(rx.get(), &v, nullptr, nullptr, 100) != kNdiFrameVideo) break;
+    std::int64_t n = -1;
+    EXPECT_EQ(ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, &n), "");
+    numbers.push_back(n);
+    NDIlib_recv_free_video_v2(rx.get(), &v);
+  }
+  ASSERT_FALSE(numbers.empty());
+  EXPECT_LE(numbers.size(), 8u) << "bounded";
+  EXPECT_EQ(numbers.back(), 21) << "the newest frame is kept";
+  for (std::size_t i = 1; i < numbers.size(); ++i) EXPECT_EQ(numbers[i], numbers[i - 1] + 1);
+  for (int i = 0; i < 2; ++i) {
+    std::int64_t n = -1;
+    EXPECT_EQ(ndits::CheckRamp(held[i].FourCC, held[i].xres, held[i].yres, held[i].line_stride_in_bytes, held[i].data, &n), "");
+    EXPECT_EQ(n, i);
+  }
+  NDIlib_recv_free_video_v2(rx.get(), &held[1]);
+  NDIlib_recv_free_video_v2(rx.get(), &held[0]);
+  NDIlib_recv_free_video_v2(rx.get(), &held[0]);  // a second free is ignored
+  NDIlib_send_destroy(sender);
+}
+
+// --- bad input --------------------------------------------------------------------
+
+TEST_F(Loopback, ReceiverForAMissingSourceWaitsWithNoConnections) {
+  Receiver rx("NOWHERE (nothing)");
+  const auto start = std::chrono::steady_clock::now();
+  ndi_video_frame_v2 v{};
+  EXPECT_EQ(NDIlib_recv_capture_v2(rx.get(), &v, nullptr, nullptr, 250), kNdiFrameNone);
+  EXPECT_GE(std::chrono::steady_clock::now() - start, 240ms) << "capture waits its timeout";
+  EXPECT_EQ(rx.Connections(), 0);
+  ndi_tally tally{true, true};
+  EXPECT_FALSE(NDIlib_recv_set_tally(rx.get(), &tally));
+  std::string xml = "<x/>";
+  ndi_metadata_frame m{5, 0, xml.data()};
+  EXPECT_FALSE(NDIlib_recv_send_metadata(rx.get(), &m));
+  EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.get()));
+
+  Receiver by_url("", kNdiBandwidthHighest, "127.0.0.1:1");
+  EXPECT_EQ(NDIlib_recv_capture_v2(by_url.get(), &v, nullptr, nullptr, 100), kNdiFrameNone);
+  EXPECT_EQ(by_url.Connections(), 0);
+}
+
+int RawConnect(const std::string& url) {
+  const std::size_t colon = url.rfind(':');
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  addr.sin_port = htons(static_cast<std::uint16_t>(std::stoi(url.substr(colon + 1))));
+  inet_pton(AF_INET, "127.0.0.1", &addr.sin_addr);
+  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// True when the peer closes the socket within the timeout (whatever it sent first).
+bool ClosedByPeer(int fd, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  char buffer[65536];
+  while (std::chrono::steady_clock::now() < deadline) {
+    pollfd p{fd, POLLIN, 0};
+    if (poll(&p, 1, 50) <= 0) continue;
+    const ssize_t n = recv(fd, buffer, sizeof buffer, 0);
+    if (n <= 0) return true;
+  }
+  return false;
+}
+
+TEST_F(Loopback, GarbageOnASendersPortDropsOnlyThatConnection) {
+  TestSource src(Args("Guarded", {"--width", "16", "--height", "8", "--fps", "20", "--pattern", "ramp"}));
+  ASSERT_TRUE(src.WaitReady());
+  Receiver rx(src.name());
+  ASSERT_TRUE(rx.WaitConnected());
+
+  const int garbage = RawConnect(src.url());
+  ASSERT_GE(garbage, 0);
+  const std::string junk(100, 'Z');
+  ASSERT_EQ(send(garbage, junk.data(), junk.size(), MSG_NOSIGNAL), 100);
+  EXPECT_TRUE(ClosedByPeer(garbage, 2s));
+  close(garbage);
+
+  const int oversize = RawConnect(src.url());
+  ASSERT_GE(oversize, 0);
+  ndilb::EncodedHead hello = ndilb::EncodeHello(100, false, false);
+  ndilb::EncodedHead meta = ndilb::EncodeMetadata(ndilb::MessageType::Metadata, 0, 0xFFFFFFF0u);
+  ASSERT_GT(send(oversize, hello.bytes, hello.size, MSG_NOSIGNAL), 0);
+  ASSERT_GT(send(oversize, meta.bytes, meta.size, MSG_NOSIGNAL), 0);
+  EXPECT_TRUE(ClosedByPeer(oversize, 2s)) << "a 4 GB text is refused, not awaited";
+  close(oversize);
+
+  // The real receiver kept its connection and its frames.
+  EXPECT_EQ(rx.Connections(), 1);
+  ndi_video_frame_v2 v{};
+  ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &v, nullptr, nullptr));
+  EXPECT_EQ(ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, nullptr), "");
+  NDIlib_recv_free_video_v2(rx.get(), &v);
+  src.Signal(SIGTERM);
+  EXPECT_EQ(src.Wait(), 0);
+}
+
+TEST_F(Loopback, GarbageFromASenderDropsTheConnectionAndTheReceiverTriesAgain) {
+  // A fake sender: a listening socket in this process with a registry entry.
+  int port = 0;
+  const int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  inet_pton(AF_INET, "127.0.0.1", &addr.sin_addr);
+  socklen_t len = sizeof addr;
+  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  ASSERT_EQ(listen(listener, 4), 0);
+  getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
+  port = ntohs(addr.sin_port);
+  std::ofstream(dir_.path() + "/fake.ndi") << "ndi-loopback 1\nname=FAKE (x)\nurl=127.0.0.1:" << port
+                                           << "\npid=" << getpid() << "\n";
+  Receiver rx("FAKE (x)");
+
+  auto accept_one = [&] {
+    pollfd p{listener, POLLIN, 0};
+    if (poll(&p, 1, 3000) != 1) return -1;
+    return accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+  };
+  // Garbage, then a frame header with an impossible payload length.
+  std::vector<std::vector<std::uint8_t>> attacks;
+  attacks.emplace_back(64, 0xEE);
+  ndilb::VideoInfo info;
+  info.xres = 16;
+  info.yres = 8;
+  info.fourcc = kNdiFourCCUYVY;
+  info.line_stride = 32;
+  ndilb::EncodedHead huge = ndilb::EncodeVideo(info, 0, std::uint64_t{1} << 40);
+  attacks.emplace_back(huge.bytes, huge.bytes + huge.size);
+  ndilb::EncodedHead liar = ndilb::EncodeVideo(info, 0, 16 * 8 * 2 + 1);
+  attacks.emplace_back(liar.bytes, liar.bytes + liar.size);
+  for (const auto& attack : attacks) {
+    const int fd = accept_one();
+    ASSERT_GE(fd, 0) << "the receiver (re)connects";
+    ASSERT_EQ(send(fd, attack.data(), attack.size(), MSG_NOSIGNAL), static_cast<ssize_t>(attack.size()));
+    EXPECT_TRUE(ClosedByPeer(fd, 2s));
+    close(fd);
+    EXPECT_EQ(rx.Connections(), 0);
+  }
+  ndi_video_frame_v2 v{};
+  ndi_metadata_frame m{};
+  EXPECT_EQ(NDIlib_recv_capture_v2(rx.get(), &v, nullptr, &m, 50), kNdiFrameNone) << "nothing half-made is delivered";
+  close(listener);
+}
+
+}  // namespace

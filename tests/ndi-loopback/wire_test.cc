@@ -1,0 +1,244 @@
+// The loopback runtime's pieces that need no socket: the wire decoder, the
+// registry entry format, picture halving and the audio interleaving call.
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <vector>
+
+#include "ndi-loopback/picture.h"
+#include "ndi-loopback/registry.h"
+#include "ndi-loopback/wire.h"
+#include "taskndisource/ndi_abi.h"
+
+namespace {
+
+using ndilb::Decoder;
+using ndilb::MessageType;
+
+std::vector<std::uint8_t> VideoBytes(int w, int h, std::uint8_t fill, const std::string& text = "") {
+  ndilb::VideoInfo info;
+  info.xres = w;
+  info.yres = h;
+  info.fourcc = kNdiFourCCUYVY;
+  info.frame_rate_N = 30;
+  info.frame_rate_D = 1;
+  info.line_stride = w * 2;
+  info.timestamp = 1234567;
+  const std::size_t payload = static_cast<std::size_t>(w) * 2 * h;
+  ndilb::EncodedHead head = ndilb::EncodeVideo(info, static_cast<std::uint32_t>(text.size()), payload);
+  std::vector<std::uint8_t> bytes(head.bytes, head.bytes + head.size);
+  bytes.insert(bytes.end(), text.begin(), text.end());
+  bytes.insert(bytes.end(), payload, fill);
+  return bytes;
+}
+
+std::vector<std::uint8_t> MetadataBytes(const std::string& text, MessageType type = MessageType::Metadata) {
+  ndilb::EncodedHead head = ndilb::EncodeMetadata(type, 42, static_cast<std::uint32_t>(text.size()));
+  std::vector<std::uint8_t> bytes(head.bytes, head.bytes + head.size);
+  bytes.insert(bytes.end(), text.begin(), text.end());
+  return bytes;
+}
+
+Decoder ReceiverDecoder() { return Decoder(ndilb::ReceiverSideLimits(), std::make_shared<ndilb::BufferPool>(2)); }
+
+TEST(WireDecoder, WholeMessagesComeOutWhateverTheFragmentation) {
+  std::vector<std::uint8_t> stream = VideoBytes(8, 4, 0xAB, "<frame/>");
+  const auto meta = MetadataBytes("<hello/>");
+  stream.insert(stream.end(), meta.begin(), meta.end());
+  for (std::size_t chunk : {stream.size(), std::size_t{1}, std::size_t{7}, std::size_t{25}}) {
+    Decoder d = ReceiverDecoder();
+    std::size_t messages = 0;
+    for (std::size_t at = 0; at < stream.size(); at += chunk) {
+      const std::size_t n = std::min(chunk, stream.size() - at);
+      ASSERT_TRUE(d.Feed(stream.data() + at, n)) << d.error();
+      while (auto m = d.Pop()) {
+        ++messages;
+        if (m->type == MessageType::Video) {
+          // Never handed out before its last byte arrived.
+          EXPECT_GE(at + n, VideoBytes(8, 4, 0xAB, "<frame/>").size());
+          EXPECT_EQ(m->video.xres, 8);
+          EXPECT_EQ(m->video.timestamp, 1234567);
+          EXPECT_EQ(m->text, "<frame/>");
+          ASSERT_EQ(m->payload.size(), 64u);
+          for (std::size_t i = 0; i < 64; ++i) ASSERT_EQ(m->payload.data()[i], 0xAB);
+        } else {
+          EXPECT_EQ(m->type, MessageType::Metadata);
+          EXPECT_EQ(m->text, "<hello/>");
+          EXPECT_EQ(m->timecode, 42);
+          EXPECT_EQ(at + n, stream.size());
+        }
+      }
+    }
+    EXPECT_EQ(messages, 2u) << "chunk " << chunk;
+  }
+}
+
+TEST(WireDecoder, RejectsBadHeadersBeforeAllocatingAndStaysFailed) {
+  struct Case {
+    const char* what;
+    std::function<void(std::vector<std::uint8_t>&)> spoil;
+  };
+  const std::vector<Case> cases = {
+      {"magic", [](auto& b) { b[0] ^= 0xFF; }},
+      {"type", [](auto& b) { b[4] = 99; }},
+      {"info size", [](auto& b) { b[6] = 47; }},
+      {"reserved", [](auto& b) { b[12] = 1; }},
+      {"oversize text", [](auto& b) { b[8] = b[9] = b[10] = b[11] = 0xFF; }},
+      {"oversize payload", [](auto& b) { b[23] = 0x7F; }},
+      {"payload not matching the picture", [](auto& b) { b[16] += 1; }},
+      {"impossible picture", [](auto& b) { b[24 + 3] = 0x80; }},  // negative width
+  };
+  for (const Case& c : cases) {
+    std::vector<std::uint8_t> bytes = VideoBytes(8, 4, 1);
+    c.spoil(bytes);
+    Decoder d = ReceiverDecoder();
+    EXPECT_FALSE(d.Feed(bytes.data(), bytes.size())) << c.what;
+    EXPECT_TRUE(d.failed()) << c.what;
+    EXPECT_FALSE(d.Pop().has_value()) << c.what;
+    EXPECT_TRUE(d.WritableSpan().empty()) << c.what;
+    const auto good = MetadataBytes("<x/>");
+    EXPECT_FALSE(d.Feed(good.data(), good.size())) << c.what << ": a failed decoder must stay failed";
+  }
+}
+
+TEST(WireDecoder, EachEndAcceptsOnlyItsOwnMessages) {
+  Decoder sender_side(ndilb::SenderSideLimits(), nullptr);
+  const auto video = VideoBytes(8, 4, 0);
+  EXPECT_FALSE(sender_side.Feed(video.data(), video.size())) << "receivers send no video";
+
+  Decoder receiver_side = ReceiverDecoder();
+  ndilb::EncodedHead hello = ndilb::EncodeHello(100, true, false);
+  EXPECT_FALSE(receiver_side.Feed(hello.bytes, hello.size)) << "senders send no hello";
+
+  Decoder ok(ndilb::SenderSideLimits(), nullptr);
+  ASSERT_TRUE(ok.Feed(hello.bytes, hello.size));
+  ndilb::EncodedHead tally = ndilb::EncodeTally(false, true);
+  ASSERT_TRUE(ok.Feed(tally.bytes, tally.size));
+  auto h = ok.Pop();
+  ASSERT_TRUE(h.has_value());
+  EXPECT_EQ(h->bandwidth, 100);
+  EXPECT_TRUE(h->on_program);
+  auto t = ok.Pop();
+  ASSERT_TRUE(t.has_value());
+  EXPECT_FALSE(t->on_program);
+  EXPECT_TRUE(t->on_preview);
+}
+
+TEST(WireDecoder, AudioPayloadMustMatchChannelsTimesSamples) {
+  ndilb::AudioInfo info;
+  info.sample_rate = 48000;
+  info.channels = 2;
+  info.samples = 10;
+  ndilb::EncodedHead bad = ndilb::EncodeAudio(info, 0, 2 * 10 * 4 + 4);
+  Decoder d = ReceiverDecoder();
+  EXPECT_FALSE(d.Feed(bad.bytes, bad.size));
+  info.channels = ndilb::kMaxAudioChannels + 1;
+  ndilb::EncodedHead many = ndilb::EncodeAudio(info, 0, static_cast<std::uint64_t>(info.channels) * 10 * 4);
+  Decoder d2 = ReceiverDecoder();
+  EXPECT_FALSE(d2.Feed(many.bytes, many.size));
+}
+
+TEST(RegistryEntry, MalformedEntriesAreRefused) {
+  ndilb::RegistryEntry e;
+  EXPECT_TRUE(ndilb::ParseRegistryEntry("ndi-loopback 1\nname=H (a)\nurl=127.0.0.1:5\npid=7\n", &e));
+  EXPECT_EQ(e.name, "H (a)");
+  EXPECT_EQ(e.pid, 7);
+  for (const char* bad : {"", "garbage", "ndi-loopback 2\nname=a\nurl=b\npid=1\n", "ndi-loopback 1\nname=a\nurl=b\n",
+                          "ndi-loopback 1\nname=a\nurl=b\npid=x1\n", "ndi-loopback 1\nname=a\nurl=b\npid=1",
+                          "ndi-loopback 1\nname=\nurl=b\npid=1\n", "ndi-loopback 1\nname=a\nurl=b\npid=99999999999\n"}) {
+    EXPECT_FALSE(ndilb::ParseRegistryEntry(bad, &e)) << bad;
+  }
+}
+
+TEST(RegistryEntry, FullNameUpperCasesTheHost) {
+  const std::string full = ndilb::FullSourceName("Cam 1");
+  ASSERT_GT(full.size(), 8u);
+  EXPECT_EQ(full.substr(full.size() - 8), " (Cam 1)");
+  for (char c : full.substr(0, full.size() - 8)) EXPECT_FALSE(c >= 'a' && c <= 'z') << full;
+}
+
+TEST(HalvePicture, UyvyKeepsEveryOtherPixelWithItsChroma) {
+  // 8x2 UYVY: pixel x has Y = 10 + x; macropixel m has U = 100 + m, V = 200 + m.
+  std::vector<std::uint8_t> in(16 * 2);
+  for (int y = 0; y < 2; ++y) {
+    for (int m = 0; m < 4; ++m) {
+      std::uint8_t* p = in.data() + y * 16 + 4 * m;
+      p[0] = static_cast<std::uint8_t>(100 + m);
+      p[1] = static_cast<std::uint8_t>(10 + 2 * m);
+      p[2] = static_cast<std::uint8_t>(200 + m);
+      p[3] = static_cast<std::uint8_t>(11 + 2 * m);
+    }
+  }
+  ndilb::HalfPicture half;
+  ASSERT_TRUE(ndilb::HalvePicture(kNdiFourCCUYVY, 8, 2, 16, in.data(), &half));
+  EXPECT_EQ(half.xres, 4);
+  EXPECT_EQ(half.yres, 1);
+  EXPECT_EQ(half.bytes, (std::vector<std::uint8_t>{100, 10, 200, 12, 102, 14, 202, 16}));
+  EXPECT_FALSE(ndilb::HalvePicture(kNdiFourCCUYVY, 2, 1, 4, in.data(), &half)) << "nothing left to halve";
+}
+
+TEST(PictureBytes, RefusesImpossiblePictures) {
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCUYVY, 1920, 1080, 3840), 1920u * 2 * 1080);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCNV12, 4, 4, 4), 24u);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCI420, 4, 4, 4), 24u);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCUYVA, 4, 2, 8), 16u + 8u);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCUYVY, 1920, 1080, 100), 0u) << "stride shorter than a row";
+  EXPECT_EQ(ndilb::PictureBytes(0x12345678, 16, 16, 64), 0u);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCBGRA, -1, 16, 64), 0u);
+  EXPECT_EQ(ndilb::PictureBytes(kNdiFourCCBGRA, 100000, 16, 400000), 0u);
+}
+
+TEST(InterleaveAudio, PlanarWithPaddedStrideBecomesSampleMajor) {
+  const int channels = 3, samples = 5, stride_floats = 8;
+  std::vector<float> planar(static_cast<std::size_t>(channels) * stride_floats, -1.0f);
+  for (int c = 0; c < channels; ++c) {
+    for (int s = 0; s < samples; ++s) planar[static_cast<std::size_t>(c * stride_floats + s)] = static_cast<float>(c * 100 + s);
+  }
+  ndi_audio_frame_v2 src{};
+  src.sample_rate = 48000;
+  src.no_channels = channels;
+  src.no_samples = samples;
+  src.data = planar.data();
+  src.channel_stride_in_bytes = stride_floats * 4;
+  std::vector<float> out(static_cast<std::size_t>(channels) * samples + 1, -7.0f);
+  ndi_audio_frame_interleaved_32f dst{48000, channels, samples, 0, out.data()};
+  NDIlib_util_audio_to_interleaved_32f_v2(&src, &dst);
+  for (int s = 0; s < samples; ++s) {
+    for (int c = 0; c < channels; ++c) EXPECT_EQ(out[static_cast<std::size_t>(s * channels + c)], c * 100 + s);
+  }
+  EXPECT_EQ(out.back(), -7.0f) << "wrote past no_samples x no_channels";
+  NDIlib_util_audio_to_interleaved_32f_v2(nullptr, &dst);
+  NDIlib_util_audio_to_interleaved_32f_v2(&src, nullptr);
+}
+
+TEST(NullHandles, EveryEntryPointToleratesThem) {
+  std::uint32_t count = 5;
+  EXPECT_EQ(NDIlib_find_get_current_sources(nullptr, &count), nullptr);
+  EXPECT_EQ(count, 0u);
+  EXPECT_FALSE(NDIlib_find_wait_for_sources(nullptr, 0));
+  NDIlib_find_destroy(nullptr);
+  EXPECT_EQ(NDIlib_recv_create_v2(nullptr), nullptr);
+  EXPECT_EQ(NDIlib_recv_get_no_connections(nullptr), 0);
+  EXPECT_EQ(NDIlib_recv_capture_v2(nullptr, nullptr, nullptr, nullptr, 0), kNdiFrameNone);
+  NDIlib_recv_free_video_v2(nullptr, nullptr);
+  NDIlib_recv_free_audio_v2(nullptr, nullptr);
+  NDIlib_recv_free_metadata(nullptr, nullptr);
+  EXPECT_FALSE(NDIlib_recv_set_tally(nullptr, nullptr));
+  EXPECT_FALSE(NDIlib_recv_send_metadata(nullptr, nullptr));
+  EXPECT_FALSE(NDIlib_recv_ptz_is_supported(nullptr));
+  EXPECT_FALSE(NDIlib_recv_ptz_zoom(nullptr, 1));
+  NDIlib_recv_destroy(nullptr);
+  EXPECT_EQ(NDIlib_send_create(nullptr), nullptr);
+  NDIlib_send_send_video_v2(nullptr, nullptr);
+  NDIlib_send_send_audio_v2(nullptr, nullptr);
+  NDIlib_send_send_metadata(nullptr, nullptr);
+  EXPECT_EQ(NDIlib_send_capture(nullptr, nullptr, 0), kNdiFrameNone);
+  NDIlib_send_free_metadata(nullptr, nullptr);
+  EXPECT_FALSE(NDIlib_send_get_tally(nullptr, nullptr, 0));
+  EXPECT_EQ(NDIlib_send_get_no_connections(nullptr, 0), 0);
+  NDIlib_send_add_connection_metadata(nullptr, nullptr);
+  NDIlib_send_clear_connection_metadata(nullptr);
+  NDIlib_send_destroy(nullptr);
+}
+
+}  // namespace
