@@ -238,7 +238,8 @@ TEST(ConnectionRead, ChangingTimeoutsAreEachApplied) {
   EXPECT_FALSE(pair.host->ReadFromSocket(&byte, 1, 10));
   std::thread later([&] {
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    pair.task->Send({{&byte, 1}});
+    const std::uint8_t one = 1;
+    pair.task->Send({{&one, 1}});
   });
   // With the earlier 10 ms still applied this would time out.
   EXPECT_TRUE(pair.host->ReadFromSocket(&byte, 1, 20000));
