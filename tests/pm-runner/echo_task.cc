@@ -1,0 +1,56 @@
+// A task module for the runner tests: a pm::Task with handlers that answer,
+// throw, ask the host a question of their own, and end the task.
+#include <unistd.h>
+
+#include <memory>
+#include <stdexcept>
+
+#include <nlohmann/json.hpp>
+
+#include "pm/runtime/dispatcher.h"
+#include "pm/runtime/log.h"
+#include "pm/task/task.h"
+
+namespace {
+
+using Json = nlohmann::json;
+
+class EchoTask : public pm::Task {
+ public:
+  ~EchoTask() override { pm::Log(pm::LogType::Normal, "", "EchoTask: destroyed\n"); }
+
+  void AttachDispatcher(std::shared_ptr<pm::RpcDispatcher> dispatcher) override {
+    dispatcher->RegisterHandler("test::echo", [](const Json& request, Json& response) {
+      response["value"] = request.value("value", Json());
+      response["pid"] = ::getpid();
+    });
+    dispatcher->RegisterHandler("test::throw", [](const Json&, Json&) {
+      throw std::runtime_error("the handler failed on purpose");
+    });
+    dispatcher->RegisterHandler("test::stop_task", [this](const Json&, Json&) { StopTask(); });
+    // Sends the host a request whose reply's "answer" comes back to the host
+    // in a "test::callback_ran" notification, from the request's callback.
+    std::weak_ptr<pm::RpcDispatcher> weak = dispatcher;
+    dispatcher->RegisterHandler("test::ask_host", [weak](const Json& request, Json& response) {
+      auto self = weak.lock();
+      if (!self) return;
+      Json question = {{"question", request.value("question", "")}};
+      self->RpcRequest("test::question", question, 10000, [weak](const Json& reply) {
+        if (auto again = weak.lock()) {
+          Json note = {{"answer", reply.value("answer", Json())}, {"error", reply.value("pm::error", "")}};
+          again->RpcRequest("test::callback_ran", note, 10000);
+        }
+      });
+      response["asked"] = question["pm::unique_id"];
+    });
+  }
+
+  void Shutdown() override { pm::Log(pm::LogType::Normal, "", "EchoTask: Shutdown\n"); }
+};
+
+}  // namespace
+
+extern "C" __attribute__((visibility("default"))) pm::TaskBase* pmTask_Factory() {
+  pm::Log(pm::LogType::Normal, "", "EchoTask: created\n");
+  return new EchoTask();
+}
