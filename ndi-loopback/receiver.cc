@@ -19,6 +19,7 @@ namespace {
 
 constexpr int kSendTimeoutMs = 1000;
 constexpr int kConnectTimeoutMs = 500;
+constexpr std::size_t kBlockingReadBytes = 256 * 1024;
 
 int Slot(std::int32_t type) {
   switch (type) {
@@ -57,6 +58,12 @@ Receiver::Receiver(const ndi_recv_create& settings)
 Receiver::~Receiver() {
   stop_ = true;
   if (wake_fd_ >= 0) Wake(wake_fd_);
+  {
+    // Serve publishes its socket before it looks at stop_, so either it sees
+    // stop_ or this sees the socket.
+    std::lock_guard<std::mutex> lock(write_mutex_);
+    if (fd_ >= 0) ::shutdown(fd_, SHUT_RDWR);
+  }
   if (thread_.joinable()) thread_.join();
   if (wake_fd_ >= 0) ::close(wake_fd_);
 }
@@ -108,7 +115,10 @@ void Receiver::Serve(int fd) {
   bool open = true;
   while (open && !stop_) {
     std::span<std::uint8_t> span = decoder.WritableSpan();
-    const ssize_t n = pm::RetryEintr([&] { return ::recv(fd, span.data(), span.size(), MSG_DONTWAIT); });
+    // The rest of a large picture is read in one blocking call straight into
+    // its buffer; the destructor shuts the socket down to end such a wait.
+    const int flags = span.size() >= kBlockingReadBytes ? MSG_WAITALL : MSG_DONTWAIT;
+    const ssize_t n = pm::RetryEintr([&] { return ::recv(fd, span.data(), span.size(), flags); });
     if (n == 0) break;
     if (n < 0) {
       if (errno != EAGAIN && errno != EWOULDBLOCK) break;

@@ -266,8 +266,9 @@ void Sender::PaceVideo(const ndi_video_frame_v2& frame) {
   {
     std::lock_guard<std::mutex> lock(pace_mutex_);
     const std::int64_t now = pm::SteadyNowNs();
-    // Behind by more than a frame (a stall, or the first frame): start over.
-    if (next_video_ns_ == 0 || now > next_video_ns_ + period || next_video_ns_ > now + 2 * period) {
+    // A frame or two late: the next ones go at once until the cadence is
+    // back. Further behind (a stall, or the first frame): start over.
+    if (next_video_ns_ == 0 || now > next_video_ns_ + 4 * period || next_video_ns_ > now + 2 * period) {
       next_video_ns_ = now;
     }
     wake = next_video_ns_;

@@ -350,7 +350,8 @@ TEST_F(Loopback, EveryPtzCallReachesTheSenderAsItsOwnCommand) {
 // --- connection life --------------------------------------------------------------
 
 TEST_F(Loopback, ReceiverReconnectsByItselfWhenItsSenderReturnsAtANewUrl) {
-  auto args = Args("Phoenix", {"--width", "32", "--height", "16", "--fps", "50", "--pattern", "ramp", "--no-audio"});
+  // Pictures big enough (450 KB) that a kill lands inside one.
+  auto args = Args("Phoenix", {"--width", "640", "--height", "360", "--fps", "50", "--pattern", "ramp", "--no-audio"});
   auto first = std::make_unique<TestSource>(args);
   ASSERT_TRUE(first->WaitReady());
   const std::string name = first->name(), first_url = first->url();
@@ -596,6 +597,44 @@ TEST_F(Loopback, GarbageFromASenderDropsTheConnectionAndTheReceiverTriesAgain) {
   ndi_video_frame_v2 v{};
   ndi_metadata_frame m{};
   EXPECT_EQ(NDIlib_recv_capture_v2(rx.get(), &v, nullptr, &m, 50), kNdiFrameNone) << "nothing half-made is delivered";
+  close(listener);
+}
+
+TEST_F(Loopback, DestroyingAReceiverInTheMiddleOfAFrameReturnsPromptly) {
+  const int listener = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in addr{};
+  addr.sin_family = AF_INET;
+  inet_pton(AF_INET, "127.0.0.1", &addr.sin_addr);
+  socklen_t len = sizeof addr;
+  ASSERT_EQ(bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+  ASSERT_EQ(listen(listener, 4), 0);
+  getsockname(listener, reinterpret_cast<sockaddr*>(&addr), &len);
+  std::ofstream(dir_.path() + "/stall.ndi") << "ndi-loopback 1\nname=STALL (x)\nurl=127.0.0.1:" << ntohs(addr.sin_port)
+                                            << "\npid=" << getpid() << "\n";
+  auto rx = std::make_unique<Receiver>("STALL (x)");
+  pollfd p{listener, POLLIN, 0};
+  ASSERT_EQ(poll(&p, 1, 3000), 1);
+  const int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
+  ASSERT_GE(fd, 0);
+  ndilb::VideoInfo info;
+  info.xres = 1920;
+  info.yres = 1080;
+  info.fourcc = kNdiFourCCUYVY;
+  info.line_stride = 3840;
+  ndilb::EncodedHead head = ndilb::EncodeVideo(info, 0, 3840u * 1080);
+  ndilb::EncodedHead ready = ndilb::EncodeReady(false);
+  ASSERT_GT(send(fd, ready.bytes, ready.size, MSG_NOSIGNAL), 0);
+  ASSERT_GT(send(fd, head.bytes, head.size, MSG_NOSIGNAL), 0);
+  const std::vector<std::uint8_t> half(3840u * 540, 7);
+  ASSERT_GT(send(fd, half.data(), half.size(), MSG_NOSIGNAL), 0);
+  EXPECT_TRUE(rx->WaitConnected());
+  std::this_thread::sleep_for(50ms);  // the receiver is now waiting for the rest of the picture
+  ndi_video_frame_v2 v{};
+  EXPECT_NE(NDIlib_recv_capture_v2(rx->get(), &v, nullptr, nullptr, 50), kNdiFrameVideo) << "half a frame is no frame";
+  const auto start = std::chrono::steady_clock::now();
+  rx.reset();
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 1s);
+  close(fd);
   close(listener);
 }
 
