@@ -1,0 +1,420 @@
+// The queue producer against real loopback readers: record layout and its
+// validation, token accounting across readers, bad returns, Stop, restarts,
+// and a reader that goes away while it still owes tokens.
+#include "pm/ipc/queue_producer.h"
+
+#include <dirent.h>
+
+#include <array>
+#include <condition_variable>
+#include <fstream>
+#include <thread>
+
+#include "pm/ipc/server.h"
+#include "support/log_capture.h"
+#include "support/wait.h"
+
+namespace {
+
+using pm::ipc::Connection;
+using pm::ipc::Server;
+using pm::ipc::queue::Producer;
+
+// Collects release callbacks (from any thread) in order.
+class Releases {
+ public:
+  Producer::ReleaseCallback Callback() {
+    return [this](std::uint32_t token) {
+      std::lock_guard<std::mutex> hold(mutex_);
+      tokens_.push_back(token);
+      threads_.push_back(std::this_thread::get_id());
+      changed_.notify_all();
+    };
+  }
+  std::vector<std::uint32_t> Tokens() {
+    std::lock_guard<std::mutex> hold(mutex_);
+    return tokens_;
+  }
+  std::thread::id ThreadOf(std::size_t i) {
+    std::lock_guard<std::mutex> hold(mutex_);
+    return threads_.at(i);
+  }
+  bool WaitForCount(std::size_t n) {
+    std::unique_lock<std::mutex> hold(mutex_);
+    return changed_.wait_for(hold, std::chrono::seconds(10), [&] { return tokens_.size() >= n; });
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::vector<std::uint32_t> tokens_;      // guarded by mutex_
+  std::vector<std::thread::id> threads_;   // guarded by mutex_
+};
+
+// A reader as the host sees it: `host` is its end, `task` the end added to
+// the producer.
+struct Reader {
+  std::shared_ptr<Connection> host;
+  std::shared_ptr<Connection> task;
+  explicit Reader(Server& server) {
+    host = Connection::Open(server.GetPort());
+    task = server.AcceptConnection(5000);
+    EXPECT_TRUE(host && task);
+  }
+  std::vector<std::uint8_t> ReadRecord(std::size_t bytes) {
+    std::vector<std::uint8_t> record(bytes);
+    EXPECT_TRUE(host->ReadFromSocket(record.data(), bytes, 5000));
+    return record;
+  }
+  bool Quiet() {
+    std::uint8_t byte;
+    return !host->ReadFromSocket(&byte, 1, 20);
+  }
+  void Return(std::uint32_t token) {
+    const std::uint8_t bytes[4] = {std::uint8_t(token), std::uint8_t(token >> 8), std::uint8_t(token >> 16),
+                                   std::uint8_t(token >> 24)};
+    EXPECT_TRUE(host->Send({{bytes, 4}}));
+  }
+};
+
+std::uint32_t TokenOf(const std::vector<std::uint8_t>& r) {
+  return r[0] | (r[1] << 8) | (r[2] << 16) | (std::uint32_t(r[3]) << 24);
+}
+
+struct Fixture : ::testing::Test {
+  std::unique_ptr<Server> server = Server::CreateListening();
+  Releases releases;
+  std::array<std::uint8_t, 60> record{};
+  Producer producer;
+
+  void SetUp() override {
+    for (std::size_t i = 0; i < record.size(); ++i) record[i] = std::uint8_t(i + 1);
+    ASSERT_TRUE(producer.Start(60, releases.Callback()));
+  }
+  bool Send(std::uint32_t token) { return producer.Send(token, {{record.data(), 60}}); }
+  std::unique_ptr<Reader> Add() {
+    auto reader = std::make_unique<Reader>(*server);
+    EXPECT_TRUE(producer.AddConnection(reader->task));
+    return reader;
+  }
+};
+
+// ---------------------------------------------------------------------------
+
+using ProducerRecord = Fixture;
+
+TEST_F(ProducerRecord, TokenThenRecordFromSeveralEntriesAsOneBlock) {
+  auto reader = Add();
+  ASSERT_TRUE(producer.Send(0x11223344, {{record.data(), 24}, {record.data() + 24, 34}, {record.data() + 58, 2}}));
+  const auto got = reader->ReadRecord(64);
+  EXPECT_EQ(std::vector<std::uint8_t>(got.begin(), got.begin() + 4), (std::vector<std::uint8_t>{0x44, 0x33, 0x22, 0x11}));
+  EXPECT_TRUE(std::equal(record.begin(), record.end(), got.begin() + 4));
+  EXPECT_TRUE(reader->Quiet());
+}
+
+TEST_F(ProducerRecord, WrongLengthsOrMissingPointersWriteNothing) {
+  auto reader = Add();
+  EXPECT_FALSE(producer.Send(1, {{record.data(), 59}}));
+  EXPECT_FALSE(producer.Send(2, {{record.data(), 60}, {record.data(), 1}}));
+  EXPECT_FALSE(producer.Send(3, {{record.data(), 30}, {nullptr, 30}}));
+  EXPECT_FALSE(producer.Send(4, {{record.data(), 60}, {nullptr, 0}}));
+  EXPECT_FALSE(producer.Send(5, {}));
+  // Lengths that add up to 60 only modulo 2^32 must not pass either.
+  EXPECT_FALSE(producer.Send(6, {{record.data(), 0xFFFFFFFFu}, {record.data(), 61}}));
+  EXPECT_TRUE(reader->Quiet());
+  EXPECT_EQ(producer.PendingCount(), 0u);
+  EXPECT_TRUE(releases.Tokens().empty());
+}
+
+TEST_F(ProducerRecord, RecordSizeZeroSendsTheTokenAlone) {
+  ASSERT_TRUE(producer.Start(0, releases.Callback()));
+  auto reader = Add();
+  EXPECT_FALSE(producer.Send(7, {{record.data(), 1}}));
+  ASSERT_TRUE(producer.Send(7, {}));
+  EXPECT_EQ(TokenOf(reader->ReadRecord(4)), 7u);
+  EXPECT_TRUE(reader->Quiet());
+}
+
+TEST_F(ProducerRecord, SendBeforeAnyReaderReleasesDuringTheCall) {
+  EXPECT_TRUE(Send(9));
+  ASSERT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{9}));
+  EXPECT_EQ(releases.ThreadOf(0), std::this_thread::get_id());
+  EXPECT_EQ(producer.PendingCount(), 0u);
+}
+
+// ---------------------------------------------------------------------------
+
+using ProducerTokens = Fixture;
+
+TEST_F(ProducerTokens, ReleasedOnTheProducerThreadOnlyWhenEveryReaderReturned) {
+  auto a = Add();
+  auto b = Add();
+  ASSERT_TRUE(Send(42));
+  EXPECT_EQ(TokenOf(a->ReadRecord(64)), 42u);
+  EXPECT_EQ(TokenOf(b->ReadRecord(64)), 42u);
+  a->Return(42);
+  // The producer has taken a's return once b's later return is processed;
+  // a second token acts as the marker.
+  ASSERT_TRUE(Send(43));
+  a->ReadRecord(64);
+  b->ReadRecord(64);
+  a->Return(43);
+  b->Return(43);
+  ASSERT_TRUE(releases.WaitForCount(1));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{43}));
+  b->Return(42);
+  ASSERT_TRUE(releases.WaitForCount(2));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{43, 42}));
+  EXPECT_NE(releases.ThreadOf(0), std::this_thread::get_id());
+  EXPECT_EQ(producer.PendingCount(), 0u);
+}
+
+TEST_F(ProducerTokens, ReturnsOfUnknownOrNotOwedTokensAreLoggedAndIgnored) {
+  pmtest::LogCapture log;
+  auto a = Add();
+  auto b = Add();
+  ASSERT_TRUE(Send(5));
+  a->ReadRecord(64);
+  b->ReadRecord(64);
+  a->Return(5);
+  a->Return(5);   // a no longer owes 5
+  a->Return(77);  // never sent
+  ASSERT_TRUE(pmtest::WaitFor([&] {
+    return log.Contains("pm::ipc:queue::Producer : Connection not found for token (5).") &&
+           log.Contains("pm::ipc:queue::Producer : Token (77) not found.");
+  }));
+  EXPECT_TRUE(releases.Tokens().empty());
+  b->Return(5);
+  ASSERT_TRUE(releases.WaitForCount(1));
+  b->Return(5);  // a third return of the same token
+  ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("pm::ipc:queue::Producer : Token (5) not found."); }));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{5}));
+  EXPECT_EQ(producer.ReaderCount(), 2u);  // bad returns do not cost a reader its place
+}
+
+TEST_F(ProducerTokens, TokenReturnedByAReaderThatNeverGotItIsNotCounted) {
+  pmtest::LogCapture log;
+  auto a = Add();
+  ASSERT_TRUE(Send(8));  // only a receives 8
+  auto b = Add();
+  a->ReadRecord(64);
+  b->Return(8);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("Connection not found for token (8)."); }));
+  EXPECT_TRUE(releases.Tokens().empty());
+  a->Return(8);
+  ASSERT_TRUE(releases.WaitForCount(1));
+}
+
+TEST_F(ProducerTokens, StopReleasesEveryPendingTokenInAscendingOrder) {
+  auto reader = Add();
+  for (std::uint32_t token : {30u, 10u, 20u}) ASSERT_TRUE(Send(token));
+  producer.Stop();
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{10, 20, 30}));
+  for (std::size_t i = 0; i < 3; ++i) EXPECT_EQ(releases.ThreadOf(i), std::this_thread::get_id());
+  EXPECT_EQ(producer.PendingCount(), 0u);
+  producer.Stop();  // nothing more
+  EXPECT_EQ(releases.Tokens().size(), 3u);
+}
+
+TEST_F(ProducerTokens, ConcurrentSendersAndReturnsReleaseEachTokenOnce) {
+  auto a = Add();
+  auto b = Add();
+  constexpr std::uint32_t kPerSender = 200;
+  auto echo = [](Reader* r) {
+    for (std::uint32_t n = 0; n < 2 * kPerSender; ++n) r->Return(TokenOf(r->ReadRecord(64)));
+  };
+  std::thread echoA(echo, a.get());
+  std::thread echoB(echo, b.get());
+  std::thread s1([&] {
+    for (std::uint32_t t = 0; t < kPerSender; ++t) EXPECT_TRUE(Send(t));
+  });
+  std::thread s2([&] {
+    for (std::uint32_t t = 1000; t < 1000 + kPerSender; ++t) EXPECT_TRUE(Send(t));
+  });
+  s1.join();
+  s2.join();
+  echoA.join();
+  echoB.join();
+  ASSERT_TRUE(releases.WaitForCount(2 * kPerSender));
+  auto tokens = releases.Tokens();
+  std::sort(tokens.begin(), tokens.end());
+  EXPECT_EQ(std::adjacent_find(tokens.begin(), tokens.end()), tokens.end());
+  EXPECT_EQ(tokens.size(), 2 * kPerSender);
+  EXPECT_EQ(producer.PendingCount(), 0u);
+}
+
+// ---------------------------------------------------------------------------
+
+using ProducerReaders = Fixture;
+
+TEST_F(ProducerReaders, SameConnectionTwiceIsRefused) {
+  auto reader = std::make_unique<Reader>(*server);
+  EXPECT_TRUE(producer.AddConnection(reader->task));
+  EXPECT_FALSE(producer.AddConnection(reader->task));
+  EXPECT_FALSE(producer.AddConnection(nullptr));
+  EXPECT_EQ(producer.ReaderCount(), 1u);
+  ASSERT_TRUE(Send(1));
+  reader->ReadRecord(64);
+  EXPECT_TRUE(reader->Quiet());  // one record, not two
+}
+
+TEST_F(ProducerReaders, StaleBytesFromBeforeTheReaderWasAddedAreDiscarded) {
+  pmtest::LogCapture log;
+  auto reader = std::make_unique<Reader>(*server);
+  reader->Return(3);
+  reader->Return(4);
+  // Let the stale returns arrive before the reader is added.
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !Connection::WaitReadableConnections({reader->task}, 10).empty(); }));
+  ASSERT_TRUE(producer.AddConnection(reader->task));
+  ASSERT_TRUE(Send(3));
+  reader->ReadRecord(64);
+  reader->Return(3);
+  ASSERT_TRUE(releases.WaitForCount(1));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{3}));
+  EXPECT_FALSE(log.Contains("not found"));
+}
+
+TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
+  pmtest::LogCapture log;
+  auto a = Add();
+  auto b = Add();
+  for (std::uint32_t token : {7u, 2u, 5u}) ASSERT_TRUE(Send(token));
+  for (int i = 0; i < 3; ++i) {
+    a->ReadRecord(64);
+    b->ReadRecord(64);
+  }
+  b->Return(5);
+  b->Return(7);
+  // Let b's returns be taken before a goes (a 6th token round trip as marker).
+  ASSERT_TRUE(Send(6));
+  a->ReadRecord(64);
+  b->ReadRecord(64);
+  a->Return(6);
+  b->Return(6);
+  ASSERT_TRUE(releases.WaitForCount(1));
+
+  a->host.reset();  // a's process ends: its end closes while it owes 7, 2 and 5
+  ASSERT_TRUE(releases.WaitForCount(3));
+  // 5 and 7 were owed by a only now; 2 is still owed by b.
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{6, 5, 7}));
+  EXPECT_EQ(producer.ReaderCount(), 1u);
+  EXPECT_TRUE(log.Contains("Reader gone"));
+
+  // The dead socket keeps reporting a hang-up; a thread that still watched
+  // it would pass its loop thousands of times in this interval instead of
+  // about once per 250 ms wait.
+  const std::uint64_t before = producer.LoopPasses();
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  EXPECT_LE(producer.LoopPasses() - before, 10u);
+
+  // New records go to b alone, and b's return alone releases them.
+  ASSERT_TRUE(Send(11));
+  b->ReadRecord(64);
+  b->Return(2);
+  b->Return(11);
+  ASSERT_TRUE(releases.WaitForCount(5));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{6, 5, 7, 2, 11}));
+}
+
+TEST_F(ProducerReaders, LastReaderGoneReleasesEverythingInAscendingOrder) {
+  auto a = Add();
+  for (std::uint32_t token : {9u, 1u, 4u}) ASSERT_TRUE(Send(token));
+  a->host.reset();
+  ASSERT_TRUE(releases.WaitForCount(3));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{1, 4, 9}));
+  EXPECT_EQ(producer.ReaderCount(), 0u);
+  EXPECT_TRUE(Send(12));  // no reader any more: released at once
+  EXPECT_EQ(releases.Tokens().back(), 12u);
+}
+
+TEST_F(ProducerReaders, ReaderClosedOnOurSideIsDroppedToo) {
+  auto a = Add();
+  ASSERT_TRUE(Send(3));
+  a->task->Close();
+  ASSERT_TRUE(releases.WaitForCount(1));
+  EXPECT_EQ(producer.ReaderCount(), 0u);
+  const std::uint64_t before = producer.LoopPasses();
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  EXPECT_LE(producer.LoopPasses() - before, 10u);
+}
+
+// ---------------------------------------------------------------------------
+
+using ProducerLifecycle = Fixture;
+
+std::vector<std::string> ThreadNames() {
+  std::vector<std::string> names;
+  if (DIR* dir = ::opendir("/proc/self/task")) {
+    while (dirent* entry = ::readdir(dir)) {
+      if (entry->d_name[0] == '.') continue;
+      std::ifstream comm(std::string("/proc/self/task/") + entry->d_name + "/comm");
+      std::string name;
+      std::getline(comm, name);
+      names.push_back(name);
+    }
+    ::closedir(dir);
+  }
+  return names;
+}
+
+TEST_F(ProducerLifecycle, ThreadIsNamedAndJoined) {
+  auto count = [] {
+    auto names = ThreadNames();
+    return std::count(names.begin(), names.end(), "pm::Ipc Produce");
+  };
+  EXPECT_EQ(count(), 1);
+  ASSERT_TRUE(producer.Start(60, releases.Callback()));  // the earlier thread is joined
+  EXPECT_EQ(count(), 1);
+  {
+    Producer other;
+    ASSERT_TRUE(other.Start(60, [](std::uint32_t) {}));
+    EXPECT_EQ(count(), 2);
+  }
+  EXPECT_EQ(count(), 1);
+}
+
+TEST_F(ProducerLifecycle, RestartKeepsReadersAndDiscardsTheirStaleReturns) {
+  pmtest::LogCapture log;
+  auto reader = Add();
+  ASSERT_TRUE(Send(1));
+  reader->ReadRecord(64);
+  producer.Stop();
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{1}));
+  reader->Return(1);  // arrives while stopped: stale
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !Connection::WaitReadableConnections({reader->task}, 10).empty(); }));
+  ASSERT_TRUE(producer.Start(60, releases.Callback()));
+  EXPECT_EQ(producer.ReaderCount(), 1u);
+  ASSERT_TRUE(Send(2));
+  reader->ReadRecord(64);
+  reader->Return(2);
+  ASSERT_TRUE(releases.WaitForCount(2));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{1, 2}));
+  EXPECT_FALSE(log.Contains("not found"));
+}
+
+TEST(ProducerDestroy, PendingTokensAreDroppedWithoutCallbacks) {
+  auto server = Server::CreateListening();
+  Releases releases;
+  Reader reader(*server);
+  {
+    Producer producer;
+    ASSERT_TRUE(producer.Start(4, releases.Callback()));
+    ASSERT_TRUE(producer.AddConnection(reader.task));
+    const std::uint32_t value = 0;
+    ASSERT_TRUE(producer.Send(1, {{&value, 4}}));
+  }
+  EXPECT_TRUE(releases.Tokens().empty());
+  // The reader's Connection belongs to its other owners and stays usable.
+  EXPECT_TRUE(reader.task->IsConnected());
+}
+
+TEST(ProducerDestroy, NeverStartedProducerIsHarmless) {
+  Producer producer;
+  const std::uint32_t value = 0;
+  EXPECT_TRUE(producer.Send(1, {}));  // record size 0, no reader, no callback
+  EXPECT_FALSE(producer.Send(1, {{&value, 4}}));
+  producer.Stop();
+  producer.Wake();
+}
+
+}  // namespace
