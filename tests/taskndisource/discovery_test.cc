@@ -1,0 +1,153 @@
+// Discovery: the scan schedule, announcements as senders come and go, and
+// stopping, on a clock the test advances.
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+
+#include "fakes.h"
+#include "scripted_ndi.h"
+#include "support/log_capture.h"
+#include "support/wait.h"
+#include "taskndisource/discovery.h"
+
+namespace {
+
+using nditest::Entry;
+using TaskNDISource::Discovery;
+
+class DiscoveryTest : public ::testing::Test {
+ protected:
+  ~DiscoveryTest() override { discovery->Stop(); }
+
+  // Lets the waiting scan loop run its next scan and waits for the wait
+  // after it; returns that wait's length in ms.
+  std::int64_t NextScan() {
+    const std::int64_t wait = env.clock->AwaitWait(waits);
+    env.clock->AdvanceMs(wait);
+    return env.clock->AwaitWait(++waits);
+  }
+
+  pmtest::LogCapture logs;
+  nditest::ScriptedNdi ndi;
+  std::shared_ptr<nditest::FakeDiscoveryCallbacks> callbacks = std::make_shared<nditest::FakeDiscoveryCallbacks>();
+  nditest::TestEnvironment env;
+  std::shared_ptr<Discovery> discovery = std::make_shared<Discovery>(callbacks, ndi.Api(), env.Make());
+  int waits = 1;
+};
+
+TEST_F(DiscoveryTest, ScansAfter125MsThenDoublingTo4s) {
+  discovery->Start();
+  EXPECT_EQ(env.clock->AwaitWait(1), 125);
+  EXPECT_EQ(ndi.ListCalls(), 0);
+  std::vector<std::int64_t> intervals;
+  for (int scan = 1; scan <= 7; ++scan) {
+    intervals.push_back(NextScan());
+    EXPECT_EQ(ndi.ListCalls(), scan);
+  }
+  EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
+}
+
+TEST_F(DiscoveryTest, SenderIsAnnouncedOnceWhileItStaysAndAnewAfterItVanished) {
+  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
+  discovery->Start();
+  NextScan();
+  NextScan();
+  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)"});
+  EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: STUDIO (Cam 1) (127.0.0.1:1)\n"), 1);
+  const pm::SourceInfo info = callbacks->Infos().at(0);
+  EXPECT_EQ(info.produces, 3u);
+  EXPECT_EQ(info.maximumLatencySeconds, 1.0);
+
+  ndi.SetSources({});
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().back(), "-NDICaptureDevice~STUDIO (Cam 1)");
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().size(), 2u);
+
+  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().size(), 3u);
+  EXPECT_EQ(callbacks->Calls().back(), "+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)");
+  EXPECT_EQ(logs.Count("Discovered NDI Source"), 2);
+}
+
+TEST_F(DiscoveryTest, SameNameOnTwoUrlsIsTwoSendersWithOneId) {
+  ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}, Entry{"A (x)", "10.0.0.2:1"}});
+  discovery->Start();
+  NextScan();
+  EXPECT_EQ(callbacks->Calls(),
+            (std::vector<std::string>{"+NDICaptureDevice~A (x) A (x)", "+NDICaptureDevice~A (x) A (x)"}));
+  ndi.SetSources({Entry{"A (x)", "10.0.0.2:1"}});
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().back(), "-NDICaptureDevice~A (x)");
+  EXPECT_EQ(callbacks->Calls().size(), 3u);
+}
+
+TEST_F(DiscoveryTest, EntriesWithoutNameOrUrlAreIgnored) {
+  ndi.SetSources({Entry{std::nullopt, "10.0.0.1:1"}, Entry{"B (y)", std::nullopt}, Entry{"", "10.0.0.3:1"},
+                  Entry{"C (z)", ""}, Entry{"D (w)", "10.0.0.4:1"}});
+  discovery->Start();
+  NextScan();
+  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"+NDICaptureDevice~D (w) D (w)"});
+}
+
+TEST_F(DiscoveryTest, SenderMovingToANewUrlIsAnnouncedGoneAndBackInOneScan) {
+  ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
+  discovery->Start();
+  NextScan();
+  ndi.SetSources({Entry{"A (x)", "10.0.0.9:1"}});
+  NextScan();
+  auto calls = callbacks->Calls();
+  ASSERT_EQ(calls.size(), 3u);
+  std::sort(calls.begin() + 1, calls.end());
+  EXPECT_EQ(calls[1], "+NDICaptureDevice~A (x) A (x)");
+  EXPECT_EQ(calls[2], "-NDICaptureDevice~A (x)");
+}
+
+TEST_F(DiscoveryTest, StopDuringAWaitEndsWithoutAnotherScan) {
+  discovery->Start();
+  NextScan();
+  discovery->Stop();
+  EXPECT_EQ(ndi.ListCalls(), 1);
+  EXPECT_EQ(ndi.FindersDestroyed(), 1);
+  EXPECT_EQ(*env.exits, 0);
+}
+
+TEST_F(DiscoveryTest, RestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
+  ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
+  discovery->Stop();  // nothing runs: the signal must not outlive this call's purpose
+  discovery->Start();
+  NextScan();
+  discovery->Stop();
+  discovery->Start();
+  discovery->Start();  // a second start while running is ignored
+  waits = 3;           // the first loop's two waits, then this loop's first
+  EXPECT_EQ(env.clock->AwaitWait(waits), 125);
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().size(), 1u);  // still there: not announced again
+  EXPECT_EQ(ndi.FindersCreated(), 2);
+  EXPECT_EQ(ndi.MaxLiveFinders(), 1);
+}
+
+TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
+  ndi.FailFinderCreate(true);
+  discovery->Start();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return logs.Contains("#ndisource: failed to create NDI source finder\n"); }));
+  ndi.FailFinderCreate(false);
+  ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
+  discovery->Start();
+  NextScan();
+  EXPECT_EQ(callbacks->Calls().size(), 1u);
+}
+
+TEST_F(DiscoveryTest, WithoutCallbacksTheTableIsKeptAndNothingAnnounced) {
+  ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
+  Discovery quiet(nullptr, ndi.Api(), env.Make());
+  EXPECT_FALSE(quiet.ScanOnce(nullptr));
+  EXPECT_TRUE(quiet.ScanOnce(reinterpret_cast<void*>(0x10)));
+  EXPECT_TRUE(quiet.ScanOnce(reinterpret_cast<void*>(0x10)));
+  EXPECT_EQ(logs.Count("Discovered NDI Source"), 1);
+}
+
+}  // namespace

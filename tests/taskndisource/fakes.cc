@@ -1,0 +1,259 @@
+#include "fakes.h"
+
+#include <atomic>
+
+namespace nditest {
+
+std::int64_t ManualClock::NowNs() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return now_;
+}
+
+void ManualClock::Signal() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  ++signals_;
+  changed_.notify_all();
+}
+
+bool ManualClock::WaitUntil(std::int64_t deadlineNs) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (signals_ < 1 && now_ < deadlineNs) {
+    ++waitsBegun_;
+    waiting_ = true;
+    deadline_ = deadlineNs;
+    changed_.notify_all();
+    changed_.wait(lock, [&] { return signals_ >= 1 || now_ >= deadlineNs; });
+    waiting_ = false;
+  }
+  if (signals_ >= 1) {
+    --signals_;
+    return true;
+  }
+  return false;
+}
+
+void ManualClock::AdvanceMs(std::int64_t ms) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  now_ += ms * 1'000'000;
+  changed_.notify_all();
+}
+
+std::int64_t ManualClock::AwaitWait(int n) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  if (!changed_.wait_for(lock, std::chrono::seconds(10), [&] { return waitsBegun_ >= n && waiting_; })) return -1;
+  return (deadline_ - now_) / 1'000'000;
+}
+
+int ManualClock::WaitsBegun() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return waitsBegun_;
+}
+
+TaskNDISource::LoopEnvironment TestEnvironment::Make(std::chrono::milliseconds stopTimeout,
+                                                     std::function<void()> onExit) const {
+  TaskNDISource::LoopEnvironment env;
+  env.clock = clock;
+  env.stopTimeout = stopTimeout;
+  auto counter = exits;
+  env.exitProcess = [counter, onExit] {
+    ++*counter;
+    if (onExit) onExit();
+  };
+  return env;
+}
+
+FakeVideoBuffer::FakeVideoBuffer(const pm::VideoFormat& format) : format_(format) {
+  memory.resize(static_cast<std::size_t>(RowBytes()) * static_cast<std::size_t>(Rows()));
+}
+
+std::int32_t FakeVideoBuffer::RowBytes() const {
+  if (format_.code == pm::kCodeRgba) return format_.width * 4;
+  if (format_.code == pm::kCode2vuy || format_.code == pm::kCodeYuvs) return format_.width * 2;
+  if (format_.code == pm::kCodeNV12) return format_.width;
+  return 0;
+}
+
+std::int32_t FakeVideoBuffer::Rows() const {
+  return format_.code == pm::kCodeNV12 ? format_.height + format_.height / 2 : format_.height;
+}
+
+pm::VideoPlanes FakeVideoBuffer::Planes() {
+  pm::VideoPlanes planes;
+  planes.planeCount = 1;
+  planes.plane[0] = pm::Plane{memory.data(), Rows(), RowBytes()};
+  return planes;
+}
+
+std::pair<std::uint8_t*, std::int32_t> FakeVideoBuffer::MapData() { return {memory.data(), RowBytes()}; }
+
+void FakeVideoBuffer::CopyFrame(const std::uint8_t* source, std::int32_t sourceStride) {
+  ++copies;
+  copiedStride = sourceStride;
+  const std::int32_t row = RowBytes();
+  for (std::int32_t r = 0; r < Rows(); ++r) {
+    std::memcpy(memory.data() + static_cast<std::ptrdiff_t>(r) * row,
+                source + static_cast<std::ptrdiff_t>(r) * sourceStride, static_cast<std::size_t>(row));
+  }
+}
+
+FakeAudioBuffer::FakeAudioBuffer(const pm::AudioFormat& format, std::int32_t samples, std::int64_t bytes)
+    : format_(format), samples_(samples) {
+  memory.resize(static_cast<std::size_t>(bytes));
+}
+
+void FakeAudioBuffer::Fill(std::function<void(void*, std::int64_t)> fill) {
+  fill(memory.data(), static_cast<std::int64_t>(memory.size()));
+}
+
+std::vector<float> FakeAudioBuffer::Samples() const {
+  std::vector<float> samples(memory.size() / sizeof(float));
+  std::memcpy(samples.data(), memory.data(), samples.size() * sizeof(float));
+  return samples;
+}
+
+void FakeCallbacks::Record(std::string call) { calls_.push_back(std::move(call)); }
+
+std::shared_ptr<pm::VideoBuffer> FakeCallbacks::RequestVideoBuffer(const pm::VideoFormat& format, std::uint32_t) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  videoRequests_.push_back(format);
+  Record("video request");
+  if (videoDry_) return nullptr;
+  return std::make_shared<FakeVideoBuffer>(overrideVideo_ ? videoOverride_ : format);
+}
+
+std::shared_ptr<pm::AudioBuffer> FakeCallbacks::RequestAudioBuffer(const pm::AudioFormat& format,
+                                                                   std::int32_t sampleCount) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  audioRequests_.emplace_back(format, sampleCount);
+  Record("audio request");
+  if (audioDry_) return nullptr;
+  const std::int64_t bytes =
+      audioBytes_ >= 0 ? audioBytes_ : std::int64_t{format.channels} * sampleCount * static_cast<std::int64_t>(sizeof(float));
+  return std::make_shared<FakeAudioBuffer>(format, sampleCount, bytes);
+}
+
+void FakeCallbacks::UpdateGui(std::string guiJson, std::vector<std::string> widgets) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  guis_.push_back(guiJson);
+  Record(widgets.empty() ? "gui" : "gui with widgets");
+}
+
+void FakeCallbacks::UpdateProduction(std::uint32_t produces) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  Record("production " + std::to_string(produces));
+}
+
+void FakeCallbacks::TimestampReset() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  Record("reset");
+}
+
+void FakeCallbacks::UpdateBuildOutDuration(std::int64_t ticks) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  Record("buildout " + std::to_string(ticks));
+}
+
+void FakeCallbacks::UpdatePtzCommandSuite(const std::string& suite, const std::string& model) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  Record("ptz " + suite + "/" + model);
+}
+
+void FakeCallbacks::SendAudioBuffer(std::int64_t mediaTime, std::shared_ptr<pm::AudioBuffer> buffer) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  audioSent_.push_back(std::static_pointer_cast<FakeAudioBuffer>(buffer));
+  Record("audio " + std::to_string(mediaTime));
+}
+
+void FakeCallbacks::SendVideoBuffer(std::int64_t mediaTime, std::shared_ptr<pm::VideoBuffer> buffer) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  videoSent_.push_back(std::static_pointer_cast<FakeVideoBuffer>(buffer));
+  Record("video " + std::to_string(mediaTime));
+}
+
+void FakeCallbacks::UpdateConnectionState(std::int32_t state) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  states_.push_back(state);
+  Record("state " + std::to_string(state));
+}
+
+void FakeCallbacks::SetDry(bool video, bool audio) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  videoDry_ = video;
+  audioDry_ = audio;
+}
+
+void FakeCallbacks::OverrideVideoFormat(const pm::VideoFormat& format) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  overrideVideo_ = true;
+  videoOverride_ = format;
+}
+
+void FakeCallbacks::OverrideAudioBytes(std::int64_t bytes) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  audioBytes_ = bytes;
+}
+
+std::vector<std::string> FakeCallbacks::Calls() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return calls_;
+}
+
+std::vector<std::int32_t> FakeCallbacks::States() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return states_;
+}
+
+std::vector<std::string> FakeCallbacks::Guis() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return guis_;
+}
+
+std::vector<pm::VideoFormat> FakeCallbacks::VideoRequests() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return videoRequests_;
+}
+
+std::vector<std::pair<pm::AudioFormat, std::int32_t>> FakeCallbacks::AudioRequests() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return audioRequests_;
+}
+
+std::vector<std::shared_ptr<FakeVideoBuffer>> FakeCallbacks::VideoSent() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return videoSent_;
+}
+
+std::vector<std::shared_ptr<FakeAudioBuffer>> FakeCallbacks::AudioSent() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return audioSent_;
+}
+
+int FakeCallbacks::Count(const std::string& call) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  int n = 0;
+  for (const auto& c : calls_) n += c == call;
+  return n;
+}
+
+void FakeDiscoveryCallbacks::SourceAvailable(const pm::SourceInfo& info) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  calls_.push_back("+" + info.uniqueId + " " + info.name);
+  infos_.push_back(info);
+}
+
+void FakeDiscoveryCallbacks::SourceUnavailable(const std::string& uniqueId) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  calls_.push_back("-" + uniqueId);
+}
+
+std::vector<std::string> FakeDiscoveryCallbacks::Calls() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return calls_;
+}
+
+std::vector<pm::SourceInfo> FakeDiscoveryCallbacks::Infos() {
+  std::lock_guard<std::mutex> guard(mutex_);
+  return infos_;
+}
+
+}  // namespace nditest

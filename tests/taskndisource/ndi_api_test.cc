@@ -1,0 +1,44 @@
+// Loading the runtime table by name: every entry from a complete library, the
+// first missing symbol or the missing library named on failure.
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "taskndisource/ndi_api.h"
+
+namespace {
+
+using TaskNDISource::LoadNdiApi;
+using TaskNDISource::NdiApi;
+
+TEST(LoadNdiApi, CompleteLibraryFillsEveryEntry) {
+  NdiApi api;
+  std::string missing;
+  ASSERT_TRUE(LoadNdiApi(STUB_RUNTIME_COMPLETE_PATH, &api, &missing)) << missing;
+  EXPECT_TRUE(missing.empty());
+  // Every member of the table is a function pointer; none may stay null.
+  static_assert(sizeof(NdiApi) % sizeof(void*) == 0);
+  void* entries[sizeof(NdiApi) / sizeof(void*)];
+  std::memcpy(entries, &api, sizeof api);
+  for (std::size_t i = 0; i < sizeof(NdiApi) / sizeof(void*); ++i) EXPECT_NE(entries[i], nullptr) << i;
+  EXPECT_STREQ(api.version(), "stub 1.0");
+}
+
+TEST(LoadNdiApi, MissingSymbolIsNamedAndTheTableLeftEmpty) {
+  NdiApi api;
+  std::string missing;
+  EXPECT_FALSE(LoadNdiApi(STUB_RUNTIME_PARTIAL_PATH, &api, &missing));
+  EXPECT_EQ(missing, "NDIlib_find_create_v2");
+  EXPECT_EQ(api.version, nullptr);
+}
+
+TEST(LoadNdiApi, MissingLibraryIsNamed) {
+  NdiApi api;
+  std::string missing;
+  EXPECT_FALSE(LoadNdiApi("libno-such-ndi-runtime.so", &api, &missing));
+  EXPECT_EQ(missing, "libno-such-ndi-runtime.so");
+  EXPECT_FALSE(LoadNdiApi("libno-such-ndi-runtime.so", nullptr, nullptr));
+}
+
+}  // namespace

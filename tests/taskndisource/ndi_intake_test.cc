@@ -1,0 +1,282 @@
+// Video and audio intake of the NDI source, driven frame by frame without a
+// receiver loop: formats requested, bytes copied, timestamps and their shared
+// base, the produces mask, and every kind of bad frame.
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <limits>
+
+#include "fakes.h"
+#include "scripted_ndi.h"
+#include "support/log_capture.h"
+#include "taskndisource/ndi_source.h"
+
+namespace {
+
+using nditest::AudioCapture;
+using nditest::VideoCapture;
+using TaskNDISource::MediaInfo;
+using TaskNDISource::NDISource;
+
+constexpr char kId[] = "NDICaptureDevice~STUDIO (Cam 1)";
+
+class IntakeTest : public ::testing::Test {
+ protected:
+  nditest::ScriptedNdi ndi;
+  std::shared_ptr<nditest::FakeCallbacks> callbacks = std::make_shared<nditest::FakeCallbacks>();
+  nditest::TestEnvironment env;
+  std::shared_ptr<NDISource> source = std::make_shared<NDISource>(callbacks, kId, ndi.Api(), env.Make());
+  pmtest::LogCapture logs;
+
+  bool Video(const std::shared_ptr<nditest::Capture>& c, MediaInfo* info = nullptr) {
+    return source->ProcessVideoFrame(c->video, info);
+  }
+  bool Audio(const std::shared_ptr<nditest::Capture>& c, MediaInfo* info = nullptr) {
+    return source->ProcessAudioFrame(c->audio, info);
+  }
+};
+
+TEST_F(IntakeTest, UyvyFrameIsRequestedAs2vuyAndCopiedRowByRow) {
+  // Stride wider than a row: the padding must not end up in the buffer.
+  auto frame = VideoCapture(kNdiFourCCUYVY, 64, 8, 160);
+  MediaInfo info;
+  ASSERT_TRUE(Video(frame, &info));
+  const auto requests = callbacks->VideoRequests();
+  ASSERT_EQ(requests.size(), 1u);
+  EXPECT_EQ(requests[0].code, 0x32767579u);
+  EXPECT_EQ(requests[0].width, 64);
+  EXPECT_EQ(requests[0].height, 8);
+  EXPECT_EQ(requests[0].byteSize, 0u);
+  EXPECT_EQ(requests[0].field, 0);
+  EXPECT_EQ(requests[0].scan, 'P');
+  EXPECT_EQ(requests[0].extra1 | requests[0].extra2 | requests[0].extraWidth | requests[0].extraHeight, 0);
+  const auto sent = callbacks->VideoSent();
+  ASSERT_EQ(sent.size(), 1u);
+  EXPECT_EQ(sent[0]->copiedStride, 160);
+  for (int row = 0; row < 8; ++row) {
+    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 128, frame->bytes.data() + row * 160, 128)) << row;
+  }
+  EXPECT_EQ(info, (MediaInfo{64, 8, 30000, 1001, 0, 0}));
+}
+
+TEST_F(IntakeTest, EachAcceptedFourCCMapsToItsHostCode) {
+  struct Case {
+    std::uint32_t fourcc;
+    std::uint32_t code;
+    int stride;
+  };
+  for (const Case& c : {Case{kNdiFourCCUYVA, pm::kCode2vuy, 32}, Case{kNdiFourCCNV12, pm::kCodeNV12, 16},
+                        Case{kNdiFourCCBGRA, pm::kCodeRgba, 64}}) {
+    ASSERT_TRUE(Video(VideoCapture(c.fourcc, 16, 4, c.stride, 0, /*progressive=*/false)));
+    EXPECT_EQ(callbacks->VideoRequests().back().code, c.code);
+    EXPECT_EQ(callbacks->VideoRequests().back().scan, 'U');
+  }
+}
+
+TEST_F(IntakeTest, Nv12CopiesLumaAndChromaWithTheFrameStride) {
+  auto frame = VideoCapture(kNdiFourCCNV12, 16, 4, 24);
+  ASSERT_TRUE(Video(frame));
+  const auto sent = callbacks->VideoSent();
+  ASSERT_EQ(sent.size(), 1u);
+  for (int row = 0; row < 6; ++row) {  // 4 luma rows, 2 chroma rows
+    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 16, frame->bytes.data() + row * 24, 16)) << row;
+  }
+}
+
+TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
+  struct Case {
+    std::shared_ptr<nditest::Capture> frame;
+    const char* line;
+  };
+  auto nullData = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  nullData->video.data = nullptr;
+  auto zeroStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  zeroStride->video.line_stride_in_bytes = 0;
+  auto negativeStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  negativeStride->video.line_stride_in_bytes = -32;
+  auto shortStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 31);     // a row is 32 bytes
+  auto shortNv12 = VideoCapture(kNdiFourCCNV12, 16, 4, 15);       // a row is 16 bytes
+  auto shortBgra = VideoCapture(kNdiFourCCBGRA, 16, 4, 63);       // a row is 64 bytes
+  auto zeroWidth = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  zeroWidth->video.xres = 0;
+  auto negativeHeight = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  negativeHeight->video.yres = -4;
+  auto wide = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  wide->video.xres = 32768;
+  auto tall = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  tall->video.yres = 40000;
+  auto i420 = VideoCapture(kNdiFourCCI420, 16, 4, 16);
+  auto unknown = VideoCapture(0x12345678, 16, 4, 32);
+
+  const Case cases[] = {
+      {nullData, "#ndisource: null data in NDI video frame\n"},
+      {zeroStride, "#ndisource: invalid stride in NDI video frame\n"},
+      {negativeStride, "#ndisource: invalid stride in NDI video frame\n"},
+      {shortStride, "#ndisource: invalid stride in NDI video frame\n"},
+      {shortNv12, "#ndisource: invalid stride in NDI video frame\n"},
+      {shortBgra, "#ndisource: invalid stride in NDI video frame\n"},
+      {zeroWidth, "#ndisource: invalid resolution in NDI video frame\n"},
+      {negativeHeight, "#ndisource: invalid resolution in NDI video frame\n"},
+      {wide, "#ndisource: NDI video frame too large (32768x4)\n"},
+      {tall, "#ndisource: NDI video frame too large (16x40000)\n"},
+      {i420, "#ndisource: unexpected raster format\n"},
+      {unknown, "#ndisource: unexpected raster format\n"},
+  };
+  for (const Case& c : cases) {
+    logs.Clear();
+    EXPECT_FALSE(Video(c.frame)) << c.line;
+    EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
+  }
+  EXPECT_TRUE(callbacks->VideoRequests().empty());
+  EXPECT_TRUE(callbacks->Calls().empty());
+  // The source still takes good frames.
+  EXPECT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+}
+
+TEST_F(IntakeTest, LargestDescribableFrameIsTaken) {
+  auto frame = VideoCapture(kNdiFourCCNV12, 32767, 1, 32767);
+  ASSERT_TRUE(Video(frame));
+  EXPECT_EQ(callbacks->VideoRequests().back().width, 32767);
+}
+
+TEST_F(IntakeTest, VideoWellRanDryLosesOnlyThatFrame) {
+  callbacks->SetDry(true, false);
+  EXPECT_FALSE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+  EXPECT_TRUE(logs.Contains("#ndisource: video well ran dry\n"));
+  callbacks->SetDry(false, false);
+  EXPECT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+}
+
+TEST_F(IntakeTest, BufferOfAnotherFormatIsNotCopiedInto) {
+  pm::VideoFormat bigger;
+  bigger.code = pm::kCode2vuy;
+  bigger.width = 1920;
+  bigger.height = 1080;
+  callbacks->OverrideVideoFormat(bigger);
+  EXPECT_FALSE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+  EXPECT_TRUE(callbacks->VideoSent().empty());
+}
+
+TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
+  NDISource lonely(nullptr, kId, ndi.Api(), env.Make());
+  auto video = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+  auto audio = AudioCapture(48000, 2, 16);
+  EXPECT_FALSE(lonely.ProcessVideoFrame(video->video, nullptr));
+  EXPECT_FALSE(lonely.ProcessAudioFrame(audio->audio, nullptr));
+  EXPECT_TRUE(logs.Contains("#ndisource: expected video data callback when processing NDI video frame\n"));
+  EXPECT_TRUE(logs.Contains("#ndisource: no callbacks\n"));
+}
+
+TEST_F(IntakeTest, StereoAudioIsInterleavedIntoTheHostBuffer) {
+  MediaInfo info;
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 1600), &info));
+  const auto requests = callbacks->AudioRequests();
+  ASSERT_EQ(requests.size(), 1u);
+  EXPECT_EQ(requests[0].first.code, 0x666C3332u);
+  EXPECT_EQ(requests[0].first.sampleRate, 48000u);
+  EXPECT_EQ(requests[0].first.channels, 2);
+  EXPECT_EQ(requests[0].second, 1600);
+  const auto samples = callbacks->AudioSent().at(0)->Samples();
+  ASSERT_EQ(samples.size(), 3200u);
+  EXPECT_EQ(samples[0], 0.0f);     // channel 0, sample 0
+  EXPECT_EQ(samples[1], 1000.0f);  // channel 1, sample 0
+  EXPECT_EQ(samples[2], 1.0f);     // channel 0, sample 1
+  EXPECT_EQ(samples[3199], 2599.0f);
+  EXPECT_EQ(info, (MediaInfo{0, 0, 0, 0, 48000, 2}));
+}
+
+TEST_F(IntakeTest, BadAudioFramesAreDroppedWithTheirLine) {
+  struct Case {
+    std::shared_ptr<nditest::Capture> frame;
+    const char* line;
+  };
+  auto nullData = AudioCapture(48000, 2, 16);
+  nullData->audio.data = nullptr;
+  const Case cases[] = {
+      {AudioCapture(0, 2, 16), "#ndisource: unexpected audio sample rate\n"},
+      {AudioCapture(-48000, 2, 16), "#ndisource: unexpected audio sample rate\n"},
+      {AudioCapture(48000, 2, 0), "#ndisource: unexpected audio sample count\n"},
+      {AudioCapture(48000, 2, -5), "#ndisource: unexpected audio sample count\n"},
+      {AudioCapture(48000, 0, 16), "#ndisource: unexpected audio channel count\n"},
+      {nullData, "#ndisource: null audio sample data\n"},
+      {AudioCapture(48000, 256, 4), "#ndisource: too many channels in NDI audio frame (256)\n"},
+  };
+  for (const Case& c : cases) {
+    logs.Clear();
+    EXPECT_FALSE(Audio(c.frame)) << c.line;
+    EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
+  }
+  EXPECT_TRUE(callbacks->AudioRequests().empty());
+  EXPECT_TRUE(Audio(AudioCapture(48000, 255, 4)));
+}
+
+TEST_F(IntakeTest, AudioBufferSmallerThanTheFrameIsNotWrittenPast) {
+  callbacks->OverrideAudioBytes(2 * 16 * 4 - 1);
+  EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
+  EXPECT_TRUE(logs.Contains("#ndisource: audio buffer too small for the NDI audio frame\n"));
+  EXPECT_TRUE(callbacks->AudioSent().empty());
+  callbacks->SetDry(false, true);
+  EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
+  EXPECT_TRUE(logs.Contains("#ndisource: audio well ran dry\n"));
+}
+
+TEST_F(IntakeTest, TimestampsCountFromTheOldestFrameAcrossAudioAndVideo) {
+  // 10,000,000 x 100 ns = 1 s = 705,600,000 ticks.
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 50'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 60'000'000)));
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 55'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 0)));  // no timestamp: time 0, base kept
+  // Audio older than every video frame: new base for both, host clock reset.
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 40'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 40'000'001)));
+  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{
+                                    "video request", "reset", "production 1", "video 0",
+                                    "video request", "video 705600000",
+                                    "audio request", "production 3", "audio 352800000",
+                                    "video request", "video 0",
+                                    "audio request", "reset", "audio 0",
+                                    "video request", "video 70",
+                                }));
+}
+
+TEST_F(IntakeTest, NewBaseOfADroppedFrameResetsTheHostWithTheNextDeliveredFrame) {
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 50'000'000)));
+  EXPECT_FALSE(Video(VideoCapture(kNdiFourCCI420, 16, 4, 16, 10'000'000)));  // takes the base, no reset yet
+  EXPECT_EQ(callbacks->Count("reset"), 1);
+  ASSERT_TRUE(Audio(AudioCapture(48000, 1, 16, 20'000'000)));
+  const auto calls = callbacks->Calls();
+  EXPECT_EQ(std::vector<std::string>(calls.end() - 4, calls.end()),
+            (std::vector<std::string>{"audio request", "reset", "production 3", "audio 705600000"}));
+}
+
+TEST_F(IntakeTest, FirstFrameOfEachKindReportsProductionOnceAndStartClearsIt) {
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16)));
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
+  EXPECT_EQ(callbacks->Count("production 2"), 1);
+  EXPECT_EQ(callbacks->Count("production 3"), 1);
+  EXPECT_EQ(source->ProducesMask(), 3u);
+  source->Start();
+  source->Stop();
+  EXPECT_EQ(source->ProducesMask(), 0u);
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 5)));
+  EXPECT_EQ(callbacks->Count("production 1"), 1);
+}
+
+TEST(TicksFrom100ns, ConvertsExactlyAndSaturatesInsteadOfOverflowing) {
+  EXPECT_EQ(TaskNDISource::TicksFrom100ns(10'000'000), 705'600'000);
+  EXPECT_EQ(TaskNDISource::TicksFrom100ns(1), 70);    // 70.56 truncated
+  EXPECT_EQ(TaskNDISource::TicksFrom100ns(-1), -70);  // toward zero
+  EXPECT_EQ(TaskNDISource::TicksFrom100ns(std::numeric_limits<std::int64_t>::max()),
+            std::numeric_limits<std::int64_t>::max());
+}
+
+TEST_F(IntakeTest, TimestampsFarApartDoNotOverflow) {
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::min() + 1)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::max())));
+  EXPECT_EQ(callbacks->Calls().back(), "video " + std::to_string(std::numeric_limits<std::int64_t>::max()));
+}
+
+}  // namespace

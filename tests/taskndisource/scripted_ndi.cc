@@ -1,0 +1,328 @@
+#include "scripted_ndi.h"
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+#include <stdexcept>
+
+namespace nditest {
+
+namespace {
+
+std::atomic<ScriptedNdi*> g_current{nullptr};
+
+ScriptedNdi& Current() {
+  ScriptedNdi* current = g_current.load();
+  if (current == nullptr) std::abort();  // a table used after its test ended
+  return *current;
+}
+
+std::string Number(float value) {
+  char text[32];
+  std::snprintf(text, sizeof text, "%g", static_cast<double>(value));
+  return text;
+}
+
+bool IsSupportedCpu() { return true; }
+bool Initialize() { return true; }
+const char* Version() { return "scripted"; }
+void Destroy() {}
+void* FindCreate(const ndi_find_create* s) { return Current().FindCreate(s); }
+void FindDestroy(void* f) { Current().FindDestroy(f); }
+const ndi_source* FindList(void* f, std::uint32_t* count) { return Current().FindList(f, count); }
+void* RecvCreate(const ndi_recv_create* s) { return Current().RecvCreate(s); }
+void RecvDestroy(void* r) { Current().RecvDestroy(r); }
+int Connections(void* r) { return Current().Connections(r); }
+std::int32_t CaptureFn(void* r, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
+                       std::uint32_t timeoutMs) {
+  return Current().Capture(r, v, a, m, timeoutMs);
+}
+void FreeVideo(void*, const ndi_video_frame_v2* v) { Current().Free(0, v->data); }
+void FreeAudio(void*, const ndi_audio_frame_v2* a) { Current().Free(1, a->data); }
+void FreeMetadata(void*, const ndi_metadata_frame* m) { Current().Free(2, m->data); }
+bool SetTally(void*, const ndi_tally* t) { return Current().SetTally(t); }
+bool SendMetadata(void*, const ndi_metadata_frame* m) { return Current().SendMetadata(m); }
+bool PtzSupported(void*) { return Current().PtzSupported(); }
+bool RecallPreset(void*, int preset, float speed) {
+  return Current().Ptz("recall_preset(" + std::to_string(preset) + "," + Number(speed) + ")");
+}
+bool StorePreset(void*, int preset) { return Current().Ptz("store_preset(" + std::to_string(preset) + ")"); }
+bool PanTilt(void*, float p, float t) { return Current().Ptz("pan_tilt(" + Number(p) + "," + Number(t) + ")"); }
+bool PanTiltSpeed(void*, float p, float t) {
+  return Current().Ptz("pan_tilt_speed(" + Number(p) + "," + Number(t) + ")");
+}
+bool Zoom(void*, float z) { return Current().Ptz("zoom(" + Number(z) + ")"); }
+bool Focus(void*, float f) { return Current().Ptz("focus(" + Number(f) + ")"); }
+bool FocusSpeed(void*, float f) { return Current().Ptz("focus_speed(" + Number(f) + ")"); }
+bool AutoFocus(void*) { return Current().Ptz("auto_focus()"); }
+bool ExposureAuto(void*) { return Current().Ptz("exposure_auto()"); }
+bool ExposureManual(void*, float l) { return Current().Ptz("exposure_manual(" + Number(l) + ")"); }
+bool WbAuto(void*) { return Current().Ptz("white_balance_auto()"); }
+bool WbIndoor(void*) { return Current().Ptz("white_balance_indoor()"); }
+bool WbOutdoor(void*) { return Current().Ptz("white_balance_outdoor()"); }
+bool WbOneshot(void*) { return Current().Ptz("white_balance_oneshot()"); }
+bool WbManual(void*, float r, float b) {
+  return Current().Ptz("white_balance_manual(" + Number(r) + "," + Number(b) + ")");
+}
+void Interleave(const ndi_audio_frame_v2* src, ndi_audio_frame_interleaved_32f* dst) {
+  for (int s = 0; s < src->no_samples; ++s) {
+    for (int c = 0; c < src->no_channels; ++c) {
+      const auto* channel = reinterpret_cast<const std::uint8_t*>(src->data) +
+                            static_cast<std::ptrdiff_t>(c) * src->channel_stride_in_bytes;
+      float sample;
+      std::memcpy(&sample, channel + static_cast<std::ptrdiff_t>(s) * 4, 4);
+      dst->data[static_cast<std::ptrdiff_t>(s) * src->no_channels + c] = sample;
+    }
+  }
+}
+
+}  // namespace
+
+std::shared_ptr<Capture> VideoCapture(std::uint32_t fourcc, int width, int height, int stride, std::int64_t timestamp,
+                                      bool progressive) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = kNdiFrameVideo;
+  const int rows = fourcc == kNdiFourCCNV12 ? height + height / 2 : height;
+  const std::size_t size = stride > 0 && rows > 0 ? static_cast<std::size_t>(stride) * rows : 0;
+  capture->bytes.resize(size);
+  for (std::size_t i = 0; i < size; ++i) {
+    const std::size_t row = i / static_cast<std::size_t>(stride);
+    const std::size_t column = i % static_cast<std::size_t>(stride);
+    capture->bytes[i] = static_cast<std::uint8_t>(row * 7 + column);
+  }
+  capture->video.xres = width;
+  capture->video.yres = height;
+  capture->video.FourCC = fourcc;
+  capture->video.frame_rate_N = 30000;
+  capture->video.frame_rate_D = 1001;
+  capture->video.frame_format_type = progressive ? kNdiFrameFormatProgressive : kNdiFrameFormatInterleaved;
+  capture->video.data = size > 0 ? capture->bytes.data() : nullptr;
+  capture->video.line_stride_in_bytes = stride;
+  capture->video.timestamp = timestamp;
+  return capture;
+}
+
+std::shared_ptr<Capture> AudioCapture(int rate, int channels, int samples, std::int64_t timestamp) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = kNdiFrameAudio;
+  const std::size_t count = channels > 0 && samples > 0 ? static_cast<std::size_t>(channels) * samples : 0;
+  capture->bytes.resize(count * sizeof(float));
+  for (int c = 0; c < channels; ++c) {
+    for (int s = 0; s < samples; ++s) {
+      const float value = static_cast<float>(c * 1000 + s);
+      std::memcpy(capture->bytes.data() + (static_cast<std::size_t>(c) * samples + s) * 4, &value, 4);
+    }
+  }
+  capture->audio.sample_rate = rate;
+  capture->audio.no_channels = channels;
+  capture->audio.no_samples = samples;
+  capture->audio.data = count > 0 ? reinterpret_cast<float*>(capture->bytes.data()) : nullptr;
+  capture->audio.channel_stride_in_bytes = samples * 4;
+  capture->audio.timestamp = timestamp;
+  return capture;
+}
+
+std::shared_ptr<Capture> MetadataCapture(const std::string& text) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = kNdiFrameMetadata;
+  capture->bytes.assign(text.begin(), text.end());
+  capture->bytes.push_back(0);
+  capture->metadata.length = static_cast<int>(capture->bytes.size());
+  capture->metadata.data = reinterpret_cast<char*>(capture->bytes.data());
+  return capture;
+}
+
+std::shared_ptr<Capture> TypeOnly(std::int32_t type) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = type;
+  return capture;
+}
+
+ScriptedNdi::ScriptedNdi() {
+  ScriptedNdi* expected = nullptr;
+  if (!g_current.compare_exchange_strong(expected, this)) throw std::logic_error("two ScriptedNdi at once");
+}
+
+ScriptedNdi::~ScriptedNdi() { g_current.store(nullptr); }
+
+std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
+  auto api = std::make_shared<TaskNDISource::NdiApi>();
+  api->is_supported_CPU = IsSupportedCpu;
+  api->initialize = Initialize;
+  api->version = Version;
+  api->destroy = Destroy;
+  api->find_create_v2 = nditest::FindCreate;
+  api->find_get_current_sources = nditest::FindList;
+  api->find_destroy = nditest::FindDestroy;
+  api->recv_create_v2 = nditest::RecvCreate;
+  api->recv_destroy = nditest::RecvDestroy;
+  api->recv_get_no_connections = nditest::Connections;
+  api->recv_capture_v2 = CaptureFn;
+  api->recv_free_video_v2 = FreeVideo;
+  api->recv_free_audio_v2 = FreeAudio;
+  api->recv_free_metadata = FreeMetadata;
+  api->recv_set_tally = nditest::SetTally;
+  api->recv_send_metadata = nditest::SendMetadata;
+  api->recv_ptz_is_supported = nditest::PtzSupported;
+  api->recv_ptz_recall_preset = RecallPreset;
+  api->recv_ptz_store_preset = StorePreset;
+  api->recv_ptz_pan_tilt = PanTilt;
+  api->recv_ptz_pan_tilt_speed = PanTiltSpeed;
+  api->recv_ptz_zoom = Zoom;
+  api->recv_ptz_focus = Focus;
+  api->recv_ptz_focus_speed = FocusSpeed;
+  api->recv_ptz_auto_focus = AutoFocus;
+  api->recv_ptz_exposure_auto = ExposureAuto;
+  api->recv_ptz_exposure_manual = ExposureManual;
+  api->recv_ptz_white_balance_auto = WbAuto;
+  api->recv_ptz_white_balance_indoor = WbIndoor;
+  api->recv_ptz_white_balance_outdoor = WbOutdoor;
+  api->recv_ptz_white_balance_oneshot = WbOneshot;
+  api->recv_ptz_white_balance_manual = WbManual;
+  api->util_audio_to_interleaved_32f_v2 = Interleave;
+  return api;
+}
+
+#define LOCKED std::lock_guard<std::mutex> guard(mutex_)
+
+void ScriptedNdi::SetSources(std::vector<Entry> entries) { LOCKED; entries_ = std::move(entries); }
+void ScriptedNdi::FailFinderCreate(bool fail) { LOCKED; failFinder_ = fail; }
+int ScriptedNdi::FindersCreated() { LOCKED; return findersCreated_; }
+int ScriptedNdi::FindersDestroyed() { LOCKED; return findersDestroyed_; }
+int ScriptedNdi::MaxLiveFinders() { LOCKED; return maxLiveFinders_; }
+int ScriptedNdi::ListCalls() { LOCKED; return listCalls_; }
+void ScriptedNdi::FailReceiverCreate(bool fail) { LOCKED; failReceiver_ = fail; }
+std::vector<ReceiverCreated> ScriptedNdi::ReceiversCreated() { LOCKED; return receivers_; }
+int ScriptedNdi::ReceiversDestroyed() { LOCKED; return receiversDestroyed_; }
+void ScriptedNdi::SetConnections(int count) { LOCKED; connections_ = count; }
+int ScriptedNdi::ConnectionQueries() { LOCKED; return connectionQueries_; }
+void ScriptedNdi::SetTallyResult(bool ok) { LOCKED; tallyOk_ = ok; }
+std::vector<ndi_tally> ScriptedNdi::Tallies() { LOCKED; return tallies_; }
+void ScriptedNdi::SetMetadataResult(bool ok) { LOCKED; metadataOk_ = ok; }
+std::vector<std::string> ScriptedNdi::MetadataSent() { LOCKED; return metadataSent_; }
+std::vector<int> ScriptedNdi::MetadataLengths() { LOCKED; return metadataLengths_; }
+void ScriptedNdi::SetPtzSupported(bool supported) { LOCKED; ptzSupported_ = supported; }
+std::vector<std::string> ScriptedNdi::PtzCalls() { LOCKED; return ptzCalls_; }
+int ScriptedNdi::Captures() { LOCKED; return captures_; }
+int ScriptedNdi::CapturesQueued() { LOCKED; return static_cast<int>(queue_.size()); }
+int ScriptedNdi::VideoFrees() { LOCKED; return frees_[0]; }
+int ScriptedNdi::AudioFrees() { LOCKED; return frees_[1]; }
+int ScriptedNdi::MetadataFrees() { LOCKED; return frees_[2]; }
+bool ScriptedNdi::FreesMatched() { LOCKED; return freesMatched_ && handedOut_.empty(); }
+
+void ScriptedNdi::Push(std::shared_ptr<nditest::Capture> capture) {
+  LOCKED;
+  queue_.push_back(std::move(capture));
+  changed_.notify_all();
+}
+
+void ScriptedNdi::BlockCapture(bool block) {
+  LOCKED;
+  block_ = block;
+  changed_.notify_all();
+}
+
+void* ScriptedNdi::FindCreate(const ndi_find_create* settings) {
+  LOCKED;
+  if (failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
+  ++findersCreated_;
+  maxLiveFinders_ = std::max(maxLiveFinders_, findersCreated_ - findersDestroyed_);
+  return &handleSpace_[++handles_ % 64];
+}
+
+void ScriptedNdi::FindDestroy(void*) { LOCKED; ++findersDestroyed_; }
+
+const ndi_source* ScriptedNdi::FindList(void*, std::uint32_t* count) {
+  LOCKED;
+  ++listCalls_;
+  list_.clear();
+  for (const Entry& entry : entries_) {
+    list_.push_back(ndi_source{entry.name ? entry.name->c_str() : nullptr, entry.url ? entry.url->c_str() : nullptr});
+  }
+  *count = static_cast<std::uint32_t>(list_.size());
+  return list_.empty() ? nullptr : list_.data();
+}
+
+void* ScriptedNdi::RecvCreate(const ndi_recv_create* settings) {
+  LOCKED;
+  if (failReceiver_) return nullptr;
+  ReceiverCreated created;
+  created.name = settings->source_to_connect_to.ndi_name ? settings->source_to_connect_to.ndi_name : "";
+  created.url = settings->source_to_connect_to.url_address ? settings->source_to_connect_to.url_address : "";
+  created.colorFormat = settings->color_format;
+  created.bandwidth = settings->bandwidth;
+  created.allowFields = settings->allow_video_fields;
+  receivers_.push_back(created);
+  return &handleSpace_[++handles_ % 64];
+}
+
+void ScriptedNdi::RecvDestroy(void*) { LOCKED; ++receiversDestroyed_; }
+
+int ScriptedNdi::Connections(void*) {
+  LOCKED;
+  ++connectionQueries_;
+  return connections_;
+}
+
+std::int32_t ScriptedNdi::Capture(void*, ndi_video_frame_v2* video, ndi_audio_frame_v2* audio,
+                                  ndi_metadata_frame* metadata, std::uint32_t) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  ++captures_;
+  changed_.notify_all();
+  changed_.wait(lock, [this] { return !block_; });
+  if (queue_.empty()) changed_.wait_for(lock, std::chrono::milliseconds(1), [this] { return !queue_.empty(); });
+  if (queue_.empty()) return kNdiFrameNone;
+  std::shared_ptr<nditest::Capture> capture = queue_.front();
+  queue_.pop_front();
+  switch (capture->type) {
+    case kNdiFrameVideo:
+      *video = capture->video;
+      handedOut_[video->data] = capture;
+      break;
+    case kNdiFrameAudio:
+      *audio = capture->audio;
+      handedOut_[audio->data] = capture;
+      break;
+    case kNdiFrameMetadata:
+      *metadata = capture->metadata;
+      handedOut_[metadata->data] = capture;
+      break;
+    default:
+      break;
+  }
+  return capture->type;
+}
+
+void ScriptedNdi::Free(int kind, const void* data) {
+  LOCKED;
+  ++frees_[kind];
+  if (handedOut_.erase(data) != 1) freesMatched_ = false;
+}
+
+bool ScriptedNdi::SetTally(const ndi_tally* tally) {
+  LOCKED;
+  tallies_.push_back(*tally);
+  return tallyOk_;
+}
+
+bool ScriptedNdi::SendMetadata(const ndi_metadata_frame* frame) {
+  LOCKED;
+  metadataLengths_.push_back(frame->length);
+  if (!metadataOk_) return false;
+  metadataSent_.emplace_back(frame->data, frame->length > 0 ? static_cast<std::size_t>(frame->length) - 1 : 0);
+  return true;
+}
+
+bool ScriptedNdi::PtzSupported() { LOCKED; return ptzSupported_; }
+
+bool ScriptedNdi::Ptz(const std::string& call) {
+  LOCKED;
+  ptzCalls_.push_back(call);
+  return true;
+}
+
+#undef LOCKED
+
+}  // namespace nditest
