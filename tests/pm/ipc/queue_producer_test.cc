@@ -82,6 +82,9 @@ std::uint32_t TokenOf(const std::vector<std::uint8_t>& r) {
 }
 
 struct Fixture : ::testing::Test {
+  // First, so that it outlives the producer thread, which may log until it
+  // is joined.
+  pmtest::LogCapture log;
   std::unique_ptr<Server> server = Server::CreateListening();
   Releases releases;
   std::array<std::uint8_t, 60> record{};
@@ -170,7 +173,6 @@ TEST_F(ProducerTokens, ReleasedOnTheProducerThreadOnlyWhenEveryReaderReturned) {
 }
 
 TEST_F(ProducerTokens, ReturnsOfUnknownOrNotOwedTokensAreLoggedAndIgnored) {
-  pmtest::LogCapture log;
   auto a = Add();
   auto b = Add();
   ASSERT_TRUE(Send(5));
@@ -193,7 +195,6 @@ TEST_F(ProducerTokens, ReturnsOfUnknownOrNotOwedTokensAreLoggedAndIgnored) {
 }
 
 TEST_F(ProducerTokens, TokenReturnedByAReaderThatNeverGotItIsNotCounted) {
-  pmtest::LogCapture log;
   auto a = Add();
   ASSERT_TRUE(Send(8));  // only a receives 8
   auto b = Add();
@@ -259,7 +260,6 @@ TEST_F(ProducerReaders, SameConnectionTwiceIsRefused) {
 }
 
 TEST_F(ProducerReaders, StaleBytesFromBeforeTheReaderWasAddedAreDiscarded) {
-  pmtest::LogCapture log;
   auto reader = std::make_unique<Reader>(*server);
   reader->Return(3);
   reader->Return(4);
@@ -275,7 +275,6 @@ TEST_F(ProducerReaders, StaleBytesFromBeforeTheReaderWasAddedAreDiscarded) {
 }
 
 TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
-  pmtest::LogCapture log;
   auto a = Add();
   auto b = Add();
   for (std::uint32_t token : {7u, 2u, 5u}) ASSERT_TRUE(Send(token));
@@ -374,7 +373,6 @@ TEST_F(ProducerLifecycle, ThreadIsNamedAndJoined) {
 }
 
 TEST_F(ProducerLifecycle, RestartKeepsReadersAndDiscardsTheirStaleReturns) {
-  pmtest::LogCapture log;
   auto reader = Add();
   ASSERT_TRUE(Send(1));
   reader->ReadRecord(64);
