@@ -1,0 +1,253 @@
+// The segment pool of a source and its record channel to the host: ids,
+// sizes, reuse, holds, records with their check bytes, the host connection,
+// GPU segments, and what is left in /dev/shm.
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+
+#include <cstring>
+#include <filesystem>
+
+#include "pm/runtime/context.h"
+#include "pm/shm/shared_gpu_memory.h"
+#include "pm/shm/shared_memory_queue.h"
+#include "support/host_link.h"
+#include "support/log_capture.h"
+#include "support/wait.h"
+
+namespace {
+
+using pm::SharedMemoryQueueProducer;
+
+std::uint64_t ShmFileSize(const std::string& name) {
+  struct stat st {};
+  if (::stat(("/dev/shm/" + name).c_str(), &st) != 0) return 0;
+  return static_cast<std::uint64_t>(st.st_size);
+}
+
+bool ShmExists(const std::string& name) { return std::filesystem::exists("/dev/shm/" + name); }
+
+struct StartedQueue {
+  pmtest::HostLink link;
+  std::shared_ptr<SharedMemoryQueueProducer> queue = std::make_shared<SharedMemoryQueueProducer>();
+  std::string base = "pmtestq" + std::to_string(::getpid()) + "_";
+  nlohmann::json startRequest;
+  std::atomic<bool> hostConnected{false};
+
+  explicit StartedQueue(bool start = true) {
+    if (!start) return;
+    queue->StartQueue(link.Dispatcher(), "NDICaptureDevice~CAM", base, [this] { hostConnected = true; });
+    startRequest = link.ReadCommand("NDICaptureDevice~CAM::start_queue").value_or(nullptr);
+  }
+};
+
+TEST(QueueCheckBytes, MatchTheReferenceVectorAndZeroTheSums) {
+  const std::uint8_t abc[3] = {'a', 'b', 'c'};
+  EXPECT_EQ(pmtest::FletcherSums(abc, 3), std::make_pair(39u, 76u));
+  std::uint8_t check[2];
+  SharedMemoryQueueProducer::CheckBytes(abc, 3, check);
+  EXPECT_EQ(check[0], 0x8C);
+  EXPECT_EQ(check[1], 0x4C);
+  std::uint8_t record[60];
+  for (int i = 0; i < 58; ++i) record[i] = static_cast<std::uint8_t>(i * 37 + 11);
+  SharedMemoryQueueProducer::CheckBytes(record, 58, record + 58);
+  EXPECT_EQ(pmtest::FletcherSums(record, 60), std::make_pair(0u, 0u));
+}
+
+TEST(QueueStart, AnnouncesPortAndMemoryBase) {
+  StartedQueue q;
+  ASSERT_TRUE(q.startRequest.is_object());
+  EXPECT_EQ(q.startRequest["memoryBase"], q.base);
+  EXPECT_EQ(q.startRequest["port"], q.queue->Port());
+  EXPECT_GT(q.queue->Port(), 0);
+}
+
+TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
+  StartedQueue q;
+  auto a = q.queue->AllocateCpuBuffer(1);
+  auto b = q.queue->AllocateCpuBuffer(1);
+  auto c = q.queue->AllocateCpuBuffer(1);
+  EXPECT_EQ(a->id, 1u);
+  EXPECT_EQ(b->id, 2u);
+  EXPECT_EQ(c->id, 3u);
+  q.queue->DeleteBuffer(b);
+  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 4u);  // ids keep growing after a delete
+  q.queue->SeedNextId(0xFFFFFFFFu);
+  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 0xFFFFFFFFu);
+  // Wrapped: 0 is never used, 1 is still in the pool, 2 is free again.
+  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 2u);
+}
+
+TEST(QueueSizes, AreRoundedUpTo4096) {
+  StartedQueue q;
+  auto one = q.queue->AllocateCpuBuffer(1);
+  auto more = q.queue->AllocateCpuBuffer(4097);
+  EXPECT_EQ(one->Size(), 4096u);
+  EXPECT_EQ(more->Size(), 8192u);
+  EXPECT_EQ(ShmFileSize(q.base + std::to_string(one->id)), 4096u);
+  EXPECT_EQ(ShmFileSize(q.base + std::to_string(more->id)), 8192u);
+  EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
+}
+
+TEST(QueueReuse, PicksTheSmallestFreeSegmentThatFitsAndNeverAHeldOne) {
+  StartedQueue q;
+  pm::VideoFormat format;
+  format.code = pm::kCode2vuy;
+  format.width = 64;
+  format.height = 64;  // 8192 bytes at the default stride of 128
+  auto big = q.queue->AllocateVideoBuffer(format, 0, false);
+  format.height = 16;
+  auto small = q.queue->AllocateVideoBuffer(format, 0, false);
+  ASSERT_TRUE(big && small);
+  EXPECT_EQ(big->descriptor.stride, 128u);
+  EXPECT_EQ(q.queue->AllocateVideoBuffer(format, 0, true), nullptr);  // both held
+  q.queue->ReturnBuffer(big);
+  q.queue->ReturnBuffer(small);
+  EXPECT_EQ(q.queue->AllocateVideoBuffer(format, 0, true), small);
+  EXPECT_EQ(q.queue->AllocateVideoBuffer(format, 0, true), big);  // small is held now
+  EXPECT_EQ(q.queue->AllocateVideoBuffer(format, 0, true), nullptr);
+  // A larger stride than the segment was laid out for does not fit.
+  q.queue->ReturnBuffer(big);
+  EXPECT_EQ(q.queue->AllocateVideoBuffer(format, 256, true), nullptr);
+}
+
+TEST(QueueReuse, FindFreeBufferTakesAHoldSoTwoRequestsNeverShareASegment) {
+  StartedQueue q;
+  auto segment = q.queue->AllocateCpuBuffer(3840);
+  q.queue->ReturnBuffer(segment);
+  auto first = q.queue->FindFreeBuffer(3840);
+  EXPECT_EQ(first, segment);
+  EXPECT_EQ(q.queue->FindFreeBuffer(3840), nullptr);
+  EXPECT_EQ(q.queue->FindFreeBuffer(5000), nullptr);  // too small
+}
+
+TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnReturn) {
+  StartedQueue q;
+  pmtest::QueueReader host(q.queue->Port());
+  ASSERT_TRUE(host.Connected());
+  auto segment = q.queue->AllocateCpuBuffer(100);
+  segment->descriptor.stride = 1;
+  std::uint8_t payload[34];
+  for (int i = 0; i < 34; ++i) payload[i] = static_cast<std::uint8_t>(0xA0 + i);
+  // The host's connection is accepted on the listener thread.
+  ASSERT_TRUE(pmtest::WaitFor([&] { return q.hostConnected.load(); }));
+  EXPECT_TRUE(q.queue->SendBuffer(segment, payload));
+  std::uint32_t token = 0;
+  std::uint8_t record[60];
+  ASSERT_TRUE(host.ReadRecord(&token, record));
+  EXPECT_EQ(token, segment->id);
+  const std::uint8_t cpuTag[4] = {0x2E, 0x55, 0x50, 0x43};
+  EXPECT_EQ(std::memcmp(record, cpuTag, 4), 0);
+  std::uint64_t size = 0;
+  std::memcpy(&size, record + 12, 8);
+  EXPECT_EQ(size, 4096u);
+  EXPECT_EQ(std::memcmp(record + 24, payload, 34), 0);
+  EXPECT_EQ(pmtest::FletcherSums(record, 60), std::make_pair(0u, 0u));
+
+  EXPECT_EQ(segment->inUse.load(), 1);  // held until the host returns the token
+  ASSERT_TRUE(host.ReturnToken(token));
+  EXPECT_TRUE(pmtest::WaitFor([&] { return segment->inUse.load() == 0; }));
+}
+
+TEST(QueueRecords, WithoutAHostTheHoldIsDroppedAtOnce) {
+  StartedQueue q;
+  auto segment = q.queue->AllocateCpuBuffer(100);
+  std::uint8_t payload[34] = {};
+  EXPECT_TRUE(q.queue->SendBuffer(segment, payload));
+  EXPECT_EQ(segment->inUse.load(), 0);
+}
+
+TEST(QueueRecords, RefusedBeforeStartSilentlyAndForDeletedSegmentsWithALogLine) {
+  StartedQueue unstarted(false);
+  auto early = unstarted.queue->AllocateCpuBuffer(100);
+  std::uint8_t payload[34] = {};
+  {
+    pmtest::LogCapture capture;
+    EXPECT_FALSE(unstarted.queue->SendBuffer(early, payload));
+    EXPECT_TRUE(capture.Lines().empty());
+  }
+  StartedQueue q;
+  auto segment = q.queue->AllocateCpuBuffer(100);
+  q.queue->DeleteBuffer(segment);
+  auto deleted = q.link.ReadCommand("NDICaptureDevice~CAM::delete_memory");
+  ASSERT_TRUE(deleted.has_value());
+  EXPECT_EQ((*deleted)["unique_id"], segment->id);
+  pmtest::LogCapture capture;
+  EXPECT_FALSE(q.queue->SendBuffer(segment, payload));
+  EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"SharedMemoryQueueProducer: Attempt to use deleted buffer\n"}));
+}
+
+TEST(QueueHost, ASecondConnectionAttemptIsRefused) {
+  StartedQueue q;
+  const int port = q.queue->Port();
+  pmtest::QueueReader first(port);
+  ASSERT_TRUE(first.Connected());
+  ASSERT_TRUE(pmtest::WaitFor([&] { return pm::ipc::Connection::Open(port) == nullptr; }));
+}
+
+TEST(QueueShm, NothingIsLeftAfterTheQueueGoes) {
+  std::string name;
+  {
+    StartedQueue q;
+    auto segment = q.queue->AllocateCpuBuffer(5000);
+    name = q.base + std::to_string(segment->id);
+    EXPECT_TRUE(ShmExists(name));
+  }
+  EXPECT_FALSE(ShmExists(name));
+}
+
+// A GPU memory manager that the runner could register; records what it made.
+class FakeGpuSegment : public pm::SharedGpuMemory {
+ public:
+  explicit FakeGpuSegment(const pm::VideoFormat& f) : format_(f) { descriptor.size = 1; }
+  std::uint64_t Size() const override { return descriptor.size; }
+  std::pair<std::uint8_t*, std::int32_t> Lock() override { return {nullptr, 0}; }
+  void Unlock() override {}
+  bool IsLocked() const override { return false; }
+  pm::VideoFormat Format() const override { return format_; }
+
+ private:
+  pm::VideoFormat format_;
+};
+
+class FakeGpuManager : public pm::SharedGpuMemoryManager {
+ public:
+  std::shared_ptr<pm::SharedMemory> Allocate(const pm::VideoFormat& format) override {
+    ++made;
+    return std::make_shared<FakeGpuSegment>(format);
+  }
+  int made = 0;
+};
+
+TEST(QueueGpu, ARegisteredManagerIsPreferredAndMatchedFieldByField) {
+  auto manager = std::make_shared<FakeGpuManager>();
+  {
+    std::lock_guard<std::mutex> guard(pm::GetContext()->registryLock);
+    pm::GetContext()->registry["SharedGpuMemoryManager"] = manager;
+  }
+  {
+    StartedQueue q;
+    pm::VideoFormat format;
+    format.code = pm::kCodeNV12;
+    format.width = 1920;
+    format.height = 1080;
+    auto segment = q.queue->AllocateVideoBuffer(format, 0, false);
+    ASSERT_TRUE(segment);
+    EXPECT_EQ(segment->descriptor.type, pm::kGpuMemoryType);
+    EXPECT_EQ(manager->made, 1);
+    q.queue->ReturnBuffer(segment);
+    // Extra width/height 0 count as width/height; byteSize is not compared.
+    pm::VideoFormat same = format;
+    same.extraWidth = 1920;
+    same.byteSize = 77;
+    EXPECT_EQ(q.queue->AllocateVideoBuffer(same, 0, true), segment);
+    q.queue->ReturnBuffer(segment);
+    pm::VideoFormat other = format;
+    other.scan = 'P';
+    EXPECT_EQ(q.queue->AllocateVideoBuffer(other, 0, true), nullptr);
+  }
+  std::lock_guard<std::mutex> guard(pm::GetContext()->registryLock);
+  pm::GetContext()->registry.erase("SharedGpuMemoryManager");
+}
+
+}  // namespace
