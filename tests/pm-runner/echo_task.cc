@@ -2,8 +2,10 @@
 // throw, ask the host a question of their own, and end the task.
 #include <unistd.h>
 
+#include <chrono>
 #include <memory>
 #include <stdexcept>
+#include <thread>
 
 #include <nlohmann/json.hpp>
 
@@ -28,9 +30,18 @@ class EchoTask : public pm::Task {
       throw std::runtime_error("the handler failed on purpose");
     });
     dispatcher->RegisterHandler("test::stop_task", [this](const Json&, Json&) { StopTask(); });
+    std::weak_ptr<pm::RpcDispatcher> weak = dispatcher;
+    // A handler that never comes back in time (it tells the host it started):
+    // the runner must not wait for it for ever when it ends.
+    dispatcher->RegisterHandler("test::hang", [weak](const Json&, Json&) {
+      if (auto self = weak.lock()) {
+        Json note = Json::object();
+        self->RpcRequest("test::hanging", note, 10000);
+      }
+      std::this_thread::sleep_for(std::chrono::seconds(60));
+    });
     // Sends the host a request whose reply's "answer" comes back to the host
     // in a "test::callback_ran" notification, from the request's callback.
-    std::weak_ptr<pm::RpcDispatcher> weak = dispatcher;
     dispatcher->RegisterHandler("test::ask_host", [weak](const Json& request, Json& response) {
       auto self = weak.lock();
       if (!self) return;
