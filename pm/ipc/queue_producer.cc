@@ -99,28 +99,38 @@ bool Producer::AddConnection(std::shared_ptr<Connection> connection) {
 }
 
 bool Producer::Send(std::uint32_t token, const BufferList& record) {
-  std::lock_guard<std::mutex> hold(lock_);
-  std::uint64_t total = 0;  // 64-bit: lengths that wrap round 32 bits must not pass
-  for (const auto& [pointer, length] : record) {
-    if (recordSize_ >= 1 && pointer == nullptr) return false;
-    total += length;
-  }
-  if (total != recordSize_) return false;
+  std::vector<std::shared_ptr<Connection>> readers;
+  {
+    std::lock_guard<std::mutex> hold(lock_);
+    std::uint64_t total = 0;  // 64-bit: lengths that wrap round 32 bits must not pass
+    for (const auto& [pointer, length] : record) {
+      if (recordSize_ >= 1 && pointer == nullptr) return false;
+      total += length;
+    }
+    if (total != recordSize_) return false;
 
-  if (connections_.empty()) {
-    if (releaseCallback_) releaseCallback_(token);
-    return true;
+    if (connections_.empty()) {
+      if (releaseCallback_) releaseCallback_(token);
+      return true;
+    }
+    // Every reader owes the token before its record can reach it, so that a
+    // quick return always finds it pending.
+    auto& owing = pending_[token];
+    for (const auto& connection : connections_) owing.insert(connection);
+    readers = connections_;
   }
+  // The writes go out after the lock is let go: a reader that does not read
+  // (its socket buffer full) then blocks only this sender, never Stop, the
+  // other senders' accounting or the producer thread's token returns. Each
+  // Connection's own lock keeps concurrent records whole on its wire.
   const std::uint8_t tokenBytes[4] = {static_cast<std::uint8_t>(token), static_cast<std::uint8_t>(token >> 8),
                                       static_cast<std::uint8_t>(token >> 16),
                                       static_cast<std::uint8_t>(token >> 24)};
   BufferList list;
   list.reserve(record.size() + 1);
   list.emplace_back(tokenBytes, 4);
-  if (recordSize_ > 0) list.insert(list.end(), record.begin(), record.end());
-  auto& owing = pending_[token];
-  for (const auto& connection : connections_) {
-    owing.insert(connection);
+  list.insert(list.end(), record.begin(), record.end());
+  for (const auto& connection : readers) {
     // A reader whose write failed still owes the token; if it has gone, the
     // producer thread finds out on its next read and gives the token up.
     connection->Send(list);

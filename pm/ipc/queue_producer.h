@@ -26,9 +26,11 @@
 //     must therefore not call back into the producer. Stop (or destroy) the
 //     producer before destroying what the callback uses.
 //
-// Lock order: Producer::lock_, then a reader Connection's lock (records are
-// written under lock_), then whatever the release callback takes (the
-// shared-memory queue's lock). Nothing takes them the other way round.
+// Lock order: Producer::lock_, then whatever the release callback takes (the
+// shared-memory queue's lock). Records are written to the readers after
+// lock_ is let go, under each Connection's own lock, so a reader that stops
+// reading holds up only the sender that is writing to it. Nothing takes
+// these locks the other way round.
 
 #include <atomic>
 #include <cstdint>

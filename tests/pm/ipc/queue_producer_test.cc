@@ -337,6 +337,30 @@ TEST_F(ProducerReaders, ReaderClosedOnOurSideIsDroppedToo) {
   EXPECT_LE(producer.LoopPasses() - before, 10u);
 }
 
+TEST_F(ProducerReaders, ReaderThatStopsReadingHoldsUpOnlyItsSender) {
+  constexpr std::uint32_t kBig = 1 << 20;  // a few records fill both socket buffers
+  ASSERT_TRUE(producer.Start(kBig, releases.Callback()));
+  std::vector<std::uint8_t> big(kBig);
+  auto stuck = Add();  // never reads
+  std::atomic<int> sent{0};
+  std::thread sender([&] {
+    for (std::uint32_t token = 100; token < 164; ++token) {
+      producer.Send(token, {{big.data(), kBig}});
+      ++sent;
+    }
+  });
+  ASSERT_TRUE(pmtest::WaitFor([&] { return producer.PendingCount() > 0; }));
+  // Whatever the sender is blocked in, the producer's lock is free: other
+  // calls go on, and Stop releases what is pending.
+  EXPECT_FALSE(producer.AddConnection(stuck->task));
+  producer.Stop();
+  EXPECT_FALSE(releases.Tokens().empty());
+  EXPECT_LT(sent.load(), 64);
+  // Closing the reader's connection ends the blocked write.
+  stuck->task->Close();
+  sender.join();
+}
+
 // ---------------------------------------------------------------------------
 
 using ProducerLifecycle = Fixture;
