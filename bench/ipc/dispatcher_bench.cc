@@ -239,9 +239,16 @@ class RatioReporter : public benchmark::ConsoleReporter {
  public:
   void ReportRuns(const std::vector<Run>& runs) override {
     ConsoleReporter::ReportRuns(runs);
+    // With --benchmark_repetitions the median stands for the benchmark.
     for (const Run& run : runs) {
-      if (run.run_type == Run::RT_Iteration && !run.error_occurred)
-        realTime_[run.run_name.function_name] = run.GetAdjustedRealTime();
+      if (run.error_occurred) continue;
+      const std::string& name = run.run_name.function_name;
+      if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median") {
+        realTime_[name] = run.GetAdjustedRealTime();
+        fromMedian_[name] = true;
+      } else if (run.run_type == Run::RT_Iteration && !fromMedian_[name]) {
+        realTime_[name] = run.GetAdjustedRealTime();
+      }
     }
   }
   void PrintRatios() const {
@@ -257,6 +264,7 @@ class RatioReporter : public benchmark::ConsoleReporter {
 
  private:
   std::map<std::string, double> realTime_;
+  std::map<std::string, bool> fromMedian_;
 };
 
 }  // namespace
