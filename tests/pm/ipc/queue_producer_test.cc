@@ -129,15 +129,6 @@ TEST_F(ProducerRecord, WrongLengthsOrMissingPointersWriteNothing) {
   EXPECT_TRUE(releases.Tokens().empty());
 }
 
-TEST_F(ProducerRecord, RecordSizeZeroSendsTheTokenAlone) {
-  ASSERT_TRUE(producer.Start(0, releases.Callback()));
-  auto reader = Add();
-  EXPECT_FALSE(producer.Send(7, {{record.data(), 1}}));
-  ASSERT_TRUE(producer.Send(7, {}));
-  EXPECT_EQ(TokenOf(reader->ReadRecord(4)), 7u);
-  EXPECT_TRUE(reader->Quiet());
-}
-
 TEST_F(ProducerRecord, SendBeforeAnyReaderReleasesDuringTheCall) {
   EXPECT_TRUE(Send(9));
   ASSERT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{9}));
@@ -192,18 +183,6 @@ TEST_F(ProducerTokens, ReturnsOfUnknownOrNotOwedTokensAreLoggedAndIgnored) {
   ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("pm::ipc:queue::Producer : Token (5) not found."); }));
   EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{5}));
   EXPECT_EQ(producer.ReaderCount(), 2u);  // bad returns do not cost a reader its place
-}
-
-TEST_F(ProducerTokens, TokenReturnedByAReaderThatNeverGotItIsNotCounted) {
-  auto a = Add();
-  ASSERT_TRUE(Send(8));  // only a receives 8
-  auto b = Add();
-  a->ReadRecord(64);
-  b->Return(8);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("Connection not found for token (8)."); }));
-  EXPECT_TRUE(releases.Tokens().empty());
-  a->Return(8);
-  ASSERT_TRUE(releases.WaitForCount(1));
 }
 
 TEST_F(ProducerTokens, StopReleasesEveryPendingTokenInAscendingOrder) {
@@ -315,17 +294,6 @@ TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{6, 5, 7, 2, 11}));
 }
 
-TEST_F(ProducerReaders, LastReaderGoneReleasesEverythingInAscendingOrder) {
-  auto a = Add();
-  for (std::uint32_t token : {9u, 1u, 4u}) ASSERT_TRUE(Send(token));
-  a->host.reset();
-  ASSERT_TRUE(releases.WaitForCount(3));
-  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{1, 4, 9}));
-  EXPECT_EQ(producer.ReaderCount(), 0u);
-  EXPECT_TRUE(Send(12));  // no reader any more: released at once
-  EXPECT_EQ(releases.Tokens().back(), 12u);
-}
-
 TEST_F(ProducerReaders, ReaderClosedOnOurSideIsDroppedToo) {
   auto a = Add();
   ASSERT_TRUE(Send(3));
@@ -428,15 +396,6 @@ TEST(ProducerDestroy, PendingTokensAreDroppedWithoutCallbacks) {
   EXPECT_TRUE(releases.Tokens().empty());
   // The reader's Connection belongs to its other owners and stays usable.
   EXPECT_TRUE(reader.task->IsConnected());
-}
-
-TEST(ProducerDestroy, NeverStartedProducerIsHarmless) {
-  Producer producer;
-  const std::uint32_t value = 0;
-  EXPECT_TRUE(producer.Send(1, {}));  // record size 0, no reader, no callback
-  EXPECT_FALSE(producer.Send(1, {{&value, 4}}));
-  producer.Stop();
-  producer.Wake();
 }
 
 }  // namespace
