@@ -6,8 +6,9 @@
 //
 // Threads: any thread may call the public operations; the I/O thread
 // ("ndi-lb sender") is started by Create and joined by the destructor.
-// Lock order: Sender::mutex_ -> Conn::write_mutex (never the reverse; frame
-// writes take only the Conn lock, with the connection list copied first).
+// Lock order: Sender::mutex_ and a Conn's write_mutex are never held
+// together (frame writes copy the connection list under mutex_, release it,
+// then take each Conn's lock in turn); at most one Conn lock at a time.
 #include <sys/uio.h>
 
 #include <atomic>
