@@ -1,0 +1,328 @@
+// pm::TaskSource through a real dispatcher over loopback, with scripted
+// sources and discovery that write every call into one journal: what each
+// source is given, which running source or discovery is stopped before it is
+// replaced or released, Shutdown's order, and the task stopping itself.
+#include "pm/task/task_source.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "pm/ipc/connection.h"
+#include "pm/runtime/dispatcher.h"
+#include "pm/runtime/host_socket.h"
+#include "support/log_capture.h"
+#include "support/wait.h"
+
+namespace {
+
+using Json = nlohmann::json;
+using namespace std::chrono_literals;
+
+// Every call of the scripted objects, in order, as one line each.
+class Journal {
+ public:
+  void Add(std::string line) {
+    std::lock_guard<std::mutex> guard(mutex_);
+    lines_.push_back(std::move(line));
+  }
+  std::vector<std::string> Lines() {
+    std::lock_guard<std::mutex> guard(mutex_);
+    return lines_;
+  }
+  void Clear() {
+    std::lock_guard<std::mutex> guard(mutex_);
+    lines_.clear();
+  }
+
+ private:
+  std::mutex mutex_;  // guards lines_
+  std::vector<std::string> lines_;
+};
+
+struct Script {
+  bool throwOnConfiguration = false;
+  bool throwOnStart = false;  // after recording the start
+  std::string guiAnswer = "{\"answer\":1}";
+};
+
+class ScriptedSource : public pm::Source {
+ public:
+  ScriptedSource(std::shared_ptr<Callbacks> callbacks, std::string id, int serial, Journal* journal, Script script)
+      : Source(std::move(callbacks), std::move(id)), tag_(UniqueId() + "#" + std::to_string(serial)),
+        journal_(journal), script_(std::move(script)) {}
+  void Start() override {
+    journal_->Add("start " + tag_);
+    if (script_.throwOnStart) throw std::runtime_error("start failed on purpose");
+  }
+  void Stop() override { journal_->Add("stop " + tag_); }
+  void SetConfiguration(std::string text) override {
+    journal_->Add("config " + tag_ + " " + text);
+    if (script_.throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
+  }
+  std::string ValidateGui(std::string text) override {
+    journal_->Add("validate " + tag_ + " " + text);
+    return script_.guiAnswer;
+  }
+  std::string GuiToConfiguration(std::string text) override {
+    journal_->Add("to_config " + tag_ + " " + text);
+    return script_.guiAnswer;
+  }
+  std::string ConfigurationToGui(std::string text) override {
+    journal_->Add("to_gui " + tag_ + " " + text);
+    return script_.guiAnswer;
+  }
+  void ExecuteCustomActionCommand(std::string command) override { journal_->Add("action " + tag_ + " " + command); }
+  void ExecutePtzCommand(const Json& request) override { journal_->Add("ptz " + tag_ + " " + request.value("zoom", "")); }
+  void HandleShotEvent(std::string event) override { journal_->Add("shot " + tag_ + " " + event); }
+  void SourceHotplugEvent() override { journal_->Add("hotplug " + tag_); }
+
+ private:
+  std::string tag_;
+  Journal* journal_;
+  Script script_;
+};
+
+class ScriptedDiscovery : public pm::SourceDiscovery {
+ public:
+  ScriptedDiscovery(std::shared_ptr<Callbacks> callbacks, int serial, Journal* journal)
+      : SourceDiscovery(std::move(callbacks)), tag_("discovery#" + std::to_string(serial)), journal_(journal) {}
+  void Start() override { journal_->Add("start " + tag_); }
+  void Stop() override { journal_->Add("stop " + tag_); }
+  void DiscoveryHotplugEvent() override { journal_->Add("hotplug " + tag_); }
+
+ private:
+  std::string tag_;
+  Journal* journal_;
+};
+
+// A task with scripted factories, one dispatcher attached as the runner
+// attaches it, and the host's end of that connection.
+class TaskSourceTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    task_ = std::make_unique<pm::TaskSource>();
+    task_->SetSourceFactory([this](std::shared_ptr<pm::Source::Callbacks> callbacks, std::string id) {
+      return std::make_shared<ScriptedSource>(std::move(callbacks), std::move(id), ++sourceSerial_, &journal_, script_);
+    });
+    task_->SetDiscoveryFactory([this](std::shared_ptr<pm::SourceDiscovery::Callbacks> callbacks) {
+      return std::make_shared<ScriptedDiscovery>(std::move(callbacks), ++discoverySerial_, &journal_);
+    });
+    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.Port());
+    ASSERT_TRUE(connection);
+    host_ = listener_.Accept();
+    ASSERT_TRUE(host_.Valid());
+    dispatcher_ = std::make_shared<pm::RpcDispatcher>(std::move(connection));
+    task_->AddDispatcher(dispatcher_);
+    task_->AttachDispatcher(dispatcher_);
+    dispatcher_->Start();
+  }
+  void TearDown() override {
+    task_.reset();
+    dispatcher_.reset();
+  }
+
+  // Sends a command and returns its reply, skipping the task's own requests
+  // (a started source announces its buffer queue).
+  Json Ask(const std::string& command, Json body = Json::object()) {
+    const std::uint64_t id = ++requestId_;
+    body["pm::command"] = command;
+    body["pm::unique_id"] = id;
+    body["pm::request"] = true;
+    EXPECT_TRUE(host_.WriteJson(body));
+    for (;;) {
+      const Json frame = host_.ReadJson(5s);
+      if (frame.is_discarded()) return frame;
+      if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
+    }
+  }
+  void StartSource(const std::string& id, const Json* config = nullptr) {
+    Json body = {{"unique_id", id}};
+    if (config) body["config"] = *config;
+    Ask("pm::tsrc::start_source", body);
+  }
+
+  pmtest::HostListener listener_;
+  pmtest::HostPeer host_;
+  std::shared_ptr<pm::RpcDispatcher> dispatcher_;
+  std::unique_ptr<pm::TaskSource> task_;
+  Journal journal_;
+  Script script_;
+  std::atomic<int> sourceSerial_{0};
+  std::atomic<int> discoverySerial_{0};
+  std::uint64_t requestId_ = 0;
+};
+
+using Lines = std::vector<std::string>;
+
+TEST_F(TaskSourceTest, EmptyConfigurationsGiveEmptyTextAndOthersStayExact) {
+  const Json cases[] = {Json::object(), Json::array(), Json(), Json::parse(R"({"a":1})"), Json::parse(R"([1,"x"])"),
+                        Json("text"), Json(0), Json(false)};
+  StartSource("absent");
+  for (std::size_t i = 0; i < std::size(cases); ++i) StartSource("s" + std::to_string(i), &cases[i]);
+  const Lines lines = journal_.Lines();
+  EXPECT_EQ(lines[0], "config absent#1 ");
+  EXPECT_EQ(lines[2], "config s0#2 ");
+  EXPECT_EQ(lines[4], "config s1#3 ");
+  EXPECT_EQ(lines[6], "config s2#4 ");
+  EXPECT_EQ(lines[8], R"(config s3#5 {"a":1})");
+  EXPECT_EQ(lines[10], R"(config s4#6 [1,"x"])");
+  EXPECT_EQ(lines[12], R"(config s5#7 "text")");
+  EXPECT_EQ(lines[14], "config s6#8 0");
+  EXPECT_EQ(lines[16], "config s7#9 false");
+  EXPECT_EQ(task_->SourceCount(), 9u);
+}
+
+TEST_F(TaskSourceTest, SetConfigurationAndGuiCommandsPassNullForAbsentKeys) {
+  StartSource("a");
+  journal_.Clear();
+  EXPECT_EQ(Ask("pm::tsrc::set_configuration", {{"unique_id", "a"}})["unique_id"], "a");
+  Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}});
+  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
+  reply = Ask("pm::tsrc::gui_to_configuration", {{"unique_id", "a"}, {"gui", {{"x", 2}}}});
+  EXPECT_EQ(reply["config"], Json::parse(R"({"answer":1})"));
+  reply = Ask("pm::tsrc::configuration_to_gui", {{"unique_id", "a"}, {"config", Json::object()}});
+  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
+  Ask("pm::tsrc::execute_custom_action_command", {{"unique_id", "a"}});
+  Ask("pm::tsrc::handle_shot_event", {{"unique_id", "a"}, {"event", 7}});
+  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 null", "validate a#1 null", R"(to_config a#1 {"x":2})",
+                                     "to_gui a#1 {}", "action a#1 ", "shot a#1 7"}));
+}
+
+TEST_F(TaskSourceTest, SourceAnswerThatIsNotJsonBecomesNullWithALogLine) {
+  script_.guiAnswer = "{not json";
+  StartSource("a");
+  pmtest::LogCapture log;
+  const Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}, {"gui", "g"}});
+  ASSERT_TRUE(reply.contains("gui"));
+  EXPECT_TRUE(reply["gui"].is_null());
+  EXPECT_TRUE(log.Contains("pmjson::Parse failed: validate_gui '{not json'"));
+}
+
+TEST_F(TaskSourceTest, SecondStartForARunningIdStopsTheOldSourceBeforeTheNewStarts) {
+  StartSource("a");
+  StartSource("a");
+  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 ", "start a#1", "stop a#1", "config a#2 ", "start a#2"}));
+  EXPECT_EQ(task_->SourceCount(), 1u);
+  journal_.Clear();
+  Ask("pm::tsrc::source_hotplug_event", {{"unique_id", "a"}});
+  EXPECT_EQ(journal_.Lines(), (Lines{"hotplug a#2"}));
+}
+
+TEST_F(TaskSourceTest, StartThatThrowsStopsTheSourceAndLogsTheRequest) {
+  script_.throwOnStart = true;
+  pmtest::LogCapture log;
+  StartSource("a");
+  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 ", "start a#1", "stop a#1"}));
+  EXPECT_EQ(task_->SourceCount(), 0u);
+  // The whole request, indented by 4.
+  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
+  EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
+}
+
+TEST_F(TaskSourceTest, ConfigurationThatThrowsLeavesNothingAndStartsNothing) {
+  script_.throwOnConfiguration = true;
+  pmtest::LogCapture log;
+  StartSource("a");
+  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 "}));
+  EXPECT_EQ(task_->SourceCount(), 0u);
+  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception"), 1);
+}
+
+TEST_F(TaskSourceTest, StartWithANumericOrMissingIdIsLoggedAndChangesNothing) {
+  pmtest::LogCapture log;
+  const Json reply = Ask("pm::tsrc::start_source", {{"unique_id", 5}});
+  EXPECT_FALSE(reply.contains("unique_id"));
+  EXPECT_FALSE(reply.contains("pm::error"));
+  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
+  EXPECT_TRUE(log.Contains("\n    \"unique_id\": 5\n}"));
+  EXPECT_TRUE(journal_.Lines().empty());
+  EXPECT_EQ(task_->SourceCount(), 0u);
+}
+
+TEST_F(TaskSourceTest, SecondStartDiscoveryStopsTheRunningOneFirst) {
+  Ask("pm::tsrc::start_discovery");
+  Ask("pm::tsrc::start_discovery");
+  Ask("pm::tsrc::discovery_hotplug_event");
+  EXPECT_EQ(journal_.Lines(), (Lines{"start discovery#1", "stop discovery#1", "start discovery#2", "hotplug discovery#2"}));
+  Ask("pm::tsrc::stop_discovery");
+  Ask("pm::tsrc::stop_discovery");
+  EXPECT_EQ(journal_.Lines().back(), "stop discovery#2");
+  EXPECT_EQ(journal_.Lines().size(), 5u);
+  EXPECT_FALSE(task_->HasWork());
+}
+
+TEST_F(TaskSourceTest, ShutdownStopsDiscoveryThenSourcesInIdOrderAndKeepsTheTable) {
+  StartSource("b");
+  StartSource("c");
+  StartSource("a");
+  Ask("pm::tsrc::start_discovery");
+  journal_.Clear();
+  task_->Shutdown();
+  EXPECT_EQ(journal_.Lines(), (Lines{"stop discovery#1", "stop a#3", "stop b#1", "stop c#2"}));
+  EXPECT_EQ(task_->SourceCount(), 3u);
+  EXPECT_TRUE(task_->FindSource("a"));
+}
+
+TEST_F(TaskSourceTest, StopOfTheLastSourceWhileDiscoveryRunsKeepsTheConnection) {
+  StartSource("a");
+  Ask("pm::tsrc::start_discovery");
+  Ask("pm::tsrc::stop_source", {{"unique_id", "a"}});
+  EXPECT_EQ(task_->SourceCount(), 0u);
+  EXPECT_EQ(Ask("pm::tsrc::stop_discovery", {{"unique_id", "x"}})["unique_id"], "x");
+  // stop_discovery does not end the task either.
+  EXPECT_FALSE(dispatcher_->Ended());
+  EXPECT_EQ(task_->DispatcherCount(), 1u);
+}
+
+TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
+  StartSource("5");
+  StartSource("6");
+  Ask("pm::tsrc::stop_source", {{"unique_id", 5}});  // read leniently as "5"
+  EXPECT_EQ(task_->SourceCount(), 1u);
+  EXPECT_FALSE(dispatcher_->Ended());
+  ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::stop_source"}, {"pm::unique_id", 99},
+                               {"pm::request", true}, {"unique_id", "6"}}));
+  EXPECT_TRUE(host_.SeesEndOfStream());
+  EXPECT_TRUE(pmtest::WaitFor([&] { return dispatcher_->Ended(); }));
+  EXPECT_EQ(task_->DispatcherCount(), 0u);
+  const Lines lines = journal_.Lines();
+  EXPECT_EQ(lines[lines.size() - 2], "stop 5#1");
+  EXPECT_EQ(lines.back(), "stop 6#2");
+}
+
+TEST_F(TaskSourceTest, PerSourceCommandsForUnknownIdsOnlyEcho) {
+  StartSource("a");
+  journal_.Clear();
+  for (const char* command : {"pm::tsrc::validate_gui", "pm::tsrc::gui_to_configuration",
+                              "pm::tsrc::configuration_to_gui", "pm::tsrc::execute_custom_action_command",
+                              "pm::tsrc::execute_ptz_command", "pm::tsrc::handle_shot_event",
+                              "pm::tsrc::source_hotplug_event", "pm::tsrc::set_configuration"}) {
+    const Json reply = Ask(command, {{"unique_id", "b"}, {"gui", 1}, {"config", 1}});
+    EXPECT_EQ(reply["unique_id"], "b") << command;
+    EXPECT_FALSE(reply.contains("gui")) << command;
+    EXPECT_FALSE(reply.contains("config")) << command;
+    EXPECT_FALSE(reply.contains("pm::error")) << command;
+  }
+  Ask("pm::tsrc::stop_source", {{"unique_id", "b"}});
+  EXPECT_TRUE(journal_.Lines().empty());
+  EXPECT_EQ(task_->SourceCount(), 1u);
+}
+
+TEST_F(TaskSourceTest, DestroyingTheTaskReleasesSourcesWithoutStoppingAndEndsHandlers) {
+  StartSource("a");
+  Ask("pm::tsrc::start_discovery");
+  journal_.Clear();
+  task_.reset();
+  EXPECT_TRUE(journal_.Lines().empty());
+  EXPECT_TRUE(dispatcher_->Ended());
+  // The handlers no longer own the dispatcher: the test's reference is the last.
+  EXPECT_EQ(dispatcher_.use_count(), 1);
+}
+
+}  // namespace
