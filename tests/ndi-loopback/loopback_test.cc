@@ -281,6 +281,32 @@ TEST_F(Loopback, TallyChangesReachTheSender) {
   EXPECT_TRUE(src.WaitEvent(IsEvent("connections")).is_object());
 }
 
+TEST_F(Loopback, SenderCombinesTheTallyOfItsReceiversAndCountsThem) {
+  ndi_send_create settings{"Combined", nullptr, false, false};
+  void* sender = NDIlib_send_create(&settings);
+  ASSERT_NE(sender, nullptr);
+  auto live = std::make_unique<Receiver>(ndilb::FullSourceName("Combined"));
+  Receiver look(ndilb::FullSourceName("Combined"));
+  ASSERT_TRUE(live->WaitConnected());
+  ASSERT_TRUE(look.WaitConnected());
+  EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_send_get_no_connections(sender, 0) == 2; }, 2s));
+  ndi_tally t{};
+  EXPECT_FALSE(NDIlib_send_get_tally(sender, &t, 0)) << "nothing changed yet";
+  const ndi_tally program{true, false}, preview{false, true};
+  ASSERT_TRUE(NDIlib_recv_set_tally(live->get(), &program));
+  ASSERT_TRUE(NDIlib_recv_set_tally(look.get(), &preview));
+  EXPECT_TRUE(pmtest::WaitFor([&] {
+    NDIlib_send_get_tally(sender, &t, 50);
+    return t.on_program && t.on_preview;
+  }, 2s));
+  live.reset();  // its program tally goes with it
+  EXPECT_TRUE(NDIlib_send_get_tally(sender, &t, 2000));
+  EXPECT_FALSE(t.on_program);
+  EXPECT_TRUE(t.on_preview);
+  EXPECT_EQ(NDIlib_send_get_no_connections(sender, 0), 1);
+  NDIlib_send_destroy(sender);
+}
+
 TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncement) {
   for (bool ptz : {false, true}) {
     SCOPED_TRACE(ptz);
