@@ -22,6 +22,8 @@ namespace {
 constexpr int kSendTimeoutMs = 2000;
 constexpr std::size_t kMaxInbox = 256;
 constexpr std::size_t kMaxConnectionMetadata = 64;
+// A connection that has not said hello by then is dropped.
+constexpr std::int64_t kHelloTimeoutNs = 2'000'000'000;
 
 std::string TextOf(const ndi_metadata_frame& frame) {
   if (frame.data == nullptr) return {};
@@ -104,8 +106,12 @@ void Sender::Run() {
       std::lock_guard<std::mutex> lock(mutex_);
       polled = conns_;
     }
-    for (auto& c : polled) fds.push_back({c->fd, POLLIN, 0});
-    const int n = pm::RetryEintr([&] { return ::poll(fds.data(), fds.size(), -1); });
+    bool waiting_for_hello = false;
+    for (auto& c : polled) {
+      fds.push_back({c->fd, POLLIN, 0});
+      waiting_for_hello = waiting_for_hello || !c->hello;
+    }
+    const int n = pm::RetryEintr([&] { return ::poll(fds.data(), fds.size(), waiting_for_hello ? 250 : -1); });
     if (n < 0) {
       pm::Log(pm::LogType::Normal, "", "ndi-loopback: sender poll failed: %s", pm::ErrnoText(errno).c_str());
       break;
@@ -113,9 +119,15 @@ void Sender::Run() {
     if (fds[0].revents != 0) Drain(wake_fd_);
     if (stop_) break;
     if (fds[1].revents != 0) Accept();
+    const std::int64_t now = pm::SteadyNowNs();
     for (std::size_t i = 0; i < polled.size(); ++i) {
-      if (fds[i + 2].revents == 0) continue;
-      if (!ReadFrom(*polled[i])) Drop(polled[i]);
+      Conn& c = *polled[i];
+      if (fds[i + 2].revents != 0 && !ReadFrom(c)) {
+        Drop(polled[i]);
+      } else if (!c.hello && now - c.accepted_ns > kHelloTimeoutNs) {
+        pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a connection that never said hello", name_.c_str());
+        Drop(polled[i]);
+      }
     }
   }
   pm::ClearThreadName();
@@ -126,7 +138,7 @@ void Sender::Accept() {
   if (fd < 0) return;
   TuneConnection(fd, kSendTimeoutMs);
   std::lock_guard<std::mutex> lock(mutex_);
-  conns_.push_back(std::make_shared<Conn>(fd));
+  conns_.push_back(std::make_shared<Conn>(fd, pm::SteadyNowNs()));
 }
 
 bool Sender::ReadFrom(Conn& conn) {

@@ -50,10 +50,11 @@ class Sender {
 
  private:
   struct Conn {
-    explicit Conn(int f) : fd(f), decoder(SenderSideLimits(), nullptr) {}
+    Conn(int f, std::int64_t now_ns) : fd(f), accepted_ns(now_ns), decoder(SenderSideLimits(), nullptr) {}
     std::mutex write_mutex;  // guards fd (for writes and the close) and dead
     int fd;
     bool dead = false;
+    const std::int64_t accepted_ns;  // steady clock
     Decoder decoder;          // I/O thread only
     bool hello = false;       // I/O thread only
     std::int32_t bandwidth = kNdiBandwidthHighest;  // written before `active`

@@ -569,6 +569,11 @@ TEST_F(Loopback, GarbageOnASendersPortDropsOnlyThatConnection) {
   EXPECT_TRUE(ClosedByPeer(oversize, 2s)) << "a 4 GB text is refused, not awaited";
   close(oversize);
 
+  const int silent = RawConnect(src.url());
+  ASSERT_GE(silent, 0);
+  EXPECT_TRUE(ClosedByPeer(silent, 4s)) << "a connection that never says hello is not kept";
+  close(silent);
+
   // The real receiver kept its connection and its frames.
   EXPECT_EQ(rx.Connections(), 1);
   ndi_video_frame_v2 v{};
