@@ -9,7 +9,10 @@
 //   DispatcherRoundTrip      RpcRequest on one dispatcher, the handler on a
 //                            second one, the reply completing the pending
 //                            request and its callback waking the caller.
-// Prints the ratios to the raw ping-pong at the end (goal: at most 1.5).
+//   Paired/...               the subject and the raw ping-pong alternately,
+//                            round trip by round trip, so that both see the
+//                            same machine load; counter "ratio".
+// Prints the paired ratios at the end (goal: at most 1.5).
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
@@ -33,6 +36,7 @@
 
 #include "pm/ipc/connection.h"
 #include "pm/ipc/server.h"
+#include "pm/runtime/clock.h"
 #include "pm/runtime/dispatcher.h"
 #include "pm/runtime/json.h"
 
@@ -128,30 +132,37 @@ int ConnectTo(int port) {
   return fd;
 }
 
-void RawPingPong(benchmark::State& state) {
-  Listener listener;
-  const int client = ConnectTo(listener.port);
-  const int server = listener.Accept();
-  const std::string request = Frame(RequestText());
-  const std::string reply = Frame(ReplyText());
-  std::thread echo([&] {
-    std::string body;
-    while (RecvFrame(server, body)) {
-      if (!SendAll(server, reply)) break;
-    }
-  });
-  std::string body;
-  for (auto _ : state) {
-    if (!SendAll(client, request) || !RecvFrame(client, body)) {
-      state.SkipWithError("raw ping-pong failed");
-      break;
-    }
+// The baseline: a client socket and an echo thread that answers each request
+// frame with the reply frame.
+class RawPair {
+ public:
+  RawPair() : request_(Frame(RequestText())), reply_(Frame(ReplyText())) {
+    client_ = ConnectTo(listener_.port);
+    server_ = listener_.Accept();
+    echo_ = std::thread([this] {
+      std::string body;
+      while (RecvFrame(server_, body)) {
+        if (!SendAll(server_, reply_)) break;
+      }
+    });
   }
-  ::shutdown(client, SHUT_RDWR);
-  echo.join();
-  ::close(client);
-  ::close(server);
-}
+  ~RawPair() {
+    ::shutdown(client_, SHUT_RDWR);
+    echo_.join();
+    ::close(client_);
+    ::close(server_);
+  }
+  bool RoundTrip() { return SendAll(client_, request_) && RecvFrame(client_, body_); }
+
+ private:
+  Listener listener_;
+  const std::string request_;
+  const std::string reply_;
+  int client_ = -1;
+  int server_ = -1;
+  std::string body_;
+  std::thread echo_;
+};
 
 void InstallPingHandler(pm::RpcDispatcher& dispatcher) {
   dispatcher.RegisterHandler(kCommand, [](const Json& request, Json& response) {
@@ -159,111 +170,165 @@ void InstallPingHandler(pm::RpcDispatcher& dispatcher) {
   });
 }
 
-void HostRequestToDispatcher(benchmark::State& state) {
-  Listener listener;
-  std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener.port);
-  const int host = listener.Accept();
-  if (!connection || host < 0) {
+// A plain-socket host sending requests to a dispatcher's handler.
+class HostToDispatcher {
+ public:
+  HostToDispatcher() : request_(Frame(RequestText())) {
+    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.port);
+    host_ = listener_.Accept();
+    if (!connection || host_ < 0) return;
+    dispatcher_ = std::make_shared<pm::RpcDispatcher>(connection);
+    InstallPingHandler(*dispatcher_);
+    dispatcher_->Start();
+  }
+  ~HostToDispatcher() {
+    if (dispatcher_) dispatcher_->Stop();
+    if (host_ >= 0) ::close(host_);
+  }
+  bool Ready() const { return dispatcher_ != nullptr; }
+  bool RoundTrip() {
+    return SendAll(host_, request_) && RecvFrame(host_, body_) && body_ == ReplyText();
+  }
+
+ private:
+  Listener listener_;
+  const std::string request_;
+  int host_ = -1;
+  std::string body_;
+  std::shared_ptr<pm::RpcDispatcher> dispatcher_;
+};
+
+// RpcRequest on one dispatcher, answered by a handler on another, the
+// callback waking the caller.
+class DispatcherPair {
+ public:
+  DispatcherPair() {
+    server_ = pm::ipc::Server::CreateListening();
+    if (!server_) return;
+    std::shared_ptr<pm::ipc::Connection> taskEnd = pm::ipc::Connection::Open(server_->GetPort());
+    std::shared_ptr<pm::ipc::Connection> hostEnd = server_->AcceptConnection(5000);
+    if (!taskEnd || !hostEnd) return;
+    task_ = std::make_shared<pm::RpcDispatcher>(taskEnd);
+    host_ = std::make_shared<pm::RpcDispatcher>(hostEnd);
+    InstallPingHandler(*host_);
+    task_->Start();
+    host_->Start();
+  }
+  ~DispatcherPair() {
+    if (task_) task_->Stop();
+    if (host_) host_->Stop();
+  }
+  bool Ready() const { return task_ && host_; }
+  bool RoundTrip() {
+    Json payload = {{"value", 12345}};
+    task_->RpcRequest(kCommand, payload, 10000, [this](const Json&) {
+      {
+        std::lock_guard<std::mutex> guard(mutex_);
+        ++completed_;
+      }
+      done_.notify_one();
+    });
+    ++expected_;
+    std::unique_lock<std::mutex> lock(mutex_);
+    return done_.wait_for(lock, std::chrono::seconds(5), [this] { return completed_ == expected_; });
+  }
+
+ private:
+  std::unique_ptr<pm::ipc::Server> server_;
+  std::shared_ptr<pm::RpcDispatcher> task_;
+  std::shared_ptr<pm::RpcDispatcher> host_;
+  std::mutex mutex_;
+  std::condition_variable done_;
+  std::uint64_t completed_ = 0;  // guarded by mutex_
+  std::uint64_t expected_ = 0;   // caller's thread only
+};
+
+void RawPingPong(benchmark::State& state) {
+  RawPair raw;
+  for (auto _ : state) {
+    if (!raw.RoundTrip()) {
+      state.SkipWithError("raw ping-pong failed");
+      break;
+    }
+  }
+}
+
+template <class Subject>
+void Alone(benchmark::State& state) {
+  Subject subject;
+  if (!subject.Ready()) {
     state.SkipWithError("no connection");
     return;
   }
-  auto dispatcher = std::make_shared<pm::RpcDispatcher>(connection);
-  InstallPingHandler(*dispatcher);
-  dispatcher->Start();
-  const std::string request = Frame(RequestText());
-  std::string body;
   for (auto _ : state) {
-    if (!SendAll(host, request) || !RecvFrame(host, body)) {
+    if (!subject.RoundTrip()) {
       state.SkipWithError("round trip failed");
       break;
     }
   }
-  if (body != ReplyText()) state.SkipWithError("unexpected reply");
-  dispatcher->Stop();
-  ::close(host);
 }
 
-void DispatcherRoundTrip(benchmark::State& state) {
-  auto server = pm::ipc::Server::CreateListening();
-  if (!server) {
-    state.SkipWithError("no server");
-    return;
-  }
-  std::shared_ptr<pm::ipc::Connection> taskEnd = pm::ipc::Connection::Open(server->GetPort());
-  std::shared_ptr<pm::ipc::Connection> hostEnd = server->AcceptConnection(5000);
-  if (!taskEnd || !hostEnd) {
+// The subject and the raw ping-pong alternately, so that both see the same
+// load; counters: raw_ns and subject_ns per round trip, and their ratio.
+template <class Subject>
+void Paired(benchmark::State& state) {
+  RawPair raw;
+  Subject subject;
+  if (!subject.Ready()) {
     state.SkipWithError("no connection");
     return;
   }
-  auto task = std::make_shared<pm::RpcDispatcher>(taskEnd);
-  auto host = std::make_shared<pm::RpcDispatcher>(hostEnd);
-  InstallPingHandler(*host);
-  task->Start();
-  host->Start();
-
-  std::mutex mutex;
-  std::condition_variable done;
-  std::uint64_t completed = 0;  // guarded by mutex
-  std::uint64_t expected = 0;
+  std::int64_t rawNs = 0;
+  std::int64_t subjectNs = 0;
   for (auto _ : state) {
-    Json payload = {{"value", 12345}};
-    task->RpcRequest(kCommand, payload, 10000, [&](const Json&) {
-      std::lock_guard<std::mutex> guard(mutex);
-      ++completed;
-      done.notify_one();
-    });
-    ++expected;
-    std::unique_lock<std::mutex> lock(mutex);
-    if (!done.wait_for(lock, std::chrono::seconds(5), [&] { return completed == expected; })) {
-      state.SkipWithError("reply missing");
-      break;
+    const std::int64_t t0 = pm::SteadyNowNs();
+    const bool rawOk = raw.RoundTrip();
+    const std::int64_t t1 = pm::SteadyNowNs();
+    const bool subjectOk = subject.RoundTrip();
+    const std::int64_t t2 = pm::SteadyNowNs();
+    if (!rawOk || !subjectOk) {
+      state.SkipWithError("round trip failed");
+      return;
     }
+    rawNs += t1 - t0;
+    subjectNs += t2 - t1;
   }
-  task->Stop();
-  host->Stop();
+  const double n = static_cast<double>(state.iterations());
+  state.counters["raw_ns"] = static_cast<double>(rawNs) / n;
+  state.counters["subject_ns"] = static_cast<double>(subjectNs) / n;
+  state.counters["ratio"] = rawNs > 0 ? static_cast<double>(subjectNs) / static_cast<double>(rawNs) : 0;
 }
 
-struct Comparison {
-  const char* subject;
-  const char* baseline;
-  double goal;
-};
-constexpr Comparison kComparisons[] = {
-    {"HostRequestToDispatcher", "RawPingPong", 1.5},
-    {"DispatcherRoundTrip", "RawPingPong", 1.5},
-};
+constexpr double kGoal = 1.5;
 
-// The console report, plus the time per iteration of each benchmark for the
-// ratios printed at the end.
+// The console report, plus the ratio counter of each paired benchmark (the
+// median when repeated), printed at the end.
 class RatioReporter : public benchmark::ConsoleReporter {
  public:
   void ReportRuns(const std::vector<Run>& runs) override {
     ConsoleReporter::ReportRuns(runs);
-    // With --benchmark_repetitions the median stands for the benchmark.
     for (const Run& run : runs) {
       if (run.error_occurred) continue;
+      const auto counter = run.counters.find("ratio");
+      if (counter == run.counters.end()) continue;
       const std::string& name = run.run_name.function_name;
       if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median") {
-        realTime_[name] = run.GetAdjustedRealTime();
+        ratio_[name] = counter->second.value;
         fromMedian_[name] = true;
       } else if (run.run_type == Run::RT_Iteration && !fromMedian_[name]) {
-        realTime_[name] = run.GetAdjustedRealTime();
+        ratio_[name] = counter->second.value;
       }
     }
   }
   void PrintRatios() const {
-    for (const Comparison& c : kComparisons) {
-      const auto s = realTime_.find(c.subject);
-      const auto b = realTime_.find(c.baseline);
-      if (s == realTime_.end() || b == realTime_.end() || b->second <= 0) continue;
-      const double ratio = s->second / b->second;
-      std::printf("ratio %s / %s = %.2f (goal <= %.2f: %s)\n", c.subject, c.baseline, ratio, c.goal,
-                  ratio <= c.goal ? "met" : "MISSED");
+    for (const auto& [name, ratio] : ratio_) {
+      std::printf("ratio %s = %.2f (goal <= %.2f: %s)\n", name.c_str(), ratio, kGoal,
+                  ratio <= kGoal ? "met" : "MISSED");
     }
   }
 
  private:
-  std::map<std::string, double> realTime_;
+  std::map<std::string, double> ratio_;
   std::map<std::string, bool> fromMedian_;
 };
 
@@ -271,8 +336,10 @@ class RatioReporter : public benchmark::ConsoleReporter {
 
 int main(int argc, char** argv) {
   benchmark::RegisterBenchmark("RawPingPong", RawPingPong)->UseRealTime();
-  benchmark::RegisterBenchmark("HostRequestToDispatcher", HostRequestToDispatcher)->UseRealTime();
-  benchmark::RegisterBenchmark("DispatcherRoundTrip", DispatcherRoundTrip)->UseRealTime();
+  benchmark::RegisterBenchmark("HostRequestToDispatcher", Alone<HostToDispatcher>)->UseRealTime();
+  benchmark::RegisterBenchmark("DispatcherRoundTrip", Alone<DispatcherPair>)->UseRealTime();
+  benchmark::RegisterBenchmark("Paired/HostRequestToDispatcher", Paired<HostToDispatcher>)->UseRealTime();
+  benchmark::RegisterBenchmark("Paired/DispatcherRoundTrip", Paired<DispatcherPair>)->UseRealTime();
   benchmark::Initialize(&argc, argv);
   RatioReporter reporter;
   benchmark::RunSpecifiedBenchmarks(&reporter);
