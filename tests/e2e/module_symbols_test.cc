@@ -1,0 +1,48 @@
+// The task module exports pmTask_Factory and nothing else of ours: every other
+// defined dynamic symbol must be one the linker or the C/C++ runtime adds.
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <set>
+#include <sstream>
+#include <string>
+
+namespace {
+
+bool LinkerOrRuntimeName(const std::string& name) {
+  static const std::set<std::string> kLinker = {"_init", "_fini", "_edata", "_end", "__bss_start"};
+  if (kLinker.count(name) != 0) return true;
+  // Names the sanitizer and unwinder runtimes may put into a shared object.
+  for (const char* prefix : {"__asan", "__ubsan", "__tsan", "__sanitizer", "__lsan", "__gcov", "__cxa_", "__gxx_"}) {
+    if (name.rfind(prefix, 0) == 0) return true;
+  }
+  return false;
+}
+
+TEST(TaskModule, ExportsOnlyTheFactory) {
+  const std::string command = std::string("nm -D --defined-only '") + PM_MODULE_PATH + "' 2>&1";
+  FILE* pipe = ::popen(command.c_str(), "r");
+  ASSERT_NE(pipe, nullptr);
+  std::string output;
+  char buffer[4096];
+  std::size_t n = 0;
+  while ((n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0) output.append(buffer, n);
+  ASSERT_EQ(::pclose(pipe), 0) << output;
+
+  std::istringstream lines(output);
+  std::string line;
+  bool factory = false;
+  while (std::getline(lines, line)) {
+    if (line.empty()) continue;
+    const std::string name = line.substr(line.find_last_of(' ') + 1);
+    if (name == "pmTask_Factory") {
+      factory = true;
+      EXPECT_NE(line.find(" T "), std::string::npos) << line;
+      continue;
+    }
+    EXPECT_TRUE(LinkerOrRuntimeName(name)) << "exported: " << line;
+  }
+  EXPECT_TRUE(factory) << output;
+}
+
+}  // namespace
