@@ -25,6 +25,7 @@ namespace {
 constexpr int kListenBacklog = 5;
 constexpr int kConnectAttempts = 1024;
 constexpr std::int64_t kDefaultAcceptTimeoutMs = 60000;
+constexpr std::int64_t kAcceptFailurePauseMs = 100;
 constexpr short kPollAsk = POLLIN | POLLRDNORM | POLLRDBAND;
 constexpr short kPollReady = POLLIN | POLLRDNORM | POLLRDBAND | POLLPRI | POLLERR | POLLHUP | POLLNVAL;
 
@@ -298,7 +299,15 @@ bool Acceptor::Accept(Socket& target, std::int64_t timeoutMs) {
   const int accepted = RetryEintr(
       [&] { return ::accept4(handle_, reinterpret_cast<sockaddr*>(&target.address_), &length, SOCK_CLOEXEC); });
   if (accepted < 0) {
+    const auto error = LastSocketError::Read();
     target.Close();
+    if (error.err != EAGAIN && error.err != EWOULDBLOCK && error.err != ECONNABORTED && error.err != EINVAL) {
+      // Out of descriptors or memory: the pending connection stays queued
+      // and the socket keeps reporting readable, so a caller that loops on
+      // Accept would spin. Pause before reporting the failure.
+      Log(LogType::Normal, "", "Acceptor::Accept failed : %s\n", ErrorText(error).c_str());
+      if (!stopRequested_.load()) ::poll(nullptr, 0, static_cast<int>(kAcceptFailurePauseMs));
+    }
     return false;
   }
   target.handle_ = accepted;

@@ -146,7 +146,10 @@ class Acceptor : public Socket {
   // (0 or kNoTimeout mean 60,000 ms) for a pending connection; false when
   // none came, when there is no descriptor, or once Close has been called.
   // On success target holds the connection (blocking, Nagle off) and its port
-  // is the peer's port. One thread at a time.
+  // is the peer's port. When accept itself fails for want of descriptors or
+  // memory, logs "Acceptor::Accept failed : [errno=E,wsa=W]" and pauses
+  // 100 ms before returning false, so a listener loop does not spin on a
+  // connection it cannot take. One thread at a time.
   bool Accept(Socket& target, std::int64_t timeoutMs);
 
   // Stops the acceptor: sets the stop flag (Accept fails from now on) and

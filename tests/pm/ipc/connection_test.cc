@@ -5,6 +5,7 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -375,6 +376,36 @@ TEST(ServerListener, EmptyCallbackOrStoppedServerStartsNothing) {
   log.Clear();
   server->StartWaitingForConnections([](std::unique_ptr<Connection>) {});
   EXPECT_TRUE(log.Contains("was stopped"));
+}
+
+TEST(ServerListener, RunningOutOfDescriptorsDoesNotMakeItSpin) {
+  pmtest::LogCapture log;
+  auto server = Server::CreateListening();
+  std::atomic<int> handed{0};
+  server->StartWaitingForConnections([&](std::unique_ptr<Connection>) { ++handed; });
+  // Use up every descriptor but one, and connect with that one: the
+  // connection is queued but the listener has no descriptor to take it.
+  rlimit saved{};
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &saved), 0);
+  rlimit low = saved;
+  low.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 1024);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
+  std::vector<int> filler;
+  for (int fd; (fd = ::dup(0)) >= 0;) filler.push_back(fd);
+  ASSERT_FALSE(filler.empty());
+  ::close(filler.back());
+  filler.pop_back();
+  auto host = Connection::Open(server->GetPort());
+  ASSERT_TRUE(host);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("Acceptor::Accept failed : [errno=24,wsa=24]"); }));
+  // A listener that spun would log thousands of lines here.
+  const int before = log.Count("Acceptor::Accept failed");
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  EXPECT_LE(log.Count("Acceptor::Accept failed") - before, 10);
+  for (int fd : filler) ::close(fd);
+  ::setrlimit(RLIMIT_NOFILE, &saved);
+  EXPECT_TRUE(pmtest::WaitFor([&] { return handed.load() == 1; }));
+  server->Stop();
 }
 
 }  // namespace
