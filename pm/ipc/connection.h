@@ -25,7 +25,7 @@
 // that is blocked on a peer that does not read.
 //
 // Lock: lock_ guards the socket's writes; nothing else is locked while it is
-// held (it is the innermost lock; the queue producer's lock comes before it).
+// held (it is the innermost lock).
 
 #include <atomic>
 #include <cstdint>
@@ -67,6 +67,8 @@ class Connection {
   bool ReadFromSocket(void* destination, std::size_t length, std::int64_t timeoutMs);
 
   bool IsConnected() const;
+  // For options and the descriptor number; close through Close(), never
+  // through the socket (that would release the number under a reader).
   ip::Socket& GetSocket() { return socket_; }
 
   // The listed connections whose sockets became readable (or hung up) within
