@@ -10,6 +10,7 @@
 
 #include "ndi-loopback/net.h"
 #include "ndi-loopback/registry.h"
+#include "ndi-loopback/sender.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
 #include "pm/runtime/thread_name.h"
@@ -310,7 +311,8 @@ bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
   if (text.size() > (1u << 20)) return false;
   std::lock_guard<std::mutex> lock(write_mutex_);
   if (!connected_) return false;
-  EncodedHead head = EncodeMetadata(MessageType::Metadata, frame.timecode, static_cast<std::uint32_t>(text.size()));
+  const std::int64_t timecode = frame.timecode == kNdiSendTimecodeSynthesize ? NowTimestamp() : frame.timecode;
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, timecode, static_cast<std::uint32_t>(text.size()));
   return WriteMessage(head.bytes, head.size, text);
 }
 
