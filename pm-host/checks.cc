@@ -1,0 +1,138 @@
+#include "pm-host/checks.h"
+
+#include <algorithm>
+#include <cmath>
+#include <cstring>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+#include "ndi-testsrc/pattern.h"
+#include "pm/task/formats.h"
+#include "taskndisource/ndi_abi.h"
+
+namespace pmhost {
+
+namespace {
+
+// The bars of one size, made once (the reader thread checks every picture).
+const std::vector<std::uint8_t>& BarsPicture(int width, int height) {
+  static std::mutex lock;  // guards cache
+  static std::map<std::pair<int, int>, std::unique_ptr<std::vector<std::uint8_t>>> cache;
+  std::lock_guard<std::mutex> guard(lock);
+  auto& slot = cache[{width, height}];
+  if (!slot) {
+    const std::vector<ndits::Plane> planes = ndits::PictureLayout(kNdiFourCCUYVY, width, height);
+    // Two pictures whose markers do not overlap: where the first shows its
+    // marker, the second shows the bars.
+    const ndits::Bars bars(kNdiFourCCUYVY, width, height);
+    std::vector<std::uint8_t> first(ndits::PictureSize(planes)), second(first.size());
+    bars.Fill(0, first.data());
+    const int size = std::max(2, (height / 8) & ~1);
+    bars.Fill(size / 8 + 2, second.data());
+    static const std::uint8_t kMarker[4] = {128, 235, 128, 235};
+    for (std::size_t i = 0; i + 4 <= first.size(); i += 4) {
+      if (std::memcmp(first.data() + i, kMarker, 4) == 0) std::memcpy(first.data() + i, second.data() + i, 4);
+    }
+    slot = std::make_unique<std::vector<std::uint8_t>>(std::move(first));
+  }
+  return *slot;
+}
+
+std::uint32_t SenderFourCC(std::uint32_t code) {
+  if (code == pm::kCode2vuy) return kNdiFourCCUYVY;
+  if (code == pm::kCodeNV12) return kNdiFourCCNV12;
+  if (code == pm::kCodeRgba) return kNdiFourCCBGRA;
+  return 0;
+}
+
+}  // namespace
+
+std::string CheckBars(const VideoFrame& frame) {
+  if (frame.code != pm::kCode2vuy) return "not a '2vuy' picture";
+  if (frame.width < 2 || frame.height < 2 || frame.width % 2 != 0) return "odd picture size";
+  const std::vector<std::uint8_t>& bars = BarsPicture(frame.width, frame.height);
+  const std::size_t rowBytes = static_cast<std::size_t>(frame.width) * 2;
+  if (bars.size() < rowBytes * static_cast<std::size_t>(frame.height)) return "no bars of this size";
+  const int size = std::max(2, (frame.height / 8) & ~1);
+  const int band = ((frame.height - size) / 2) & ~1;
+  static const std::uint8_t kMarker[4] = {128, 235, 128, 235};
+  for (int y = 0; y < frame.height; ++y) {
+    const std::uint8_t* row = frame.data + static_cast<std::size_t>(y) * frame.stride;
+    const std::uint8_t* expected = bars.data() + static_cast<std::size_t>(y) * rowBytes;
+    if (y < band || y >= band + size) {
+      if (std::memcmp(row, expected, rowBytes) != 0) return "row " + std::to_string(y) + " differs from the bars";
+      continue;
+    }
+    for (std::size_t x = 0; x < rowBytes; x += 4) {
+      if (std::memcmp(row + x, expected + x, 4) != 0 && std::memcmp(row + x, kMarker, 4) != 0) {
+        return "row " + std::to_string(y) + " byte " + std::to_string(x) + " is neither bars nor marker";
+      }
+    }
+  }
+  return {};
+}
+
+std::string CheckTone(const AudioFrame& frame) {
+  if (frame.code != pm::kCodeFl32) return "not 'fl32' sound";
+  if (frame.rate <= 0 || frame.channels <= 0 || frame.samples <= 0) return "empty sound";
+  const auto* samples = reinterpret_cast<const float*>(frame.data);
+  auto tone = [&](std::int64_t t) {
+    return static_cast<float>(0.25 * std::sin(2.0 * M_PI * 1000.0 * static_cast<double>(t) / frame.rate));
+  };
+  // The tone repeats every rate / gcd(rate, 1000) samples: find this
+  // buffer's phase from its first samples, then check every sample.
+  std::int64_t a = frame.rate, b = 1000;
+  while (b != 0) std::swap(a %= b, b);
+  const std::int64_t period = frame.rate / a;
+  const int probe = std::min(frame.samples, 16);
+  std::int64_t best = 0;
+  double bestError = 1e9;
+  for (std::int64_t t0 = 0; t0 < period; ++t0) {
+    double error = 0;
+    for (int k = 0; k < probe; ++k) error += std::fabs(samples[static_cast<std::size_t>(k) * frame.channels] - tone(t0 + k));
+    if (error < bestError) {
+      bestError = error;
+      best = t0;
+    }
+  }
+  for (int k = 0; k < frame.samples; ++k) {
+    for (int c = 0; c < frame.channels; ++c) {
+      const float got = samples[static_cast<std::size_t>(k) * frame.channels + c];
+      if (std::fabs(got - tone(best + k)) > 1e-4f) {
+        return "sample " + std::to_string(k) + " channel " + std::to_string(c) + " is " + std::to_string(got) +
+               " instead of " + std::to_string(tone(best + k));
+      }
+    }
+  }
+  return {};
+}
+
+std::string CheckRampPicture(const VideoFrame& frame, std::int64_t* frameNumber) {
+  const std::uint32_t fourcc = SenderFourCC(frame.code);
+  if (fourcc == 0) return "picture code " + std::to_string(frame.code) + " is not a ramp code";
+  return ndits::CheckRamp(fourcc, frame.width, frame.height, static_cast<int>(frame.stride), frame.data, frameNumber);
+}
+
+std::string CheckRampSound(const AudioFrame& frame, std::int64_t* firstSample) {
+  if (frame.code != pm::kCodeFl32) return "not 'fl32' sound";
+  if (frame.channels <= 0 || frame.samples <= 0) return "empty sound";
+  const auto* samples = reinterpret_cast<const float*>(frame.data);
+  // Channel 0's first sample gives s modulo 1024.
+  const std::int64_t s0 = std::llround(samples[0] * 1024.0f);
+  *firstSample = s0;
+  for (int k = 0; k < frame.samples; ++k) {
+    for (int c = 0; c < frame.channels; ++c) {
+      const float expected = ndits::AudioRampSample(s0 + k, c);
+      const float got = samples[static_cast<std::size_t>(k) * frame.channels + c];
+      if (got != expected) {
+        return "sample " + std::to_string(k) + " channel " + std::to_string(c) + " is " + std::to_string(got) +
+               " instead of " + std::to_string(expected);
+      }
+    }
+  }
+  return {};
+}
+
+}  // namespace pmhost

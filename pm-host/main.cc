@@ -1,0 +1,118 @@
+// pm-host: the reference host. Starts pm-runner with the task module, and
+// drives it over the command connection and the frame queues.
+//
+//   pm-host list [--seconds S]
+//   pm-host receive SOURCE [--seconds S | --frames N] [--bandwidth highest|lowest|audio_only]
+//                  [--snapshot FILE.png] [--wav FILE.wav] [--ptz JSON]... [--tally live|preview|both]
+//                  [--shot-event TEXT]... [--json]
+//   pm-host demo
+// Every subcommand takes --runner PATH and --module PATH (default: the
+// programs built beside pm-host).
+#include <signal.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdio>
+
+#include <CLI/CLI.hpp>
+#include <nlohmann/json.hpp>
+
+#include "pm-host/receive.h"
+#include "pm/runtime/context.h"
+
+namespace {
+
+std::atomic<bool> g_interrupted{false};
+
+void OnInterrupt(int) { g_interrupted = true; }
+
+void WriteToStderr(const char* line) {
+  std::size_t length = std::strlen(line);
+  while (length > 0) {
+    const ssize_t n = ::write(STDERR_FILENO, line, length);
+    if (n <= 0) return;
+    line += n;
+    length -= static_cast<std::size_t>(n);
+  }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app{"pm-host: the reference host of the NDI source task"};
+  app.require_subcommand(1);
+  pmhost::HostOptions host;
+  app.add_option("--runner", host.runnerPath, "the runner program (default: pm-runner built beside pm-host)");
+  app.add_option("--module", host.modulePath, "the task module (default: libtaskndisource.so built beside pm-host)");
+  app.add_option("--runner-log", host.runnerLog, "write the runner's log lines to this file instead of stderr");
+
+  pmhost::ListOptions list;
+  CLI::App* listCommand = app.add_subcommand("list", "discover NDI sources; print each as it appears and vanishes");
+  listCommand->add_option("--seconds", list.seconds, "how long to watch (0: until interrupted)")
+      ->check(CLI::NonNegativeNumber);
+
+  pmhost::ReceiveOptions receive;
+  bool json = false;
+  std::vector<std::string> ptz;
+  CLI::App* receiveCommand = app.add_subcommand("receive", "receive one source");
+  receiveCommand->add_option("SOURCE", receive.source, "NDI name, unique id, or text matching exactly one name")
+      ->required();
+  auto* seconds = receiveCommand->add_option("--seconds", receive.seconds, "receive for S seconds")
+                      ->check(CLI::NonNegativeNumber);
+  auto* frames = receiveCommand->add_option("--frames", receive.frames, "receive N pictures")
+                     ->check(CLI::NonNegativeNumber);
+  seconds->excludes(frames);
+  receiveCommand->add_option("--bandwidth", receive.bandwidth, "what the sender sends")
+      ->check(CLI::IsMember({"highest", "lowest", "audio_only"}));
+  receiveCommand->add_option("--snapshot", receive.snapshot, "write the last picture as PNG");
+  receiveCommand->add_option("--wav", receive.wav, "write the sound as WAV");
+  receiveCommand->add_option("--ptz", ptz, "a PTZ command as JSON, e.g. {\"command\":\"Zoom\",\"zoom\":0.5}")
+      ->check([](const std::string& text) {
+        const auto value = nlohmann::json::parse(text, nullptr, false);
+        return value.is_object() ? std::string() : std::string("not a JSON object: ") + text;
+      });
+  receiveCommand->add_option("--tally", receive.tally, "tally to send")
+      ->check(CLI::IsMember({"live", "preview", "both"}));
+  receiveCommand->add_option("--shot-event", receive.shotEvents, "a shot event to send");
+  receiveCommand->add_flag("--json", json, "print the summary as JSON");
+
+  pmhost::DemoOptions demo;
+  CLI::App* demoCommand = app.add_subcommand("demo", "send colour bars from a private sender, receive and check them");
+  demoCommand->add_option("--sender", demo.senderPath, "the test sender (default: ndi-testsrc built beside pm-host)");
+  demoCommand->add_option("--png", demo.png, "where to write the snapshot");
+  demoCommand->add_flag("--json", demo.json, "print the summary as JSON");
+
+  CLI11_PARSE(app, argc, argv);
+
+  pm::GetContext()->logSink = [](pm::LogType, const char* line) { WriteToStderr(line); };
+  struct sigaction action {};
+  action.sa_handler = OnInterrupt;
+  sigemptyset(&action.sa_mask);
+  ::sigaction(SIGINT, &action, nullptr);
+  ::sigaction(SIGTERM, &action, nullptr);
+  ::signal(SIGPIPE, SIG_IGN);
+  const pmhost::Progress progress = ::isatty(STDOUT_FILENO) ? pmhost::Progress::Terminal : pmhost::Progress::Lines;
+
+  if (*listCommand) {
+    list.host = host;
+    list.interrupted = &g_interrupted;
+    return pmhost::Discover(list);
+  }
+  if (*receiveCommand) {
+    receive.host = host;
+    receive.interrupted = &g_interrupted;
+    receive.progress = json ? pmhost::Progress::None : progress;
+    for (const std::string& text : ptz) receive.ptz.push_back(nlohmann::json::parse(text));
+    const pmhost::ReceiveResult result = pmhost::Receive(receive);
+    if (json) {
+      std::printf("%s\n", result.ToJson().dump().c_str());
+    } else {
+      std::printf("%s\n", pmhost::SummaryText(result).c_str());
+    }
+    return result.exitStatus;
+  }
+  demo.host = host;
+  demo.interrupted = &g_interrupted;
+  demo.progress = demo.json ? pmhost::Progress::None : progress;
+  return pmhost::RunDemo(demo);
+}

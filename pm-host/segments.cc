@@ -1,0 +1,149 @@
+#include "pm-host/segments.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "pm/runtime/log.h"
+#include "pm/runtime/syscall.h"
+
+namespace pmhost {
+
+SegmentMapping::~SegmentMapping() { Reset(); }
+
+SegmentMapping::SegmentMapping(SegmentMapping&& other) noexcept : data_(other.data_), size_(other.size_) {
+  other.data_ = nullptr;
+  other.size_ = 0;
+}
+
+SegmentMapping& SegmentMapping::operator=(SegmentMapping&& other) noexcept {
+  if (this != &other) {
+    Reset();
+    data_ = other.data_;
+    size_ = other.size_;
+    other.data_ = nullptr;
+    other.size_ = 0;
+  }
+  return *this;
+}
+
+void SegmentMapping::Reset() {
+  if (data_ != nullptr) ::munmap(const_cast<std::uint8_t*>(data_), size_);
+  data_ = nullptr;
+  size_ = 0;
+}
+
+SegmentMapping SegmentMapping::Open(const std::string& name, std::uint64_t size) {
+  SegmentMapping mapping;
+  if (size == 0) {
+    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: '%s' with size 0\n", name.c_str());
+    return mapping;
+  }
+  const int fd = pm::RetryEintr([&] { return ::shm_open(name.c_str(), O_RDONLY | O_CLOEXEC, 0); });
+  if (fd < 0) {
+    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot open '%s': %s\n", name.c_str(),
+            pm::ErrnoText(errno).c_str());
+    return mapping;
+  }
+  struct stat info {};
+  if (::fstat(fd, &info) != 0) {
+    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot stat '%s': %s\n", name.c_str(),
+            pm::ErrnoText(errno).c_str());
+    ::close(fd);
+    return mapping;
+  }
+  // Reading past the end of the file would raise SIGBUS: a segment smaller
+  // than the record says is refused.
+  if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) < size) {
+    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: '%s' has %lld bytes, the record says %llu\n",
+            name.c_str(), static_cast<long long>(info.st_size), static_cast<unsigned long long>(size));
+    ::close(fd);
+    return mapping;
+  }
+  void* data = ::mmap(nullptr, size, PROT_READ, MAP_SHARED, fd, 0);
+  const int err = errno;
+  ::close(fd);
+  if (data == MAP_FAILED) {
+    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot map '%s': %s\n", name.c_str(),
+            pm::ErrnoText(err).c_str());
+    return mapping;
+  }
+  mapping.data_ = static_cast<const std::uint8_t*>(data);
+  mapping.size_ = size;
+  return mapping;
+}
+
+bool ValidMemoryBase(const std::string& memoryBase) {
+  return !memoryBase.empty() && memoryBase.size() <= 200 && memoryBase.find('/') == std::string::npos &&
+         memoryBase.find('\0') == std::string::npos;
+}
+
+std::shared_ptr<const SegmentMapping> SegmentCache::Map(std::uint32_t id, std::uint64_t size) {
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = mappings_.find(id);
+    if (found != mappings_.end() && found->second->Size() == size) return found->second;
+  }
+  if (!ValidMemoryBase(memoryBase_)) {
+    pm::Log(pm::LogType::Normal, "", "SegmentCache::Map: memory base '%s' cannot name a segment\n",
+            memoryBase_.c_str());
+    return nullptr;
+  }
+  auto mapping = std::make_shared<SegmentMapping>(SegmentMapping::Open("/" + memoryBase_ + std::to_string(id), size));
+  std::lock_guard<std::mutex> guard(lock_);
+  if (!*mapping) {
+    mappings_.erase(id);
+    return nullptr;
+  }
+  mappings_[id] = mapping;
+  return mapping;
+}
+
+void SegmentCache::Forget(std::uint32_t id) {
+  std::shared_ptr<const SegmentMapping> dropped;  // unmapped outside the lock
+  std::lock_guard<std::mutex> guard(lock_);
+  auto found = mappings_.find(id);
+  if (found == mappings_.end()) return;
+  dropped = std::move(found->second);
+  mappings_.erase(found);
+}
+
+void SegmentCache::Clear() {
+  std::map<std::uint32_t, std::shared_ptr<const SegmentMapping>> dropped;
+  std::lock_guard<std::mutex> guard(lock_);
+  dropped.swap(mappings_);
+}
+
+std::size_t SegmentCache::Count() const {
+  std::lock_guard<std::mutex> guard(lock_);
+  return mappings_.size();
+}
+
+int RemoveSegments(const std::string& memoryBase, const std::string& directory) {
+  if (!ValidMemoryBase(memoryBase)) return 0;
+  DIR* dir = ::opendir(directory.c_str());
+  if (dir == nullptr) return 0;
+  int removed = 0;
+  while (const dirent* entry = ::readdir(dir)) {
+    const std::string name = entry->d_name;
+    if (name.size() <= memoryBase.size() || name.compare(0, memoryBase.size(), memoryBase) != 0) continue;
+    bool digits = true;
+    for (std::size_t i = memoryBase.size(); i < name.size(); ++i) digits = digits && name[i] >= '0' && name[i] <= '9';
+    if (!digits) continue;
+    if (::shm_unlink(("/" + name).c_str()) == 0) {
+      ++removed;
+    } else if (errno != ENOENT) {
+      pm::Log(pm::LogType::Normal, "", "RemoveSegments: cannot remove '%s': %s\n", name.c_str(),
+              pm::ErrnoText(errno).c_str());
+    }
+  }
+  ::closedir(dir);
+  return removed;
+}
+
+}  // namespace pmhost

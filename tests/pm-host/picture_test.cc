@@ -1,0 +1,97 @@
+// Snapshots: BT.709 limited-range YUV to RGB for '2vuy' and 'NV12', the byte
+// order of 'rgba', and pictures whose bytes do not cover their geometry.
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <fstream>
+
+#include "pm-host/picture.h"
+#include "pm/task/formats.h"
+
+namespace {
+
+struct Colour {
+  int y, u, v, r, g, b;
+};
+// The 75% bars of the test sender: BT.709 limited-range values and their RGB.
+const Colour kBars[] = {{180, 128, 128, 191, 191, 191}, {168, 44, 136, 191, 191, 0}, {145, 147, 44, 0, 191, 191},
+                        {133, 63, 52, 0, 191, 0},       {63, 193, 204, 191, 0, 191}, {51, 109, 212, 191, 0, 0},
+                        {28, 212, 120, 0, 0, 191},      {16, 128, 128, 0, 0, 0},     {235, 128, 128, 255, 255, 255}};
+
+void ExpectNear(const std::uint8_t* rgb, const Colour& c) {
+  EXPECT_NEAR(rgb[0], c.r, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
+  EXPECT_NEAR(rgb[1], c.g, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
+  EXPECT_NEAR(rgb[2], c.b, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
+}
+
+TEST(Snapshot, BarsIn2vuyAndNV12TurnIntoTheirBT709Colours) {
+  const int n = 9;
+  pmhost::Picture uyvy{pm::kCode2vuy, 2 * n, 2, 4 * n + 8, {}};
+  uyvy.bytes.assign(static_cast<std::size_t>(uyvy.stride) * 2, 0);
+  pmhost::Picture nv12{pm::kCodeNV12, 2 * n, 2, 2 * n + 4, {}};
+  nv12.bytes.assign(static_cast<std::size_t>(nv12.stride) * 3, 0);
+  for (int i = 0; i < n; ++i) {
+    for (int row = 0; row < 2; ++row) {
+      std::uint8_t* p = uyvy.bytes.data() + row * uyvy.stride + 4 * i;
+      p[0] = static_cast<std::uint8_t>(kBars[i].u);
+      p[1] = p[3] = static_cast<std::uint8_t>(kBars[i].y);
+      p[2] = static_cast<std::uint8_t>(kBars[i].v);
+      nv12.bytes[static_cast<std::size_t>(row) * nv12.stride + 2 * i] = static_cast<std::uint8_t>(kBars[i].y);
+      nv12.bytes[static_cast<std::size_t>(row) * nv12.stride + 2 * i + 1] = static_cast<std::uint8_t>(kBars[i].y);
+    }
+    nv12.bytes[2u * nv12.stride + 2 * i] = static_cast<std::uint8_t>(kBars[i].u);
+    nv12.bytes[2u * nv12.stride + 2 * i + 1] = static_cast<std::uint8_t>(kBars[i].v);
+  }
+  for (const pmhost::Picture* p : {&uyvy, &nv12}) {
+    const std::vector<std::uint8_t> rgb = pmhost::ToRgb(*p);
+    ASSERT_EQ(rgb.size(), static_cast<std::size_t>(2 * n) * 2 * 3);
+    for (int i = 0; i < n; ++i) {
+      for (int x = 2 * i; x < 2 * i + 2; ++x) {
+        ExpectNear(&rgb[static_cast<std::size_t>(x) * 3], kBars[i]);                 // row 0
+        ExpectNear(&rgb[(static_cast<std::size_t>(2 * n) + x) * 3], kBars[i]);       // row 1
+      }
+    }
+  }
+}
+
+TEST(Snapshot, LimitedRangeClampsBeyondBlackAndWhite) {
+  std::uint8_t rgb[3];
+  pmhost::YuvToRgb(0, 128, 128, rgb);
+  EXPECT_EQ(rgb[0], 0);
+  pmhost::YuvToRgb(255, 128, 128, rgb);
+  EXPECT_EQ(rgb[1], 255);
+  pmhost::YuvToRgb(235, 240, 240, rgb);  // beyond the gamut: clamped, not wrapped
+  EXPECT_EQ(rgb[0], 255);
+  EXPECT_EQ(rgb[2], 255);
+}
+
+TEST(Snapshot, RgbaPixelsAreBlueGreenRedAlphaInMemory) {
+  pmhost::Picture p{pm::kCodeRgba, 2, 1, 8, {10, 20, 30, 255, 1, 2, 3, 0}};
+  const std::vector<std::uint8_t> rgb = pmhost::ToRgb(p);
+  EXPECT_EQ(rgb, (std::vector<std::uint8_t>{30, 20, 10, 3, 2, 1}));
+}
+
+TEST(Snapshot, PicturesWhoseBytesDoNotCoverThemGiveNothing) {
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCode2vuy, 4, 2, 8, std::vector<std::uint8_t>(15)}).empty());
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCodeNV12, 4, 2, 4, std::vector<std::uint8_t>(11)}).empty());
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCode2vuy, 4, 2, 6, std::vector<std::uint8_t>(64)}).empty());  // stride < row
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCode2vuy, 3, 2, 8, std::vector<std::uint8_t>(64)}).empty());  // odd width
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCodeJpeg, 4, 2, 16, std::vector<std::uint8_t>(64)}).empty());
+  EXPECT_TRUE(pmhost::ToRgb({pm::kCodeRgba, -4, 2, 16, std::vector<std::uint8_t>(64)}).empty());
+  // The last row needs only its pixels, not a whole stride.
+  EXPECT_FALSE(pmhost::ToRgb({pm::kCode2vuy, 4, 2, 16, std::vector<std::uint8_t>(24)}).empty());
+}
+
+TEST(Snapshot, WritesAPngFileAndRefusesAMismatchedBuffer) {
+  const std::string path = ::testing::TempDir() + "pmhost-snapshot.png";
+  std::vector<std::uint8_t> rgb(4 * 2 * 3, 200);
+  ASSERT_TRUE(pmhost::WritePng(path, 4, 2, rgb));
+  std::ifstream in(path, std::ios::binary);
+  char magic[8] = {};
+  in.read(magic, 8);
+  EXPECT_EQ(std::string(magic + 1, 3), "PNG");
+  std::remove(path.c_str());
+  EXPECT_FALSE(pmhost::WritePng(path, 4, 3, rgb));
+}
+
+}  // namespace
