@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <stdexcept>
@@ -108,7 +109,8 @@ class TaskSourceTest : public ::testing::Test {
   void SetUp() override {
     task_ = std::make_unique<pm::TaskSource>();
     task_->SetSourceFactory([this](std::shared_ptr<pm::Source::Callbacks> callbacks, std::string id) {
-      return std::make_shared<ScriptedSource>(std::move(callbacks), std::move(id), ++sourceSerial_, &journal_, script_);
+      return std::make_shared<ScriptedSource>(std::move(callbacks), std::move(id), ++sourceSerial_, &journal_,
+                                              CurrentScript());
     });
     task_->SetDiscoveryFactory([this](std::shared_ptr<pm::SourceDiscovery::Callbacks> callbacks) {
       return std::make_shared<ScriptedDiscovery>(std::move(callbacks), ++discoverySerial_, &journal_);
@@ -147,11 +149,22 @@ class TaskSourceTest : public ::testing::Test {
     Ask("pm::tsrc::start_source", body);
   }
 
+  // The factory runs on the dispatcher's receive thread.
+  Script CurrentScript() {
+    std::lock_guard<std::mutex> guard(scriptMutex_);
+    return script_;
+  }
+  void EditScript(const std::function<void(Script&)>& edit) {
+    std::lock_guard<std::mutex> guard(scriptMutex_);
+    edit(script_);
+  }
+
   pmtest::HostListener listener_;
   pmtest::HostPeer host_;
   std::shared_ptr<pm::RpcDispatcher> dispatcher_;
   std::unique_ptr<pm::TaskSource> task_;
   Journal journal_;
+  std::mutex scriptMutex_;  // guards script_
   Script script_;
   std::atomic<int> sourceSerial_{0};
   std::atomic<int> discoverySerial_{0};
@@ -195,7 +208,7 @@ TEST_F(TaskSourceTest, SetConfigurationAndGuiCommandsPassNullForAbsentKeys) {
 }
 
 TEST_F(TaskSourceTest, SourceAnswerThatIsNotJsonBecomesNullWithALogLine) {
-  script_.guiAnswer = "{not json";
+  EditScript([](Script& script) { script.guiAnswer = "{not json"; });
   StartSource("a");
   pmtest::LogCapture log;
   const Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}, {"gui", "g"}});
@@ -215,7 +228,7 @@ TEST_F(TaskSourceTest, SecondStartForARunningIdStopsTheOldSourceBeforeTheNewStar
 }
 
 TEST_F(TaskSourceTest, StartThatThrowsStopsTheSourceAndLogsTheRequest) {
-  script_.throwOnStart = true;
+  EditScript([](Script& script) { script.throwOnStart = true; });
   pmtest::LogCapture log;
   StartSource("a");
   EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 ", "start a#1", "stop a#1"}));
@@ -226,7 +239,7 @@ TEST_F(TaskSourceTest, StartThatThrowsStopsTheSourceAndLogsTheRequest) {
 }
 
 TEST_F(TaskSourceTest, ConfigurationThatThrowsLeavesNothingAndStartsNothing) {
-  script_.throwOnConfiguration = true;
+  EditScript([](Script& script) { script.throwOnConfiguration = true; });
   pmtest::LogCapture log;
   StartSource("a");
   EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 "}));
