@@ -350,6 +350,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   if (printedTerminal) std::fprintf(options.out, "\n");
   if (!host.RunnerRunning()) result.error = "the runner ended during the run";
 
+  result.memoryBases = session.MemoryBases();
   session.StopSource(match.id);
   // With no discovery running, the last stop_source ends the task and the
   // runner with it.

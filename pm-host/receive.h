@@ -68,6 +68,7 @@ struct ReceiveResult {
   std::string name;
   std::string error;       // why it did not run
   int runnerExit = -1;
+  std::vector<std::string> memoryBases;  // of the source's queue (its segments' names start so)
   StatsSnapshot stats;
   nlohmann::json ToJson() const;
 };

@@ -1,5 +1,6 @@
 #include "pm-host/session.h"
 
+#include <chrono>
 #include <future>
 
 #include "pm/runtime/json.h"
@@ -58,7 +59,12 @@ std::optional<json> Session::Request(const std::string& command, json payload, s
   }
   // The dispatcher runs the callback once: with the reply, or with a timeout
   // error at the deadline; the extra second covers the expiry thread's delay.
-  if (future.wait_for(std::chrono::milliseconds(timeoutMs + 1000)) != std::future_status::ready) return std::nullopt;
+  // A connection that ends (the task stops itself after the last
+  // stop_source, sometimes before its reply leaves) ends the wait as well.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs + 1000);
+  while (future.wait_for(std::chrono::milliseconds(20)) != std::future_status::ready) {
+    if (dispatcher_->Ended() || std::chrono::steady_clock::now() >= deadline) return std::nullopt;
+  }
   json message = future.get();
   if (message.is_object() && message.value("pm::error", "") == "timeout") return std::nullopt;
   return message;

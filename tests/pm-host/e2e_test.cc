@@ -1,1 +1,383 @@
-// End-to-end tests of the reference host (being written).
+// The whole chain through real processes, each case in its own registry
+// folder: ndi-testsrc -> loopback runtime -> task module in pm-runner ->
+// shared memory -> the host library (the code behind `pm-host`).
+#include <gtest/gtest.h>
+
+#include <dirent.h>
+#include <signal.h>
+#include <stdlib.h>
+
+#include <atomic>
+#include <condition_variable>
+#include <filesystem>
+#include <fstream>
+#include <mutex>
+#include <sstream>
+#include <thread>
+
+#include "pm-host/checks.h"
+#include "pm-host/receive.h"
+#include "pm/task/formats.h"
+#include "support/wait.h"
+
+namespace {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+
+// A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs.
+struct Folder {
+  Folder() {
+    std::string pattern = ::testing::TempDir() + "pmhost-e2e-XXXXXX";
+    if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
+  }
+  ~Folder() {
+    std::error_code ignored;
+    std::filesystem::remove_all(path, ignored);
+  }
+  std::string Registry() const { return path + "/registry"; }
+  std::string RunnerLog() const { return path + "/runner.log"; }
+  std::string ReadRunnerLog() const {
+    std::ifstream in(RunnerLog());
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+  }
+  std::string path;
+};
+
+// ndi-testsrc with its event lines collected.
+class Sender {
+ public:
+  bool Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
+    pmhost::ChildOptions o;
+    o.path = PM_TESTSRC_PATH;
+    o.args = {"--name", name, "--seconds", "120"};
+    o.args.insert(o.args.end(), args.begin(), args.end());
+    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+    o.captureStdout = true;
+    o.onLine = [this](const std::string& line) {
+      json event = json::parse(line, nullptr, false);
+      std::lock_guard<std::mutex> guard(lock_);
+      if (event.is_object()) events_.push_back(std::move(event));
+    };
+    if (!process_.Start(std::move(o))) return false;
+    return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, 10s);
+  }
+  std::string Name() { return Find("ready").value("name", ""); }
+  // The first event of this kind for which `match` holds, or null.
+  json Find(const std::string& kind, const std::function<bool(const json&)>& match = {}) {
+    std::lock_guard<std::mutex> guard(lock_);
+    for (const json& e : events_) {
+      if (e.value("event", "") == kind && (!match || match(e))) return e;
+    }
+    return nullptr;
+  }
+  bool WaitFor(const std::string& kind, const std::function<bool(const json&)>& match = {}) {
+    return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, 10s);
+  }
+  pmhost::ChildProcess& Process() { return process_; }
+
+ private:
+  pmhost::ChildProcess process_;
+  std::mutex lock_;  // guards events_
+  std::vector<json> events_;
+};
+
+pmhost::HostOptions Options(const Folder& folder) {
+  pmhost::HostOptions o;
+  o.runnerPath = PM_RUNNER_PATH;
+  o.modulePath = PM_MODULE_PATH;
+  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  o.runnerLog = folder.RunnerLog();
+  return o;
+}
+
+// Entries of /dev/shm whose names start with one of the bases.
+int SegmentsOf(const std::vector<std::string>& bases) {
+  int count = 0;
+  for (const auto& entry : std::filesystem::directory_iterator("/dev/shm")) {
+    const std::string name = entry.path().filename().string();
+    for (const std::string& base : bases) count += !base.empty() && name.rfind(base, 0) == 0 ? 1 : 0;
+  }
+  return count;
+}
+
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
+  pmhost::ReceiveOptions o;
+  o.host = Options(folder);
+  o.source = source;
+  o.out = stderr;
+  return o;
+}
+
+// The run ended in order: the last stop_source ended the runner with 0 and
+// nothing of the queue is left in /dev/shm.
+void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder) {
+  EXPECT_EQ(result.error, "");
+  EXPECT_EQ(result.runnerExit, 0) << folder.ReadRunnerLog();
+  EXPECT_FALSE(result.memoryBases.empty());
+  EXPECT_EQ(SegmentsOf(result.memoryBases), 0);
+  EXPECT_EQ(result.stats.badRecords, 0u);
+}
+
+TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
+  Folder folder;
+  Sender a, b;
+  ASSERT_TRUE(a.Start(folder, "Cam A", {"--width", "64", "--height", "16", "--fps", "10", "--no-audio"}));
+  ASSERT_TRUE(b.Start(folder, "Cam B", {"--width", "64", "--height", "16", "--fps", "10", "--no-audio"}));
+  std::mutex lock;  // guards seen, gone
+  std::set<std::string> seen, gone;
+  std::atomic<bool> stop{false};
+  pmhost::ListOptions list;
+  list.host = Options(folder);
+  list.seconds = 60;
+  list.out = stderr;
+  list.interrupted = &stop;
+  list.onChange = [&](bool available, const std::string& id, const std::string& name) {
+    std::lock_guard<std::mutex> guard(lock);
+    (available ? seen : gone).insert(name);
+    EXPECT_EQ(id, pmhost::kSourceIdPrefix + name);
+  };
+  int status = -1;
+  std::thread listing([&] { status = pmhost::Discover(list); });
+  const std::string nameA = a.Name(), nameB = b.Name();
+  EXPECT_TRUE(pmtest::WaitFor([&] {
+    std::lock_guard<std::mutex> guard(lock);
+    return seen.count(nameA) == 1 && seen.count(nameB) == 1;
+  }, 15s));
+  b.Process().Terminate();
+  EXPECT_TRUE(pmtest::WaitFor([&] {
+    std::lock_guard<std::mutex> guard(lock);
+    return gone.count(nameB) == 1;
+  }, 15s));
+  stop = true;
+  listing.join();
+  EXPECT_EQ(status, 0);
+  std::lock_guard<std::mutex> guard(lock);
+  EXPECT_EQ(gone.count(nameA), 0u);
+}
+
+struct FormatCase {
+  const char* format;
+  std::uint32_t code;
+  std::uint32_t stride;  // at 64 pixels wide
+};
+
+void PrintTo(const FormatCase& c, std::ostream* os) { *os << c.format; }
+
+class RampVideo : public ::testing::TestWithParam<FormatCase> {};
+
+TEST_P(RampVideo, ArrivesIntactWithTheHostCodeAndStride) {
+  const FormatCase c = GetParam();
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Ramp", {"--format", c.format, "--pattern", "ramp", "--width", "64", "--height",
+                                            "16", "--fps", "30", "--no-audio"}));
+  std::atomic<int> intact{0}, damaged{0}, backwards{0};
+  std::int64_t last = -1;  // reader thread only
+  std::mutex problemLock;  // guards problem
+  std::string problem;
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.frames = 8;
+  o.seconds = -1;
+  o.onVideo = [&](const pmhost::VideoFrame& frame) {
+    std::int64_t n = -1;
+    const std::string check = pmhost::CheckRampPicture(frame, &n);
+    ++(check.empty() ? intact : damaged);
+    if (n <= last) ++backwards;
+    last = n;
+    std::lock_guard<std::mutex> guard(problemLock);
+    if (!check.empty() && problem.empty()) problem = check;
+  };
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_GE(intact.load(), 8);
+  EXPECT_EQ(damaged.load(), 0) << problem;
+  EXPECT_EQ(backwards.load(), 0);
+  EXPECT_EQ(pmhost::CodeText(result.stats.videoCode), pmhost::CodeText(c.code));
+  EXPECT_EQ(result.stats.stride, c.stride);
+  EXPECT_EQ(result.stats.width, 64);
+  EXPECT_EQ(result.stats.height, 16);
+}
+
+INSTANTIATE_TEST_SUITE_P(Formats, RampVideo,
+                         ::testing::Values(FormatCase{"uyvy", pm::kCode2vuy, 128}, FormatCase{"uyva", pm::kCode2vuy, 128},
+                                           FormatCase{"nv12", pm::kCodeNV12, 64},
+                                           FormatCase{"bgra", pm::kCodeRgba, 256}),
+                         [](const ::testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.format); });
+
+TEST(EndToEnd, I420IsRefusedWithoutAnyVideoRecord) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Planar", {"--format", "i420", "--pattern", "ramp", "--width", "64", "--height",
+                                              "16", "--fps", "30", "--no-audio"}));
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.seconds = 1.5;
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  EXPECT_EQ(result.error, "");
+  EXPECT_EQ(result.runnerExit, 0);
+  EXPECT_EQ(result.stats.frames, 0u);
+  EXPECT_NE(folder.ReadRunnerLog().find("unexpected raster format"), std::string::npos) << folder.ReadRunnerLog();
+}
+
+TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Tone", {"--pattern", "ramp", "--width", "64", "--height", "16", "--fps", "30",
+                                            "--audio-rate", "48000", "--audio-channels", "3"}));
+  std::atomic<int> intact{0}, damaged{0}, gaps{0};
+  std::int64_t next = -1;  // reader thread only
+  std::atomic<int> channels{0};
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.seconds = 1.5;
+  o.onAudio = [&](const pmhost::AudioFrame& frame) {
+    std::int64_t first = -1;
+    ++(pmhost::CheckRampSound(frame, &first).empty() ? intact : damaged);
+    if (next >= 0 && first != next % 1024) ++gaps;
+    next = first + frame.samples;
+    channels = frame.channels;
+  };
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_GE(intact.load(), 10);
+  EXPECT_EQ(damaged.load(), 0);
+  EXPECT_EQ(gaps.load(), 0);
+  EXPECT_EQ(channels.load(), 3);
+  EXPECT_EQ(result.stats.audioRate, 48000);
+}
+
+TEST(EndToEnd, PtzCommandsReachTheSenderWithTheirValues) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "PTZ", {"--ptz", "--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.seconds = 1.5;
+  o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+    return e.value("command", "") == "zoom" && e["values"].value("zoom", 0.0) == 0.5;
+  }));
+  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+    return e.value("command", "") == "pan_tilt" && e["values"].value("pan", 0.0) == 0.25 &&
+           e["values"].value("tilt", 0.0) == -0.5;
+  }));
+}
+
+TEST(EndToEnd, TallyAndShotEventsReachTheSender) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Tally", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.seconds = 1.5;
+  o.tally = "preview";
+  o.shotEvents = {"X"};
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_TRUE(sender.WaitFor("tally", [](const json& e) {
+    return e.value("preview", false) && !e.value("program", true);
+  }));
+  EXPECT_TRUE(sender.WaitFor("metadata", [](const json& e) {
+    return e.value("xml", "") == "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
+  })) << "no shot event with the exact text";
+}
+
+TEST(EndToEnd, AudioOnlyBandwidthBringsNoPictures) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Radio", {"--width", "64", "--height", "16", "--fps", "30"}));
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.seconds = 1.5;
+  o.bandwidth = "audio_only";
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_EQ(result.stats.frames, 0u);
+  EXPECT_GT(result.stats.audioBuffers, 10u);
+}
+
+TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
+  Folder folder;
+  auto sender = std::make_unique<Sender>();
+  const std::vector<std::string> args = {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"};
+  ASSERT_TRUE(sender->Start(folder, "Phoenix", args));
+  std::atomic<bool> stop{false};
+  std::atomic<int> frames{0};
+  std::mutex lock;  // guards states
+  std::vector<int> states;
+  auto statesAfter = [&](std::size_t from) {
+    std::lock_guard<std::mutex> guard(lock);
+    return std::vector<int>(states.begin() + static_cast<long>(std::min(from, states.size())), states.end());
+  };
+  bool restarted = false, framesAgain = false;
+  std::vector<int> afterDeath, afterReturn;
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender->Name());
+  o.seconds = 60;
+  o.interrupted = &stop;
+  o.onVideo = [&](const pmhost::VideoFrame&) { ++frames; };
+  o.onNotification = [&](const std::string& command, const json& message) {
+    if (command != "pm::tsrc::update_connection_state") return;
+    std::lock_guard<std::mutex> guard(lock);
+    states.push_back(message.value("state", 0));
+  };
+  o.whileReceiving = [&](pmhost::Session&, const std::string&) {
+    if (!pmtest::WaitFor([&] { return frames > 0; }, 10s)) return stop = true, void();
+    std::size_t mark = statesAfter(0).size();
+    sender->Process().Signal(SIGKILL);
+    sender->Process().Wait(10s);
+    pmtest::WaitFor([&] {
+      const auto s = statesAfter(mark);
+      return std::find(s.begin(), s.end(), 3) != s.end();
+    }, 15s);
+    afterDeath = statesAfter(mark);
+    mark += afterDeath.size();
+    sender = std::make_unique<Sender>();
+    restarted = sender->Start(folder, "Phoenix", args);
+    const int before = frames;
+    pmtest::WaitFor([&] {
+      const auto s = statesAfter(mark);
+      return std::find(s.begin(), s.end(), 2) != s.end() && frames > before;
+    }, 20s);
+    afterReturn = statesAfter(mark);
+    framesAgain = frames > before;
+    stop = true;
+  };
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_TRUE(restarted);
+  EXPECT_NE(std::find(afterDeath.begin(), afterDeath.end(), 3), afterDeath.end()) << ::testing::PrintToString(afterDeath);
+  // 1 (connecting) comes before 2 (receiving) once the sender is back.
+  const auto one = std::find(afterReturn.begin(), afterReturn.end(), 1);
+  ASSERT_NE(one, afterReturn.end()) << ::testing::PrintToString(afterReturn);
+  EXPECT_NE(std::find(one, afterReturn.end(), 2), afterReturn.end()) << ::testing::PrintToString(afterReturn);
+  EXPECT_TRUE(framesAgain);
+}
+
+// A host sink that only counts.
+struct CountingSink : pmhost::FrameSink {
+  void OnVideo(const std::string&, const pmhost::VideoFrame&) override { ++videos; }
+  void OnAudio(const std::string&, const pmhost::AudioFrame&) override {}
+  std::atomic<int> videos{0};
+};
+
+TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Crash", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+  CountingSink sink;
+  pmhost::Host host(Options(folder), {}, &sink);
+  ASSERT_TRUE(host.Start());
+  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+  ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, 10s));
+  const std::vector<std::string> bases = host.GetSession().MemoryBases();
+  ASSERT_EQ(bases.size(), 1u);
+  ASSERT_GT(SegmentsOf(bases), 0);  // the runner's pool is there
+  ::kill(host.RunnerPid(), SIGKILL);
+  ASSERT_TRUE(host.WaitRunner(10s).has_value());
+  EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, 5s));
+  EXPECT_GT(host.RemovedSegments(), 0);
+  EXPECT_EQ(host.Stop(), 128 + SIGKILL);
+}
+
+}  // namespace
