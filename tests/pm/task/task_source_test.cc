@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <functional>
 #include <memory>
@@ -66,6 +67,7 @@ class ScriptedSource : public pm::Source {
     journal_->Add("config " + tag_ + " " + text);
     if (script_.throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
   }
+  const std::string& Tag() const { return tag_; }
   std::string ValidateGui(std::string text) override {
     journal_->Add("validate " + tag_ + " " + text);
     return script_.guiAnswer;
@@ -96,6 +98,7 @@ class ScriptedDiscovery : public pm::SourceDiscovery {
   void Start() override { journal_->Add("start " + tag_); }
   void Stop() override { journal_->Add("stop " + tag_); }
   void DiscoveryHotplugEvent() override { journal_->Add("hotplug " + tag_); }
+  const std::string& Tag() const { return tag_; }
 
  private:
   std::string tag_;
@@ -172,6 +175,32 @@ class TaskSourceTest : public ::testing::Test {
 };
 
 using Lines = std::vector<std::string>;
+
+// Sends a command on `peer` and waits for its reply, skipping other frames.
+bool AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
+  body["pm::command"] = command;
+  body["pm::unique_id"] = id;
+  body["pm::request"] = true;
+  if (!peer.WriteJson(body)) return false;
+  for (;;) {
+    const Json frame = peer.ReadJson(5s);
+    if (frame.is_discarded()) return false;
+    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return true;
+  }
+}
+
+// Every object started and not the survivor was stopped, and the survivor was not.
+void ExpectOnlySurvivorRunning(const Lines& lines, const std::string& prefix, const std::string& survivor) {
+  int started = 0;
+  for (const std::string& line : lines) {
+    if (line.rfind("start " + prefix, 0) != 0) continue;
+    ++started;
+    const std::string tag = line.substr(6);
+    const bool stopped = std::find(lines.begin(), lines.end(), "stop " + tag) != lines.end();
+    EXPECT_EQ(stopped, tag != survivor) << tag;
+  }
+  EXPECT_GT(started, 1);
+}
 
 TEST_F(TaskSourceTest, EmptyConfigurationsGiveEmptyTextAndOthersStayExact) {
   const Json cases[] = {Json::object(), Json::array(), Json(), Json::parse(R"({"a":1})"), Json::parse(R"([1,"x"])"),
@@ -324,6 +353,38 @@ TEST_F(TaskSourceTest, PerSourceCommandsForUnknownIdsOnlyEcho) {
   }
   Ask("pm::tsrc::stop_source", {{"unique_id", "b"}});
   EXPECT_TRUE(journal_.Lines().empty());
+  EXPECT_EQ(task_->SourceCount(), 1u);
+}
+
+TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopTheRest) {
+  pmtest::HostListener listener;
+  std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener.Port());
+  ASSERT_TRUE(connection);
+  pmtest::HostPeer second = listener.Accept();
+  ASSERT_TRUE(second.Valid());
+  auto dispatcher = std::make_shared<pm::RpcDispatcher>(std::move(connection));
+  task_->AddDispatcher(dispatcher);
+  task_->AttachDispatcher(dispatcher);
+  dispatcher->Start();
+
+  constexpr int kRounds = 15;
+  const auto drive = [](pmtest::HostPeer& peer) {
+    for (int i = 0; i < kRounds; ++i) {
+      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()));
+      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}));
+    }
+  };
+  std::thread other([&] { drive(second); });
+  drive(host_);
+  other.join();
+
+  const Lines lines = journal_.Lines();
+  auto discovery = std::dynamic_pointer_cast<ScriptedDiscovery>(task_->CurrentDiscovery());
+  auto source = std::dynamic_pointer_cast<ScriptedSource>(task_->FindSource("a"));
+  ASSERT_TRUE(discovery);
+  ASSERT_TRUE(source);
+  ExpectOnlySurvivorRunning(lines, "discovery#", discovery->Tag());
+  ExpectOnlySurvivorRunning(lines, "a#", source->Tag());
   EXPECT_EQ(task_->SourceCount(), 1u);
 }
 
