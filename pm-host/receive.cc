@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <sstream>
 #include <map>
 #include <mutex>
@@ -188,6 +189,7 @@ json ReceiveResult::ToJson() const {
   out["source"] = name;
   out["unique_id"] = id;
   out["runner_exit"] = runnerExit;
+  out["runner_cpu_seconds"] = std::round(runnerCpuSeconds * 1000) / 1000;
   if (!error.empty()) out["error"] = error;
   return out;
 }
@@ -215,6 +217,25 @@ std::string SummaryText(const ReceiveResult& r) {
                 static_cast<unsigned long long>(s.drops), static_cast<unsigned long long>(s.badRecords), s.p50Ms,
                 s.p99Ms, s.state, StateName(s.state), r.runnerExit);
   return out + text;
+}
+
+double ProcessCpuSeconds(pid_t pid) {
+  if (pid <= 0) return 0;
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  // The command name (field 2) may hold blanks and parentheses: count from
+  // the last ')'. utime and stime are fields 14 and 15.
+  const std::size_t close = text.rfind(')');
+  if (close == std::string::npos) return 0;
+  std::istringstream fields(text.substr(close + 1));
+  std::string field;
+  unsigned long long utime = 0, stime = 0;
+  for (int i = 3; i <= 15 && fields >> field; ++i) {
+    if (i == 14) utime = std::strtoull(field.c_str(), nullptr, 10);
+    if (i == 15) stime = std::strtoull(field.c_str(), nullptr, 10);
+  }
+  const long ticks = ::sysconf(_SC_CLK_TCK);
+  return ticks > 0 ? static_cast<double>(utime + stime) / static_cast<double>(ticks) : 0;
 }
 
 int Discover(const ListOptions& options) {
@@ -351,6 +372,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   if (!host.RunnerRunning()) result.error = "the runner ended during the run";
 
   result.memoryBases = session.MemoryBases();
+  result.runnerCpuSeconds = ProcessCpuSeconds(host.RunnerPid());
   session.StopSource(match.id);
   // With no discovery running, the last stop_source ends the task and the
   // runner with it.

@@ -68,12 +68,17 @@ struct ReceiveResult {
   std::string name;
   std::string error;       // why it did not run
   int runnerExit = -1;
+  double runnerCpuSeconds = 0;           // user + system time of pm-runner, read before stop_source
   std::vector<std::string> memoryBases;  // of the source's queue (its segments' names start so)
   StatsSnapshot stats;
   nlohmann::json ToJson() const;
 };
 
 ReceiveResult Receive(const ReceiveOptions& options);
+
+// User + system CPU seconds a live process has used (/proc/PID/stat); 0
+// when it cannot be read.
+double ProcessCpuSeconds(pid_t pid);
 
 // A one-line human summary.
 std::string SummaryText(const ReceiveResult& result);
