@@ -48,10 +48,13 @@ pm::TaskBase* MakeTaskFromLibrary(const std::string& library) {
   auto api = std::make_shared<NdiApi>();
   std::string missing;
   if (!LoadNdiApi(library, api.get(), &missing)) {
-    const char* reason = ::dlerror();
+    // Copied at once: the next loader call (the log's context lookup is one)
+    // frees the loader's text.
+    const char* error = ::dlerror();
+    const std::string reason = error ? error : "not found";
     if (missing == library) {
       pm::Log(pm::LogType::Normal, kLogTag, "failed initialization. Cannot load the NDI runtime '%s': %s\n",
-              library.c_str(), reason ? reason : "not found");
+              library.c_str(), reason.c_str());
     } else {
       pm::Log(pm::LogType::Normal, kLogTag, "failed initialization. The NDI runtime '%s' lacks '%s'\n",
               library.c_str(), missing.c_str());
