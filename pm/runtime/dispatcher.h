@@ -135,6 +135,9 @@ class RpcDispatcher {
   bool WakeFlag() const { return wakeFlag_.load(); }
 
  private:
+  // Hands message texts to HandleMessage without a socket (the fuzz targets).
+  friend struct RpcDispatcherTestAccess;
+
   struct PendingRequest {
     std::shared_ptr<const std::string> text;  // the request as sent
     std::int64_t deadline = 0;                // on the timing's clock

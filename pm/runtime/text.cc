@@ -12,9 +12,9 @@ std::u16string Utf8ToUtf16(std::string_view in) {
   std::size_t i = 0;
   while (i < in.size()) {
     const auto lead = static_cast<std::uint8_t>(in[i]);
-    std::uint32_t cp;
-    std::size_t extra;
-    std::uint32_t minimum;
+    std::uint32_t cp = 0;
+    std::size_t extra = 0;
+    std::uint32_t minimum = 0;
     if (lead < 0x80) {
       out.push_back(static_cast<char16_t>(lead));
       ++i;
