@@ -14,6 +14,7 @@
 #include <cstring>
 #include <stdexcept>
 #include <string>
+#include <utility>
 
 #include "fuzz_support.h"
 #include "pm/runtime/dispatcher.h"
@@ -42,7 +43,10 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  pm::RpcDispatcher dispatcher(nullptr);
+  // Stop's grace period is for replies still being written; there are none.
+  pm::DispatcherTiming timing = pm::DispatcherTiming::Steady();
+  timing.sleep = [](std::int64_t) {};
+  pm::RpcDispatcher dispatcher(nullptr, std::move(timing));
   dispatcher.RegisterHandler("echo", [](const nlohmann::json& request, nlohmann::json& response) {
     response["echo"] = request;
   });
