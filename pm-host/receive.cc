@@ -486,8 +486,11 @@ int RunDemo(const DemoOptions& options) {
                    static_cast<unsigned long long>(goodSound.load() + badSound.load()));
     }
     if (!firstProblem.empty()) std::fprintf(options.out, "first damage seen: %s\n", firstProblem.c_str());
+    int left = 0;
+    for (const std::string& base : result.memoryBases) left += CountSegments(base);
+    if (left > 0) std::fprintf(options.out, "pm-host demo: %d segments are left in /dev/shm\n", left);
     const bool intact = result.exitStatus == 0 && goodPictures > 0 && badPictures == 0 && goodSound > 0 &&
-                        badSound == 0 && result.stats.badRecords == 0;
+                        badSound == 0 && result.stats.badRecords == 0 && left == 0;
     if (intact) {
       std::fprintf(options.out, "pm-host demo: frames arrived intact; wrote %s\n", options.png.c_str());
       status = 0;

@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <vector>
 
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
@@ -124,17 +125,34 @@ std::size_t SegmentCache::Count() const {
   return mappings_.size();
 }
 
-int RemoveSegments(const std::string& memoryBase, const std::string& directory) {
-  if (!ValidMemoryBase(memoryBase)) return 0;
+namespace {
+
+// The names in `directory` that are memoryBase followed by digits.
+std::vector<std::string> SegmentNames(const std::string& memoryBase, const std::string& directory) {
+  std::vector<std::string> names;
+  if (!ValidMemoryBase(memoryBase)) return names;
   DIR* dir = ::opendir(directory.c_str());
-  if (dir == nullptr) return 0;
-  int removed = 0;
+  if (dir == nullptr) return names;
   while (const dirent* entry = ::readdir(dir)) {
     const std::string name = entry->d_name;
     if (name.size() <= memoryBase.size() || name.compare(0, memoryBase.size(), memoryBase) != 0) continue;
     bool digits = true;
     for (std::size_t i = memoryBase.size(); i < name.size(); ++i) digits = digits && name[i] >= '0' && name[i] <= '9';
-    if (!digits) continue;
+    if (digits) names.push_back(name);
+  }
+  ::closedir(dir);
+  return names;
+}
+
+}  // namespace
+
+int CountSegments(const std::string& memoryBase, const std::string& directory) {
+  return static_cast<int>(SegmentNames(memoryBase, directory).size());
+}
+
+int RemoveSegments(const std::string& memoryBase, const std::string& directory) {
+  int removed = 0;
+  for (const std::string& name : SegmentNames(memoryBase, directory)) {
     if (::shm_unlink(("/" + name).c_str()) == 0) {
       ++removed;
     } else if (errno != ENOENT) {
@@ -142,7 +160,6 @@ int RemoveSegments(const std::string& memoryBase, const std::string& directory) 
               pm::ErrnoText(errno).c_str());
     }
   }
-  ::closedir(dir);
   return removed;
 }
 

@@ -72,5 +72,7 @@ class SegmentCache {
 // nothing for a memory base that cannot name segments. `directory` is for
 // tests; segments are always removed with shm_unlink.
 int RemoveSegments(const std::string& memoryBase, const std::string& directory = "/dev/shm");
+// How many segments named memoryBase + decimal id exist.
+int CountSegments(const std::string& memoryBase, const std::string& directory = "/dev/shm");
 
 }  // namespace pmhost

@@ -56,8 +56,12 @@ void ReceiveStats::Latency(std::int64_t mediaTime, std::int64_t wallNs, std::int
 void ReceiveStats::Video(std::int64_t mediaTime, std::uint32_t code, int width, int height, std::uint32_t stride,
                          std::int64_t wallNs, std::int64_t steadyNs) {
   std::lock_guard<std::mutex> guard(lock_);
-  if (totals_.frames == 0) firstRead_ = steadyNs;
+  if (totals_.frames == 0) {
+    firstRead_ = steadyNs;
+    firstMedia_ = mediaTime;
+  }
   lastRead_ = steadyNs;
+  lastMedia_ = mediaTime;
   ++totals_.frames;
   totals_.videoCode = code;
   totals_.width = width;
@@ -66,19 +70,28 @@ void ReceiveStats::Video(std::int64_t mediaTime, std::uint32_t code, int width, 
   Latency(mediaTime, wallNs, steadyNs, videoOffsets_);
   recentReads_.push_back(steadyNs);
   while (!recentReads_.empty() && recentReads_.front() < steadyNs - 1'000'000'000) recentReads_.pop_front();
-  if (lastVideoTime_ != INT64_MIN && mediaTime > lastVideoTime_) {
-    const std::int64_t interval = mediaTime - lastVideoTime_;
-    if (intervals_.size() >= 8) {
-      std::vector<std::int64_t> sorted(intervals_.begin(), intervals_.end());
-      std::nth_element(sorted.begin(), sorted.begin() + static_cast<long>(sorted.size() / 2), sorted.end());
-      const std::int64_t median = sorted[sorted.size() / 2];
-      if (median > 0 && interval * 2 > median * 3) {
-        totals_.drops += static_cast<std::uint64_t>(
-            std::max<long long>(0, std::llround(static_cast<double>(interval) / static_cast<double>(median)) - 1));
-      }
-    }
-    intervals_.push_back(interval);
+  // Drops: the pictures a run of the connection should have held (its media
+  // span over the median interval) minus those that arrived. A picture sent
+  // late and the next one early cancel out, as they should.
+  if (lastVideoTime_ == INT64_MIN) {
+    closedDrops_ = totals_.drops;
+    runFirstTime_ = mediaTime;
+    runFrames_ = 0;
+  } else if (mediaTime > lastVideoTime_) {
+    intervals_.push_back(mediaTime - lastVideoTime_);
     if (intervals_.size() > kIntervalWindow) intervals_.pop_front();
+  }
+  ++runFrames_;
+  if (intervals_.size() >= 8 && mediaTime > runFirstTime_) {
+    std::vector<std::int64_t> sorted(intervals_.begin(), intervals_.end());
+    std::nth_element(sorted.begin(), sorted.begin() + static_cast<long>(sorted.size() / 2), sorted.end());
+    const std::int64_t median = sorted[sorted.size() / 2];
+    if (median > 0) {
+      const long long expected =
+          std::llround(static_cast<double>(mediaTime - runFirstTime_) / static_cast<double>(median)) + 1;
+      const long long missing = std::max<long long>(0, expected - static_cast<long long>(runFrames_));
+      totals_.drops = std::max(totals_.drops, closedDrops_ + static_cast<std::uint64_t>(missing));
+    }
   }
   lastVideoTime_ = mediaTime;
 }
@@ -130,7 +143,11 @@ StatsSnapshot ReceiveStats::Snapshot(std::int64_t steadyNs) const {
     std::size_t recent = 0;
     for (std::int64_t t : recentReads_) recent += t >= steadyNs - 1'000'000'000 ? 1 : 0;
     snapshot.recentFps = static_cast<double>(recent);
-    if (totals_.frames > 1 && lastRead_ > firstRead_) {
+    // On the sender's clock: pictures that queued while the connection was
+    // set up and then arrived in a burst do not raise the rate.
+    if (totals_.frames > 1 && lastMedia_ > firstMedia_) {
+      snapshot.fps = static_cast<double>(totals_.frames - 1) * 705'600'000.0 / static_cast<double>(lastMedia_ - firstMedia_);
+    } else if (totals_.frames > 1 && lastRead_ > firstRead_) {
       snapshot.fps = static_cast<double>(totals_.frames - 1) * 1e9 / static_cast<double>(lastRead_ - firstRead_);
     }
   }

@@ -39,7 +39,7 @@ struct StatsSnapshot {
   std::uint32_t stride = 0;
   std::uint64_t drops = 0;
   std::uint64_t badRecords = 0;
-  double fps = 0;          // over the whole run
+  double fps = 0;          // pictures per second of the sender's media time
   double recentFps = 0;    // over the last second
   double p50Ms = 0;
   double p99Ms = 0;
@@ -75,7 +75,12 @@ class ReceiveStats {
   std::vector<Offset> audioOffsets_;
   std::int64_t lastVideoTime_ = INT64_MIN;
   std::deque<std::int64_t> intervals_;   // recent media intervals between pictures
+  std::uint64_t closedDrops_ = 0;        // drops of earlier runs of the connection
+  std::int64_t runFirstTime_ = 0;        // media time of this run's first picture
+  std::uint64_t runFrames_ = 0;          // pictures of this run
   std::deque<std::int64_t> recentReads_; // steady times of the pictures of the last second
+  std::int64_t firstMedia_ = 0;
+  std::int64_t lastMedia_ = 0;
   std::int64_t firstRead_ = 0;
   std::int64_t lastRead_ = 0;
 };
