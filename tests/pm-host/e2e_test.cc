@@ -79,9 +79,10 @@ class Sender {
   pmhost::ChildProcess& Process() { return process_; }
 
  private:
-  pmhost::ChildProcess process_;
   std::mutex lock_;  // guards events_
   std::vector<json> events_;
+  // Last: destroyed first, which joins the thread that fills events_.
+  pmhost::ChildProcess process_;
 };
 
 pmhost::HostOptions Options(const Folder& folder) {
