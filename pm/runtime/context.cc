@@ -40,8 +40,10 @@ Context* GetContext() {
 
 Context::LogSink CurrentLogSink() {
   Context* context = GetContext();
-  if (!context->logSink) context->logSink = DefaultSink;
-  return context->logSink;
+  if (context->logSink) return context->logSink;
+  // Not stored in the slot: two threads logging for the first time would
+  // both write it while others read it.
+  return DefaultSink;
 }
 
 std::shared_ptr<Context::SingletonBase> FindSingleton(

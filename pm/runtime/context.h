@@ -35,9 +35,9 @@ inline constexpr const char* kContextExportName = "QFProcessManagementGlobals";
 // one when it exports none. Never null; the same pointer on every call.
 Context* GetContext();
 
-// The log sink of the context, installing the default sink (one write of the
-// line to stderr) when the slot is empty. Read without a lock: the runner
-// installs its sink before the task starts logging.
+// The log sink of the context, or the default sink (one write of the line to
+// stderr) when the slot is empty; the slot itself is left as it is. Read
+// without a lock: the runner installs its sink before the task starts logging.
 Context::LogSink CurrentLogSink();
 
 // Looks `name` up in the context's registry under its lock, inserting an empty
