@@ -15,13 +15,7 @@ Discovery::Discovery(std::shared_ptr<Callbacks> callbacks, std::shared_ptr<const
                      LoopEnvironment environment)
     : pm::SourceDiscovery(std::move(callbacks)),
       api_(std::move(api)),
-      env_([&environment] {
-        LoopEnvironment env = std::move(environment);
-        LoopEnvironment defaults = DefaultLoopEnvironment();
-        if (!env.clock) env.clock = defaults.clock;
-        if (!env.exitProcess) env.exitProcess = defaults.exitProcess;
-        return env;
-      }()) {}
+      env_(CompleteLoopEnvironment(std::move(environment))) {}
 
 Discovery::~Discovery() {
   std::lock_guard<std::mutex> lifecycle(lifecycleMutex_);

@@ -30,4 +30,12 @@ LoopEnvironment DefaultLoopEnvironment() {
   return env;
 }
 
+LoopEnvironment CompleteLoopEnvironment(LoopEnvironment env) {
+  if (env.clock && env.exitProcess) return env;
+  LoopEnvironment defaults = DefaultLoopEnvironment();
+  if (!env.clock) env.clock = defaults.clock;
+  if (!env.exitProcess) env.exitProcess = defaults.exitProcess;
+  return env;
+}
+
 }  // namespace TaskNDISource

@@ -52,5 +52,7 @@ struct LoopEnvironment {
 
 // The steady clock, 5 seconds, std::_Exit(1).
 LoopEnvironment DefaultLoopEnvironment();
+// `environment` with a missing clock or exit hook taken from the defaults.
+LoopEnvironment CompleteLoopEnvironment(LoopEnvironment environment);
 
 }  // namespace TaskNDISource

@@ -58,13 +58,7 @@ NDISource::NDISource(std::shared_ptr<Callbacks> callbacks, std::string uniqueId,
                      LoopEnvironment environment)
     : pm::Source(std::move(callbacks), std::move(uniqueId)),
       api_(std::move(api)),
-      env_([&environment] {
-        LoopEnvironment env = std::move(environment);
-        LoopEnvironment defaults = DefaultLoopEnvironment();
-        if (!env.clock) env.clock = defaults.clock;
-        if (!env.exitProcess) env.exitProcess = defaults.exitProcess;
-        return env;
-      }()),
+      env_(CompleteLoopEnvironment(std::move(environment))),
       config_(std::make_unique<Config>()) {}
 
 NDISource::~NDISource() {
