@@ -15,6 +15,7 @@
 #include <sstream>
 #include <thread>
 
+#include "e2e_support.h"
 #include "pm-host/checks.h"
 #include "pm-host/receive.h"
 #include "pm/task/formats.h"
@@ -25,102 +26,11 @@ namespace {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-// A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs.
-struct Folder {
-  Folder() {
-    std::string pattern = ::testing::TempDir() + "pmhost-e2e-XXXXXX";
-    if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
-  }
-  ~Folder() {
-    std::error_code ignored;
-    std::filesystem::remove_all(path, ignored);
-  }
-  std::string Registry() const { return path + "/registry"; }
-  std::string RunnerLog() const { return path + "/runner.log"; }
-  std::string ReadRunnerLog() const {
-    std::ifstream in(RunnerLog());
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
-  }
-  std::string path;
-};
-
-// ndi-testsrc with its event lines collected.
-class Sender {
- public:
-  bool Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
-    pmhost::ChildOptions o;
-    o.path = PM_TESTSRC_PATH;
-    o.args = {"--name", name, "--seconds", "120"};
-    o.args.insert(o.args.end(), args.begin(), args.end());
-    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-    o.captureStdout = true;
-    o.onLine = [this](const std::string& line) {
-      json event = json::parse(line, nullptr, false);
-      std::lock_guard<std::mutex> guard(lock_);
-      if (event.is_object()) events_.push_back(std::move(event));
-    };
-    if (!process_.Start(std::move(o))) return false;
-    return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, 10s);
-  }
-  std::string Name() { return Find("ready").value("name", ""); }
-  // The first event of this kind for which `match` holds, or null.
-  json Find(const std::string& kind, const std::function<bool(const json&)>& match = {}) {
-    std::lock_guard<std::mutex> guard(lock_);
-    for (const json& e : events_) {
-      if (e.value("event", "") == kind && (!match || match(e))) return e;
-    }
-    return nullptr;
-  }
-  bool WaitFor(const std::string& kind, const std::function<bool(const json&)>& match = {}) {
-    return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, 10s);
-  }
-  pmhost::ChildProcess& Process() { return process_; }
-
- private:
-  std::mutex lock_;  // guards events_
-  std::vector<json> events_;
-  // Last: destroyed first, which joins the thread that fills events_.
-  pmhost::ChildProcess process_;
-};
-
-pmhost::HostOptions Options(const Folder& folder) {
-  pmhost::HostOptions o;
-  o.runnerPath = PM_RUNNER_PATH;
-  o.modulePath = PM_MODULE_PATH;
-  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-  o.runnerLog = folder.RunnerLog();
-  return o;
-}
-
-// Entries of /dev/shm whose names start with one of the bases.
-int SegmentsOf(const std::vector<std::string>& bases) {
-  int count = 0;
-  for (const auto& entry : std::filesystem::directory_iterator("/dev/shm")) {
-    const std::string name = entry.path().filename().string();
-    for (const std::string& base : bases) count += !base.empty() && name.rfind(base, 0) == 0 ? 1 : 0;
-  }
-  return count;
-}
-
-pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
-  pmhost::ReceiveOptions o;
-  o.host = Options(folder);
-  o.source = source;
-  o.out = stderr;
-  return o;
-}
-
-// The run ended in order: the last stop_source ended the runner with 0 and
-// nothing of the queue is left in /dev/shm.
-void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder) {
-  EXPECT_EQ(result.error, "");
-  EXPECT_EQ(result.runnerExit, 0) << folder.ReadRunnerLog();
-  EXPECT_FALSE(result.memoryBases.empty());
-  EXPECT_EQ(SegmentsOf(result.memoryBases), 0);
-  EXPECT_EQ(result.stats.badRecords, 0u);
-}
+using pmtest::ExpectOrderlyEnd;
+using pmtest::Folder;
+using pmtest::ReceiveFrom;
+using pmtest::Sender;
+using pmtest::SegmentsOf;
 
 TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   Folder folder;
@@ -131,7 +41,7 @@ TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   std::set<std::string> seen, gone;
   std::atomic<bool> stop{false};
   pmhost::ListOptions list;
-  list.host = Options(folder);
+  list.host = pmtest::HostOptionsFor(folder);
   list.seconds = 60;
   list.out = stderr;
   list.interrupted = &stop;
@@ -366,7 +276,7 @@ TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Crash", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
   CountingSink sink;
-  pmhost::Host host(Options(folder), {}, &sink);
+  pmhost::Host host(pmtest::HostOptionsFor(folder), {}, &sink);
   ASSERT_TRUE(host.Start());
   const std::string id = pmhost::kSourceIdPrefix + sender.Name();
   ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));

@@ -1,0 +1,134 @@
+#include "e2e_support.h"
+
+#include <dirent.h>
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include <gtest/gtest.h>
+
+#include "support/wait.h"
+
+namespace pmtest {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+
+const Programs& BuiltPrograms() {
+  static const Programs programs{PM_RUNNER_PATH, PM_MODULE_PATH, PM_TESTSRC_PATH};
+  return programs;
+}
+
+Folder::Folder() {
+  std::string pattern = ::testing::TempDir() + "pm-e2e-XXXXXX";
+  if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
+}
+
+Folder::~Folder() {
+  std::error_code ignored;
+  if (!path.empty()) std::filesystem::remove_all(path, ignored);
+}
+
+std::string Folder::ReadRunnerLog() const {
+  std::ifstream in(RunnerLog());
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+bool Sender::Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
+  pmhost::ChildOptions o;
+  o.path = BuiltPrograms().testsrc;
+  o.args = {"--name", name, "--seconds", "120"};
+  o.args.insert(o.args.end(), args.begin(), args.end());
+  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  o.captureStdout = true;
+  o.onLine = [this](const std::string& line) {
+    json event = json::parse(line, nullptr, false);
+    std::lock_guard<std::mutex> guard(lock_);
+    if (event.is_object()) events_.push_back(std::move(event));
+  };
+  if (!process_.Start(std::move(o))) return false;
+  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, 10s);
+}
+
+json Sender::Find(const std::string& kind, const std::function<bool(const json&)>& match) {
+  std::lock_guard<std::mutex> guard(lock_);
+  for (const json& e : events_) {
+    if (e.value("event", "") == kind && (!match || match(e))) return e;
+  }
+  return nullptr;
+}
+
+bool Sender::WaitFor(const std::string& kind, const std::function<bool(const json&)>& match) {
+  return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, 10s);
+}
+
+pmhost::HostOptions HostOptionsFor(const Folder& folder) {
+  pmhost::HostOptions o;
+  o.runnerPath = BuiltPrograms().runner;
+  o.modulePath = BuiltPrograms().module;
+  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  o.runnerLog = folder.RunnerLog();
+  return o;
+}
+
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
+  pmhost::ReceiveOptions o;
+  o.host = HostOptionsFor(folder);
+  o.source = source;
+  o.out = stderr;
+  return o;
+}
+
+int SegmentsOf(const std::vector<std::string>& bases) {
+  int count = 0;
+  std::error_code error;
+  for (const auto& entry : std::filesystem::directory_iterator("/dev/shm", error)) {
+    const std::string name = entry.path().filename().string();
+    for (const std::string& base : bases) count += !base.empty() && name.rfind(base, 0) == 0 ? 1 : 0;
+  }
+  return count;
+}
+
+void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder) {
+  EXPECT_EQ(result.error, "");
+  EXPECT_EQ(result.runnerExit, 0) << folder.ReadRunnerLog();
+  EXPECT_FALSE(result.memoryBases.empty());
+  EXPECT_EQ(SegmentsOf(result.memoryBases), 0);
+  EXPECT_EQ(result.stats.badRecords, 0u);
+}
+
+namespace {
+
+std::optional<ProcessUsage> UsageAt(const std::string& proc) {
+  ProcessUsage usage;
+  DIR* fds = ::opendir((proc + "/fd").c_str());
+  if (fds == nullptr) return std::nullopt;
+  while (const dirent* entry = ::readdir(fds)) usage.descriptors += entry->d_name[0] != '.' ? 1 : 0;
+  ::closedir(fds);
+  --usage.descriptors;  // the directory stream itself, when it is our own process
+  std::ifstream status(proc + "/status");
+  if (!status) return std::nullopt;
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("Threads:", 0) == 0) usage.threads = std::atoi(line.c_str() + 8);
+    if (line.rfind("VmRSS:", 0) == 0) usage.residentKiB = std::atol(line.c_str() + 6);
+  }
+  return usage;
+}
+
+}  // namespace
+
+std::optional<ProcessUsage> UsageOf(pid_t pid) {
+  auto usage = UsageAt("/proc/" + std::to_string(pid));
+  if (usage) ++usage->descriptors;  // only our own directory stream shows in our own table
+  return usage;
+}
+
+std::optional<ProcessUsage> OwnUsage() { return UsageAt("/proc/self"); }
+
+}  // namespace pmtest

@@ -1,0 +1,84 @@
+#pragma once
+// What the tests that drive real processes share: a private registry folder
+// per case, ndi-testsrc with its event lines, host options pointing at the
+// built runner and module, and probes of a process's and /dev/shm's state.
+#include <sys/types.h>
+
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <nlohmann/json.hpp>
+
+#include "pm-host/host.h"
+#include "pm-host/process.h"
+#include "pm-host/receive.h"
+
+namespace pmtest {
+
+// The programs under test; set from the build (see pm_e2e_support).
+struct Programs {
+  std::string runner;
+  std::string module;
+  std::string testsrc;
+};
+const Programs& BuiltPrograms();
+
+// A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs; both
+// removed with the object.
+struct Folder {
+  Folder();
+  ~Folder();
+  Folder(const Folder&) = delete;
+  Folder& operator=(const Folder&) = delete;
+  std::string Registry() const { return path + "/registry"; }
+  std::string RunnerLog() const { return path + "/runner.log"; }
+  std::string ReadRunnerLog() const;
+  std::string path;
+};
+
+// ndi-testsrc with its event lines (JSON objects on stdout) collected.
+class Sender {
+ public:
+  // Starts `--name name --seconds 120 args...` and waits for its "ready".
+  bool Start(const Folder& folder, const std::string& name, std::vector<std::string> args);
+  std::string Name() { return Find("ready").value("name", ""); }
+  // The first event of this kind for which `match` holds, or null.
+  nlohmann::json Find(const std::string& kind, const std::function<bool(const nlohmann::json&)>& match = {});
+  bool WaitFor(const std::string& kind, const std::function<bool(const nlohmann::json&)>& match = {});
+  pmhost::ChildProcess& Process() { return process_; }
+
+ private:
+  std::mutex lock_;  // guards events_
+  std::vector<nlohmann::json> events_;
+  // Last: destroyed first, which joins the thread that fills events_.
+  pmhost::ChildProcess process_;
+};
+
+// Host options for the built runner and module in the folder's registry.
+pmhost::HostOptions HostOptionsFor(const Folder& folder);
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source);
+
+// Entries of /dev/shm whose names start with one of the bases.
+int SegmentsOf(const std::vector<std::string>& bases);
+
+// The run ended in order: the last stop_source ended the runner with 0 and
+// nothing of the queue is left in /dev/shm.
+void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder);
+
+// What a live process holds, from /proc/PID: open descriptors, threads and
+// resident memory. nullopt when the process cannot be read.
+struct ProcessUsage {
+  int descriptors = 0;
+  int threads = 0;
+  long residentKiB = 0;
+};
+std::optional<ProcessUsage> UsageOf(pid_t pid);
+// Of this process.
+std::optional<ProcessUsage> OwnUsage();
+
+}  // namespace pmtest
