@@ -1,6 +1,9 @@
 // ndi-testsrc: an NDI sender of test pictures and sound, written only against
 // the NDI C interface (taskndisource/ndi_abi.h), so that it runs unchanged on
 // any runtime that exports it. Every event it sees is one JSON line on stdout.
+// With --sizes the picture size changes every --frames-per-size frames (round
+// and round through the list), each change announced as
+// {"event":"size","width":W,"height":H,"frame":N} before frame N goes out.
 #include <signal.h>
 #include <tinyxml2.h>
 #include <unistd.h>
@@ -11,6 +14,8 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <memory>
+#include <optional>
 #include <mutex>
 #include <nlohmann/json.hpp>
 #include <set>
@@ -42,6 +47,8 @@ struct Options {
   std::string model;
   std::int64_t frames = -1;
   double seconds = -1;
+  std::string sizes;          // "WxH,WxH,...": a sequence of picture sizes
+  int frames_per_size = 30;   // frames of each size before the next one
 };
 
 std::mutex g_out_mutex;  // guards stdout
@@ -157,13 +164,47 @@ void WatchEvents(void* sender, const std::atomic<bool>& done) {
   }
 }
 
-// What one video frame looks like. Kept per frame so that a stream can later
-// change its size mid-way.
+// What one video frame looks like. Kept per frame so that a stream can
+// change its size mid-way (--sizes).
 struct Geometry {
   std::uint32_t fourcc = 0;
   int width = 0;
   int height = 0;
   bool operator==(const Geometry&) const = default;
+};
+
+// "1920x1080,1280x720": the sizes in order; empty when the text is not such a
+// list or a size is out of range.
+std::vector<Geometry> ParseSizes(const std::string& text, std::uint32_t fourcc) {
+  std::vector<Geometry> sizes;
+  std::size_t at = 0;
+  while (at <= text.size()) {
+    const std::size_t comma = std::min(text.find(',', at), text.size());
+    const std::string item = text.substr(at, comma - at);
+    int w = 0, h = 0;
+    char x = 0, extra = 0;
+    if (std::sscanf(item.c_str(), "%d%c%d%c", &w, &x, &h, &extra) != 3 || (x != 'x' && x != 'X') || w < 2 ||
+        h < 2 || w > 16384 || h > 16384) {
+      return {};
+    }
+    sizes.push_back({fourcc, w, h});
+    at = comma + 1;
+  }
+  return sizes;
+}
+
+// The picture of one geometry: its planes, its memory and, for the bars
+// pattern, its bars.
+struct Picture {
+  Picture(const Geometry& g, bool with_bars)
+      : geometry(g), planes(ndits::PictureLayout(g.fourcc, g.width, g.height)) {
+    bytes.resize(ndits::PictureSize(planes));
+    if (with_bars) bars.emplace(g.fourcc, g.width, g.height);
+  }
+  Geometry geometry;
+  std::vector<ndits::Plane> planes;
+  std::vector<std::uint8_t> bytes;
+  std::optional<ndits::Bars> bars;
 };
 
 int Run(const Options& o) {
@@ -172,11 +213,20 @@ int Run(const Options& o) {
     std::fprintf(stderr, "ndi-testsrc: bad --fps %s (N or N/D)\n", o.fps.c_str());
     return 2;
   }
-  const Geometry geometry{ndits::FourCCFromName(o.format), o.width, o.height};
-  std::vector<ndits::Plane> planes = ndits::PictureLayout(geometry.fourcc, geometry.width, geometry.height);
-  if (planes.empty()) {
-    std::fprintf(stderr, "ndi-testsrc: %s cannot be %dx%d\n", o.format.c_str(), o.width, o.height);
-    return 2;
+  const std::uint32_t fourcc = ndits::FourCCFromName(o.format);
+  std::vector<Geometry> sizes{{fourcc, o.width, o.height}};
+  if (!o.sizes.empty()) {
+    sizes = ParseSizes(o.sizes, fourcc);
+    if (sizes.empty()) {
+      std::fprintf(stderr, "ndi-testsrc: bad --sizes %s (WxH,WxH,...)\n", o.sizes.c_str());
+      return 2;
+    }
+  }
+  for (const Geometry& g : sizes) {
+    if (ndits::PictureLayout(g.fourcc, g.width, g.height).empty()) {
+      std::fprintf(stderr, "ndi-testsrc: %s cannot be %dx%d\n", o.format.c_str(), g.width, g.height);
+      return 2;
+    }
   }
   const bool ramp = o.pattern == "ramp";
   int audio_samples = o.audio_samples;
@@ -220,8 +270,9 @@ int Run(const Options& o) {
   std::atomic<bool> done{false};
   std::thread events([&] { WatchEvents(sender, done); });
 
-  std::vector<std::uint8_t> picture(ndits::PictureSize(planes));
-  const ndits::Bars bars(geometry.fourcc, geometry.width, geometry.height);
+  // The sizes follow each other every frames_per_size frames, round and
+  // round; each change is reported before its first frame goes out.
+  std::unique_ptr<Picture> picture;
   const int channels = o.audio_channels;
   const int channel_stride = (audio_samples + 16) * 4;  // padded apart, as capture cards do
   std::vector<float> audio(static_cast<std::size_t>(channel_stride / 4) * channels);
@@ -257,10 +308,17 @@ int Run(const Options& o) {
         samples_sent += audio_samples;
       }
     }
+    const std::int64_t turn = (n / o.frames_per_size) % static_cast<std::int64_t>(sizes.size());
+    const Geometry& geometry = sizes[static_cast<std::size_t>(turn)];
+    if (!picture || !(picture->geometry == geometry)) {
+      picture.reset();  // a 2160p picture is 16 MB: never two at once
+      picture = std::make_unique<Picture>(geometry, !ramp);
+      Emit({{"event", "size"}, {"width", geometry.width}, {"height", geometry.height}, {"frame", n}});
+    }
     if (ramp) {
-      ndits::FillRamp(planes, n, picture.data());
+      ndits::FillRamp(picture->planes, n, picture->bytes.data());
     } else {
-      bars.Fill(n, picture.data());
+      picture->bars->Fill(n, picture->bytes.data());
     }
     ndi_video_frame_v2 frame{};
     frame.xres = geometry.width;
@@ -271,8 +329,8 @@ int Run(const Options& o) {
     frame.picture_aspect_ratio = static_cast<float>(geometry.width) / static_cast<float>(geometry.height);
     frame.frame_format_type = kNdiFrameFormatProgressive;
     frame.timecode = kNdiSendTimecodeSynthesize;
-    frame.data = picture.data();
-    frame.line_stride_in_bytes = planes[0].stride;
+    frame.data = picture->bytes.data();
+    frame.line_stride_in_bytes = picture->planes[0].stride;
     NDIlib_send_send_video_v2(sender, &frame);  // paced by the runtime when clock_video is set
     ++n;
   }
@@ -307,6 +365,9 @@ int main(int argc, char** argv) {
   auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")->check(CLI::NonNegativeNumber);
   auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")->check(CLI::NonNegativeNumber);
   frames->excludes(seconds);
+  app.add_option("--sizes", o.sizes, "picture sizes WxH,WxH,... in turn (instead of --width/--height)");
+  app.add_option("--frames-per-size", o.frames_per_size, "frames of each of --sizes before the next")
+      ->check(CLI::Range(1, 1 << 30));
   CLI11_PARSE(app, argc, argv);
 
   struct sigaction action {};
