@@ -1,0 +1,656 @@
+// What arrives from senders and on sockets, against the real programs: every
+// case has its own registry folder, sender and runner, and ends by checking
+// that nothing was lost or leaked (the runner ends with 0 after the last
+// stop_source having removed its own segments, nothing of the queue's memory
+// base is left in /dev/shm, this process holds the descriptors it held
+// before).
+//
+//  - channel counts: 1..127 arrive intact; 128..255 (negative in the
+//    record's signed channel byte) and 256 (beyond the byte) never reach the
+//    host and are logged;
+//  - a sender that changes its picture size mid-stream (1080p, 720p, 2160p);
+//  - a host that misbehaves on its sockets: bad message frames and oversize
+//    lengths to the runner, unknown and repeated tokens to a queue, a second
+//    connection to a queue server.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <condition_variable>
+#include <cstring>
+#include <future>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "e2e_support.h"
+#include "pm-host/checks.h"
+#include "pm-host/queue_reader.h"
+#include "pm-host/session.h"
+#include "pm/ipc/connection.h"
+#include "pm/ipc/server.h"
+#include "pm/runtime/dispatcher.h"
+#include "support/wait.h"
+
+namespace {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+
+using pmtest::Folder;
+using pmtest::Sender;
+using pmtest::SegmentsOf;
+
+// Generous: the sanitizer builds start processes slowly on a busy machine.
+constexpr auto kArrivalLimit = 30s;
+constexpr auto kExitLimit = 15s;
+
+// Small pictures keep the sound cases cheap.
+const std::vector<std::string> kSmallPictures = {"--pattern", "ramp", "--width", "64", "--height", "16", "--fps", "30"};
+
+std::string Id(Sender& sender) { return std::string(pmhost::kSourceIdPrefix) + sender.Name(); }
+
+// Every case: this process holds the descriptors it held before (the host's
+// connections, mappings, children's pipes and threads all let go).
+class InputFaults : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    before_ = pmtest::OwnUsage();
+    ASSERT_TRUE(before_.has_value());
+  }
+  void TearDown() override {
+    const auto after = pmtest::OwnUsage();
+    ASSERT_TRUE(after.has_value());
+    EXPECT_EQ(after->descriptors, before_->descriptors) << "descriptors of the test process leaked";
+  }
+
+ private:
+  std::optional<pmtest::ProcessUsage> before_;
+};
+
+// Frames as they reach the host, checked on the queue's reader thread: ramp
+// pictures and sound intact, frame numbers never backwards, sound without
+// gaps, and the sizes and channel counts seen.
+class CheckingSink : public pmhost::FrameSink {
+ public:
+  struct Size {
+    int width = 0;
+    int height = 0;
+    bool operator==(const Size&) const = default;
+  };
+
+  void OnVideo(const std::string&, const pmhost::VideoFrame& frame) override {
+    std::int64_t n = -1;
+    const std::string check = pmhost::CheckRampPicture(frame, &n);
+    std::lock_guard<std::mutex> guard(lock_);
+    ++pictures_;
+    if (!check.empty()) Problem("picture " + std::to_string(n) + ": " + check);
+    if (n <= lastFrame_) Problem("frame " + std::to_string(n) + " after " + std::to_string(lastFrame_));
+    lastFrame_ = n;
+    const Size size{frame.width, frame.height};
+    if (sizes_.empty() || !(sizes_.back().first == size)) sizes_.push_back({size, 0});
+    ++sizes_.back().second;
+  }
+
+  void OnAudio(const std::string&, const pmhost::AudioFrame& frame) override {
+    std::int64_t first = -1;
+    const std::string check = pmhost::CheckRampSound(frame, &first);
+    std::lock_guard<std::mutex> guard(lock_);
+    ++sounds_;
+    if (!check.empty()) Problem("sound: " + check);
+    if (nextSample_ >= 0 && first != nextSample_ % 1024) {
+      Problem("sound continues at " + std::to_string(first) + " instead of " + std::to_string(nextSample_ % 1024));
+    }
+    nextSample_ = first + frame.samples;
+    channels_.push_back(frame.channels);
+  }
+
+  void OnBadRecord(const std::string&, const std::string& reason) override {
+    std::lock_guard<std::mutex> guard(lock_);
+    Problem("bad record: " + reason);
+  }
+
+  int Pictures() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return pictures_;
+  }
+  int Sounds() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return sounds_;
+  }
+  // Every fault seen, in order (empty when everything arrived intact).
+  std::vector<std::string> Problems() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return problems_;
+  }
+  // The runs of equal picture sizes, in order, with their picture counts.
+  std::vector<std::pair<Size, int>> SizeRuns() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return sizes_;
+  }
+  std::vector<int> Channels() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return channels_;
+  }
+
+ private:
+  void Problem(std::string text) {  // lock_ held
+    if (problems_.size() < 20) problems_.push_back(std::move(text));
+  }
+
+  mutable std::mutex lock_;  // guards everything below
+  int pictures_ = 0;
+  int sounds_ = 0;
+  std::int64_t lastFrame_ = -1;
+  std::int64_t nextSample_ = -1;
+  std::vector<std::pair<Size, int>> sizes_;
+  std::vector<int> channels_;
+  std::vector<std::string> problems_;
+};
+
+void PrintTo(const CheckingSink::Size& s, std::ostream* os) { *os << s.width << "x" << s.height; }
+
+// How a run through the reference host ended.
+struct RunEnd {
+  std::optional<int> runnerExit;  // after the last stop_source, without being asked
+  int leftInShm = -1;             // entries of the run's memory bases once the runner ended
+  int removedByHost = -1;         // segments the host had to remove for the runner
+  std::vector<std::string> bases;
+  int segmentsWhileRunning = 0;   // entries of the bases just before stop_source
+};
+
+// Receives `id` through the reference host until `done` (or the arrival
+// limit), runs `during` with the runner's process id, then stops the source
+// and lets the runner end by itself.
+RunEnd ReceiveThroughHost(const Folder& folder, const std::string& id, pmhost::FrameSink* sink,
+                          const std::function<bool()>& done,
+                          const std::function<void(pid_t runner)>& during = {}) {
+  RunEnd end;
+  pmhost::Host host(pmtest::HostOptionsFor(folder), {}, sink);
+  if (!host.Start()) {
+    ADD_FAILURE() << "the runner did not start\n" << folder.ReadRunnerLog();
+    return end;
+  }
+  EXPECT_TRUE(host.GetSession().StartSource(id, json::object()).has_value());
+  EXPECT_TRUE(pmtest::WaitFor(done, kArrivalLimit)) << folder.ReadRunnerLog();
+  if (during) during(host.RunnerPid());
+  end.bases = host.GetSession().MemoryBases();
+  end.segmentsWhileRunning = SegmentsOf(end.bases);
+  host.GetSession().StopSource(id);
+  end.runnerExit = host.WaitRunner(kExitLimit);
+  end.leftInShm = SegmentsOf(end.bases);
+  host.Stop();
+  end.removedByHost = host.RemovedSegments();
+  return end;
+}
+
+void ExpectCleanEnd(const RunEnd& end, const Folder& folder) {
+  EXPECT_EQ(end.runnerExit, std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_EQ(end.bases.size(), 1u);
+  EXPECT_EQ(end.leftInShm, 0);
+  EXPECT_EQ(end.removedByHost, 0) << "the runner left segments for the host to remove";
+}
+
+std::size_t Occurrences(const std::string& text, const std::string& what) {
+  std::size_t count = 0;
+  for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++count;
+  return count;
+}
+
+// --- Channel counts ------------------------------------------------------
+
+class ChannelsThatFit : public InputFaults, public ::testing::WithParamInterface<int> {};
+
+TEST_P(ChannelsThatFit, ArriveIntactAndContinuousWithTheirCount) {
+  const int channels = GetParam();
+  Folder folder;
+  Sender sender;
+  std::vector<std::string> args = kSmallPictures;
+  args.insert(args.end(), {"--audio-rate", "48000", "--audio-channels", std::to_string(channels)});
+  ASSERT_TRUE(sender.Start(folder, "Channels", args));
+  CheckingSink sink;
+  const RunEnd end = ReceiveThroughHost(folder, Id(sender), &sink, [&] { return sink.Sounds() >= 15; });
+  ExpectCleanEnd(end, folder);
+  EXPECT_GE(sink.Sounds(), 15);
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+  const std::vector<int> seen = sink.Channels();
+  EXPECT_EQ(std::count(seen.begin(), seen.end(), channels), static_cast<long>(seen.size()))
+      << "channel counts other than " << channels;
+}
+
+INSTANTIATE_TEST_SUITE_P(Sound, ChannelsThatFit, ::testing::Values(1, 2, 8, 16, 127),
+                         [](const ::testing::TestParamInfo<int>& info) { return std::to_string(info.param); });
+
+// 128..255 fit the record's byte but read back negative where sizes are
+// computed; 256 does not fit the byte at all. Either way no sound buffer may
+// be asked for (a negative size must not become a huge or a wrapped one) and
+// the pictures keep coming.
+struct Refusal {
+  int channels;
+  const char* line;  // in the runner's log
+  const char* notLine;
+};
+
+void PrintTo(const Refusal& r, std::ostream* os) { *os << r.channels << " channels"; }
+
+class ChannelsThatDoNotFit : public InputFaults, public ::testing::WithParamInterface<Refusal> {};
+
+TEST_P(ChannelsThatDoNotFit, AreRefusedWithTheirLineAndNoSoundRecord) {
+  const Refusal r = GetParam();
+  Folder folder;
+  Sender sender;
+  std::vector<std::string> args = kSmallPictures;
+  args.insert(args.end(), {"--audio-rate", "48000", "--audio-channels", std::to_string(r.channels)});
+  ASSERT_TRUE(sender.Start(folder, "Too many", args));
+  CheckingSink sink;
+  const RunEnd end = ReceiveThroughHost(folder, Id(sender), &sink, [&] {
+    return sink.Pictures() >= 15 && folder.ReadRunnerLog().find(r.line) != std::string::npos;
+  });
+  ExpectCleanEnd(end, folder);
+  const std::string log = folder.ReadRunnerLog();
+  EXPECT_NE(log.find(r.line), std::string::npos) << log;
+  EXPECT_EQ(log.find(r.notLine), std::string::npos) << log;
+  EXPECT_GE(sink.Pictures(), 15);
+  EXPECT_EQ(sink.Sounds(), 0);
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Sound, ChannelsThatDoNotFit,
+    ::testing::Values(Refusal{128, "#ndisource: audio well ran dry", "too many channels"},
+                      Refusal{200, "#ndisource: audio well ran dry", "too many channels"},
+                      Refusal{255, "#ndisource: audio well ran dry", "too many channels"},
+                      Refusal{256, "#ndisource: too many channels in NDI audio frame (256)", "audio well ran dry"}),
+    [](const ::testing::TestParamInfo<Refusal>& info) { return std::to_string(info.param.channels); });
+
+// --- Picture size changes ------------------------------------------------
+
+TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
+  Folder folder;
+  Sender sender;
+  // Six frames of each size, round and round, at 15 fps: a 2160p picture is
+  // 16 MB, so only a few of them travel.
+  ASSERT_TRUE(sender.Start(folder, "Zoom", {"--pattern", "ramp", "--sizes", "1920x1080,1280x720,3840x2160",
+                                            "--frames-per-size", "6", "--fps", "15", "--no-audio"}));
+  using Size = CheckingSink::Size;
+  const Size hd{1920, 1080}, small{1280, 720}, uhd{3840, 2160};
+  CheckingSink sink;
+  // Done once the host has seen 1080p turn into 720p, 720p into 2160p, and a
+  // second 2160p picture.
+  const auto sawTheSequence = [&] {
+    const auto runs = sink.SizeRuns();
+    for (std::size_t i = 0; i + 2 < runs.size(); ++i) {
+      if (runs[i].first == hd && runs[i + 1].first == small && runs[i + 2].first == uhd && runs[i + 2].second >= 2) {
+        return true;
+      }
+    }
+    return false;
+  };
+  const RunEnd end = ReceiveThroughHost(folder, Id(sender), &sink, sawTheSequence);
+  ExpectCleanEnd(end, folder);
+  EXPECT_TRUE(sawTheSequence()) << ::testing::PrintToString(sink.SizeRuns());
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+  // A size change never goes past a segment (the host would refuse that
+  // record), and the pool does not keep growing: segments too small for the
+  // new size are set aside, not multiplied.
+  EXPECT_GT(end.segmentsWhileRunning, 0);
+  EXPECT_LE(end.segmentsWhileRunning, 24);
+}
+
+// --- A host that misbehaves on its sockets --------------------------------
+
+// The host made of plain pieces, for input the reference host never sends:
+// it listens, starts the runner on the port, keeps the raw connection (with a
+// request dispatcher on it) and reads a source's queue itself, decoding each
+// record with the reference host's reader, so that it can write anything back.
+//
+// Threads: the dispatcher's receive thread runs the handlers (queue
+// announcements, notifications); the tap thread reads records and returns
+// tokens. Lock: lock_ guards port_, memoryBase_, states_, repeated_ and the
+// setting of decoder_; the only lock taken inside it is the decoder's segment
+// cache lock (Forget).
+class RawHost {
+ public:
+  explicit RawHost(const Folder& folder) : folder_(folder) {}
+  ~RawHost() { Shutdown(); }
+  RawHost(const RawHost&) = delete;
+  RawHost& operator=(const RawHost&) = delete;
+
+  bool Start() {
+    std::unique_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
+    if (!server) return false;
+    pmhost::ChildOptions child;
+    child.path = pmtest::BuiltPrograms().runner;
+    child.args = {"--module", pmtest::BuiltPrograms().module, "--connect", std::to_string(server->GetPort())};
+    child.env = {{"NDI_LOOPBACK_DIR", folder_.Registry()}};
+    child.stderrPath = folder_.RunnerLog();
+    if (!runner_.Start(std::move(child))) return false;
+    std::unique_ptr<pm::ipc::Connection> accepted;
+    const auto deadline = std::chrono::steady_clock::now() + 20s;
+    while (!accepted && runner_.Running() && std::chrono::steady_clock::now() < deadline) {
+      accepted = server->AcceptConnection(200);
+    }
+    server->Stop();
+    if (!accepted) return false;
+    connection_ = std::shared_ptr<pm::ipc::Connection>(std::move(accepted));
+    dispatcher_ = std::make_shared<pm::RpcDispatcher>(connection_);
+    for (const std::string& command : pmhost::Session::NotificationCommands()) {
+      dispatcher_->RegisterHandler(command, [this, command](const json& message, json&) {
+        if (command != "pm::tsrc::update_connection_state") return;
+        std::lock_guard<std::mutex> guard(lock_);
+        states_.push_back(static_cast<int>(message.value("state", 0)));
+      });
+    }
+    dispatcher_->Start();
+    return true;
+  }
+
+  // Starts the source and waits for its queue announcement; then connects
+  // the tap to the queue and starts reading.
+  bool StartSource(const std::string& id, pmhost::FrameSink* sink) {
+    dispatcher_->RegisterHandler(id + "::start_queue", [this](const json& message, json&) {
+      std::lock_guard<std::mutex> guard(lock_);
+      port_ = static_cast<int>(message.value("port", 0));
+      memoryBase_ = message.value("memoryBase", "");
+    });
+    dispatcher_->RegisterHandler(id + "::delete_memory", [this](const json& message, json&) {
+      std::lock_guard<std::mutex> guard(lock_);
+      if (decoder_) decoder_->Forget(static_cast<std::uint32_t>(message.value("unique_id", 0u)));
+    });
+    if (!Request("pm::tsrc::start_source", {{"unique_id", id}, {"config", json::object()}})) return false;
+    if (!pmtest::WaitFor([&] { return Port() > 0; }, kArrivalLimit)) return false;
+    // The decoder exists before the tap connects: delete_memory may follow.
+    {
+      std::lock_guard<std::mutex> guard(lock_);
+      decoder_ = std::make_unique<pmhost::QueueReader>(id, memoryBase_, sink);
+    }
+    queue_ = pm::ipc::Connection::Open(Port());
+    if (!queue_) return false;
+    tapRunning_ = true;
+    tap_ = std::thread([this] { Tap(); });
+    return true;
+  }
+
+  std::optional<json> Request(const std::string& command, json payload, std::int64_t timeoutMs = 10000) {
+    auto reply = std::make_shared<std::promise<json>>();
+    std::future<json> future = reply->get_future();
+    if (!dispatcher_->RpcRequest(command, payload, timeoutMs, [reply](const json& m) { reply->set_value(m); })) {
+      return std::nullopt;
+    }
+    // A connection that ends ends the wait too: the task ends itself after the
+    // last stop_source, sometimes before its reply leaves.
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs + 2000);
+    while (future.wait_for(20ms) != std::future_status::ready) {
+      if (dispatcher_->Ended() || std::chrono::steady_clock::now() >= deadline) return std::nullopt;
+    }
+    json message = future.get();
+    if (message.value("pm::error", "") == "timeout") return std::nullopt;
+    return message;
+  }
+
+  // Bytes straight onto the runner's connection, beside the dispatcher's.
+  bool WriteRaw(const std::string& bytes) {
+    pm::BufferList list;
+    list.emplace_back(bytes.data(), static_cast<std::uint32_t>(bytes.size()));
+    return connection_->Send(std::move(list));
+  }
+  static std::string Prefix(std::uint32_t length) {
+    std::string bytes(4, '\0');
+    for (int i = 0; i < 4; ++i) bytes[static_cast<std::size_t>(i)] = static_cast<char>((length >> (8 * i)) & 0xFF);
+    return bytes;
+  }
+  static std::string Frame(const std::string& text) {
+    return Prefix(static_cast<std::uint32_t>(text.size())) + text;
+  }
+  // Ends our side of the runner's connection.
+  void CloseRunnerConnection() { connection_->Close(); }
+
+  // Writes tokens onto the queue connection, beside the tap's returns.
+  bool WriteTokens(const std::vector<std::uint32_t>& tokens) {
+    std::vector<std::uint8_t> bytes;
+    for (std::uint32_t t : tokens) {
+      for (int i = 0; i < 4; ++i) bytes.push_back(static_cast<std::uint8_t>(t >> (8 * i)));
+    }
+    pm::BufferList list;
+    list.emplace_back(bytes.data(), static_cast<std::uint32_t>(bytes.size()));
+    return queue_->Send(std::move(list));
+  }
+  // The next `count` tokens the tap returns are returned twice, back to back.
+  void RepeatTokens(int count) { repeat_ = count; }
+  std::vector<std::uint32_t> Repeated() {
+    std::lock_guard<std::mutex> guard(lock_);
+    return repeated_;
+  }
+  // The tap saw the task end the queue connection.
+  bool QueueEnded() const { return queueEnded_.load(); }
+
+  int Port() {
+    std::lock_guard<std::mutex> guard(lock_);
+    return port_;
+  }
+  std::string MemoryBase() {
+    std::lock_guard<std::mutex> guard(lock_);
+    return memoryBase_;
+  }
+  bool Receiving() {
+    std::lock_guard<std::mutex> guard(lock_);
+    return !states_.empty() && states_.back() == 2;
+  }
+  pid_t RunnerPid() const { return runner_.Pid(); }
+  std::optional<int> WaitRunner(std::chrono::milliseconds limit) { return runner_.Wait(limit); }
+
+  // Stops the tap and the dispatcher; the runner, if it still runs, is
+  // killed by its ChildProcess.
+  void Shutdown() {
+    tapRunning_ = false;
+    if (queue_) queue_->Close();
+    if (tap_.joinable()) tap_.join();
+    if (dispatcher_) dispatcher_->Stop();
+  }
+
+ private:
+  void Tap() {
+    std::uint8_t wire[pmhost::kWireRecordBytes];
+    while (tapRunning_) {
+      if (!queue_->ReadFromSocket(wire, sizeof wire, 250)) {
+        if (!queue_->IsConnected()) break;
+        continue;
+      }
+      std::uint32_t token = 0;
+      if (!decoder_->Handle(wire, sizeof wire, &token)) continue;
+      std::vector<std::uint32_t> back = {token};
+      if (repeat_.load() > 0) {
+        --repeat_;
+        back.push_back(token);
+        std::lock_guard<std::mutex> guard(lock_);
+        repeated_.push_back(token);
+      }
+      if (!WriteTokens(back) && !queue_->IsConnected()) break;
+    }
+    queueEnded_ = !queue_->IsConnected();
+  }
+
+  const Folder& folder_;
+  // Last to go of what the threads use: the runner.
+  pmhost::ChildProcess runner_;
+  std::shared_ptr<pm::ipc::Connection> connection_;
+  std::shared_ptr<pm::RpcDispatcher> dispatcher_;
+  // Set under lock_ before the tap starts (the tap then reads it without the
+  // lock: it never changes again); delete_memory reads it under lock_.
+  std::unique_ptr<pmhost::QueueReader> decoder_;
+  std::shared_ptr<pm::ipc::Connection> queue_;    // set before the tap starts
+  std::thread tap_;
+  std::atomic<bool> tapRunning_{false};
+  std::atomic<bool> queueEnded_{false};
+  std::atomic<int> repeat_{0};
+  std::mutex lock_;  // guards port_, memoryBase_, states_, repeated_, the setting of decoder_
+  int port_ = 0;
+  std::string memoryBase_;
+  std::vector<int> states_;
+  std::vector<std::uint32_t> repeated_;
+};
+
+const std::vector<std::string> kSmallSilentPictures = {"--pattern", "ramp",  "--width", "64",        "--height",
+                                                       "16",        "--fps", "30",      "--no-audio"};
+
+// Waits for `more` pictures beyond those already seen.
+bool MorePictures(const CheckingSink& sink, int more) {
+  const int target = sink.Pictures() + more;
+  return pmtest::WaitFor([&] { return sink.Pictures() >= target; }, kArrivalLimit);
+}
+
+TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTheRunnerInOrder) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Garbage", kSmallSilentPictures));
+  CheckingSink sink;
+  RawHost host(folder);
+  ASSERT_TRUE(host.Start()) << folder.ReadRunnerLog();
+  ASSERT_TRUE(host.StartSource(Id(sender), &sink)) << folder.ReadRunnerLog();
+  ASSERT_TRUE(MorePictures(sink, 5)) << folder.ReadRunnerLog();
+  const std::string base = host.MemoryBase();
+  ASSERT_GT(SegmentsOf({base}), 0);
+
+  // Texts that are not requests: skipped, the connection stays.
+  std::string binary(300, '\0');
+  for (std::size_t i = 0; i < binary.size(); ++i) binary[i] = static_cast<char>(i * 37 + 11);
+  ASSERT_TRUE(host.WriteRaw(RawHost::Frame("this is not json") + RawHost::Frame("") + RawHost::Frame("[1,2,3]") +
+                            RawHost::Frame("\"a string\"") + RawHost::Frame("{\"pm::command\":") + RawHost::Frame(binary) +
+                            RawHost::Frame("{\"pm::response\":true,\"pm::unique_id\":999999}") +
+                            RawHost::Frame("{\"pm::command\":42,\"pm::unique_id\":\"x\"}")));
+  // A frame of exactly the largest length is taken in whole.
+  const std::string filler = "{\"pm::command\":\"pm::tsrc::no_such\",\"pm::unique_id\":4000000000,\"pad\":\"";
+  std::string largest = filler + std::string(pm::ipc::kMaxMessageBytes - filler.size() - 2, 'x') + "\"}";
+  ASSERT_EQ(largest.size(), pm::ipc::kMaxMessageBytes);
+  ASSERT_TRUE(host.WriteRaw(RawHost::Frame(largest)));
+  // The connection still carries requests, and the source still runs.
+  const auto answer = host.Request("pm::tsrc::handle_shot_event", {{"unique_id", Id(sender)}, {"event", "X"}});
+  ASSERT_TRUE(answer.has_value()) << folder.ReadRunnerLog();
+  EXPECT_EQ(answer->value("pm::error", ""), "");
+  EXPECT_TRUE(MorePictures(sink, 10));
+
+  // A length over the limit: the runner drops the connection and, with no
+  // other connection left, ends in order, its segments gone.
+  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxMessageBytes + 1) + "{}"));
+  EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, 5s));
+  EXPECT_EQ(SegmentsOf({base}), 0);
+  host.Shutdown();
+  const std::string log = folder.ReadRunnerLog();
+  EXPECT_NE(log.find("message is not JSON, skipped: 'this is not json'"), std::string::npos) << log;
+  EXPECT_NE(log.find("message is not a JSON object, skipped"), std::string::npos) << log;
+  EXPECT_NE(log.find("frame of 524289 bytes exceeds 524288, closing the connection"), std::string::npos) << log;
+  EXPECT_NE(log.find("pm-runner: done"), std::string::npos) << log;
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+}
+
+TEST_F(InputFaults, AHostLeavingInsideAFrameMidStreamEndsTheRunnerInOrder) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Cut short", kSmallSilentPictures));
+  CheckingSink sink;
+  RawHost host(folder);
+  ASSERT_TRUE(host.Start()) << folder.ReadRunnerLog();
+  ASSERT_TRUE(host.StartSource(Id(sender), &sink)) << folder.ReadRunnerLog();
+  ASSERT_TRUE(MorePictures(sink, 5)) << folder.ReadRunnerLog();
+  const std::string base = host.MemoryBase();
+
+  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(1000) + "{\"pm::command\":\"pm::tsrc::stop_source\""));
+  host.CloseRunnerConnection();
+  EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, 5s));
+  EXPECT_EQ(SegmentsOf({base}), 0);
+  host.Shutdown();
+  const std::string log = folder.ReadRunnerLog();
+  EXPECT_NE(log.find("connection ended inside a frame"), std::string::npos) << log;
+  EXPECT_NE(log.find("pm-runner: done"), std::string::npos) << log;
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+}
+
+TEST_F(InputFaults, UnknownAndRepeatedTokensAreLoggedAndPicturesKeepFlowingIntact) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Tokens", kSmallSilentPictures));
+  CheckingSink sink;
+  RawHost host(folder);
+  ASSERT_TRUE(host.Start()) << folder.ReadRunnerLog();
+  ASSERT_TRUE(host.StartSource(Id(sender), &sink)) << folder.ReadRunnerLog();
+  ASSERT_TRUE(MorePictures(sink, 5)) << folder.ReadRunnerLog();
+  const std::string base = host.MemoryBase();
+  const auto before = pmtest::UsageOf(host.RunnerPid());
+  ASSERT_TRUE(before.has_value());
+
+  // Never issued: 0 (no segment has it), far beyond the pool, the top bit,
+  // and the queue's wake word, which belongs on the producer's own pair only.
+  const std::vector<std::uint32_t> unknown = {0u, 1000000u, 0x7FFFFFFFu, 0x80000000u, 0xFFFFFFFEu, 0xFFFFFFFFu};
+  for (int round = 0; round < 3; ++round) {
+    ASSERT_TRUE(host.WriteTokens(unknown));
+    ASSERT_TRUE(MorePictures(sink, 3));
+  }
+  // Returned twice in a row: the second return finds nothing owed. (A second
+  // return that came after the segment was sent again would give it up
+  // early; the tokens are segment ids, so no producer could tell.)
+  host.RepeatTokens(3);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return host.Repeated().size() == 3; }, kArrivalLimit));
+  EXPECT_TRUE(MorePictures(sink, 10));
+
+  const std::string log = folder.ReadRunnerLog();
+  for (const char* line : {"Token (0) not found.", "Token (1000000) not found.", "Token (2147483647) not found.",
+                           "Token (-2147483648) not found.", "Token (-2) not found.", "Token (-1) not found."}) {
+    EXPECT_EQ(Occurrences(log, line), 3u) << line << "\n" << log;
+  }
+  for (std::uint32_t token : host.Repeated()) {
+    EXPECT_GE(Occurrences(log, "Token (" + std::to_string(token) + ") not found."), 1u) << token << "\n" << log;
+  }
+  // Nothing was lost in the runner along the way.
+  const auto after = pmtest::UsageOf(host.RunnerPid());
+  ASSERT_TRUE(after.has_value());
+  EXPECT_EQ(after->descriptors, before->descriptors);
+  EXPECT_EQ(after->threads, before->threads);
+
+  host.Request("pm::tsrc::stop_source", {{"unique_id", Id(sender)}});
+  EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_EQ(SegmentsOf({base}), 0);
+  host.Shutdown();
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+}
+
+TEST_F(InputFaults, ASecondQueueConnectionIsRefusedAndTheFirstKeepsItsPictures) {
+  Folder folder;
+  Sender sender;
+  ASSERT_TRUE(sender.Start(folder, "Two readers", kSmallSilentPictures));
+  CheckingSink sink;
+  RawHost host(folder);
+  ASSERT_TRUE(host.Start()) << folder.ReadRunnerLog();
+  ASSERT_TRUE(host.StartSource(Id(sender), &sink)) << folder.ReadRunnerLog();
+  ASSERT_TRUE(MorePictures(sink, 5)) << folder.ReadRunnerLog();
+  const std::string base = host.MemoryBase();
+  const auto before = pmtest::UsageOf(host.RunnerPid());
+  ASSERT_TRUE(before.has_value());
+
+  // The queue's server stopped listening once the first reader came: a
+  // second one is refused, or if the system still lets it in, it is never
+  // given a record.
+  for (int attempt = 0; attempt < 5; ++attempt) {
+    std::unique_ptr<pm::ipc::Connection> second = pm::ipc::Connection::Open(host.Port());
+    if (!second) continue;
+    std::uint8_t wire[pmhost::kWireRecordBytes];
+    EXPECT_FALSE(second->ReadFromSocket(wire, sizeof wire, 300)) << "a second reader was given a record";
+    second->Close();
+  }
+  EXPECT_TRUE(MorePictures(sink, 10));
+  const auto after = pmtest::UsageOf(host.RunnerPid());
+  ASSERT_TRUE(after.has_value());
+  EXPECT_EQ(after->descriptors, before->descriptors);
+
+  host.Request("pm::tsrc::stop_source", {{"unique_id", Id(sender)}});
+  EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_EQ(SegmentsOf({base}), 0);
+  host.Shutdown();
+  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+}
+
+}  // namespace
