@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <set>
 #include <fstream>
 #include <sstream>
 
@@ -18,7 +19,7 @@ using nlohmann::json;
 using namespace std::chrono_literals;
 
 const Programs& BuiltPrograms() {
-  static const Programs programs{PM_RUNNER_PATH, PM_MODULE_PATH, PM_TESTSRC_PATH};
+  static const Programs programs{PM_RUNNER_PATH, PM_MODULE_PATH, PM_TESTSRC_PATH, PM_HOST_PATH};
   return programs;
 }
 
@@ -130,5 +131,21 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
 }
 
 std::optional<ProcessUsage> OwnUsage() { return UsageAt("/proc/self"); }
+
+std::vector<std::string> SharedMemoryMappedBy(pid_t pid) {
+  std::set<std::string> names;
+  std::ifstream maps("/proc/" + std::to_string(pid) + "/maps");
+  std::string line;
+  const std::string folder = "/dev/shm/";
+  while (std::getline(maps, line)) {
+    const std::size_t at = line.find(folder);
+    if (at == std::string::npos) continue;
+    std::string name = line.substr(at + folder.size());
+    const std::size_t deleted = name.find(" (deleted)");
+    if (deleted != std::string::npos) name.resize(deleted);
+    names.insert(name);
+  }
+  return {names.begin(), names.end()};
+}
 
 }  // namespace pmtest

@@ -25,6 +25,7 @@ struct Programs {
   std::string runner;
   std::string module;
   std::string testsrc;
+  std::string host;  // the pm-host program
 };
 const Programs& BuiltPrograms();
 
@@ -80,5 +81,9 @@ struct ProcessUsage {
 std::optional<ProcessUsage> UsageOf(pid_t pid);
 // Of this process.
 std::optional<ProcessUsage> OwnUsage();
+
+// The /dev/shm entries a live process has mapped (names without the folder,
+// each once), from /proc/PID/maps; entries already unlinked are included.
+std::vector<std::string> SharedMemoryMappedBy(pid_t pid);
 
 }  // namespace pmtest

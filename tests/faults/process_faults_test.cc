@@ -1,0 +1,737 @@
+// Faults of the process tree: a host that stops returning tokens, closes its
+// queue connection or dies; senders that die mid-frame and come back; long
+// start/stop cycles. Each case has its own registry folder, its own senders
+// and its own runner, and checks that nothing was lost or leaked: the
+// runner's descriptors and threads come back to their level, its resident
+// memory stays bounded, this process gets its descriptors back, and nothing
+// of the run's memory bases is left in /dev/shm.
+//
+// The runner ends itself after the last stop_source when no discovery runs,
+// so cases that stop and start a source keep discovery running (and the
+// discovery cycles keep a source running) to hold the runner up.
+#include <gtest/gtest.h>
+
+#include <dirent.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstdio>
+#include <fstream>
+#include <iterator>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <random>
+#include <set>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "e2e_support.h"
+#include "pm-host/checks.h"
+#include "pm-host/host.h"
+#include "pm-host/receive.h"
+#include "pm/runtime/json.h"
+#include "support/wait.h"
+
+namespace {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+using pmtest::Folder;
+using pmtest::ProcessUsage;
+using pmtest::Sender;
+using pmtest::SegmentsOf;
+
+using Clock = std::chrono::steady_clock;
+
+double SecondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
+
+// What the task reported to the host, by source id. Record runs on the
+// dispatcher's receive thread; the rest on the test's thread.
+class Reports {
+ public:
+  void Record(const std::string& command, const json& message) {
+    const std::string id = pmjson::FieldAsString(message, "unique_id", "");
+    std::lock_guard<std::mutex> guard(lock_);
+    if (command == "pm::tsrc::update_connection_state") {
+      states_[id].push_back(static_cast<int>(pmjson::FieldAsInteger(message, "state", 0)));
+    } else if (command == "pm::tsrc::source_available") {
+      ++announced_[id];
+    }
+  }
+  // How many connection states `id` has reported so far.
+  std::size_t StateCount(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = states_.find(id);
+    return found == states_.end() ? 0 : found->second.size();
+  }
+  // Whether `id` reported `state` after its first `from` reports.
+  bool ReportedSince(const std::string& id, std::size_t from, int state) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = states_.find(id);
+    if (found == states_.end() || found->second.size() <= from) return false;
+    return std::find(found->second.begin() + static_cast<long>(from), found->second.end(), state) !=
+           found->second.end();
+  }
+  std::vector<int> States(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = states_.find(id);
+    return found == states_.end() ? std::vector<int>{} : found->second;
+  }
+  // How often discovery announced `id`.
+  int Announced(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = announced_.find(id);
+    return found == announced_.end() ? 0 : found->second;
+  }
+
+ private:
+  mutable std::mutex lock_;  // guards states_, announced_
+  std::map<std::string, std::vector<int>> states_;
+  std::map<std::string, int> announced_;
+};
+
+// Counts each source's pictures and checks ramp pictures (intact, frame
+// numbers rising). While shut, the queue's reader thread waits inside OnVideo
+// with the picture it brought, so neither that token nor any record queued
+// behind it goes back to the task. Called on the queues' reader threads; open
+// it before the host stops (stopping joins those threads).
+class GateSink : public pmhost::FrameSink {
+ public:
+  explicit GateSink(bool rampPictures = false) : rampPictures_(rampPictures) {}
+
+  void OnVideo(const std::string& id, const pmhost::VideoFrame& frame) override {
+    std::int64_t number = -1;
+    const std::string damage = rampPictures_ ? pmhost::CheckRampPicture(frame, &number) : std::string();
+    std::unique_lock<std::mutex> hold(lock_);
+    ++videos_[id];
+    if (!damage.empty() && firstDamage_.empty()) firstDamage_ = damage;
+    if (!damage.empty()) ++damaged_;
+    if (rampPictures_) {
+      std::int64_t& last = lastNumber_[id];
+      if (videos_[id] > 1 && number <= last) ++backwards_;
+      last = number;
+    }
+    ++holding_;
+    changed_.notify_all();
+    changed_.wait(hold, [this] { return open_; });
+    --holding_;
+  }
+  void OnAudio(const std::string&, const pmhost::AudioFrame&) override {}
+
+  void Shut() {
+    std::lock_guard<std::mutex> guard(lock_);
+    open_ = false;
+  }
+  void Open() {
+    {
+      std::lock_guard<std::mutex> guard(lock_);
+      open_ = true;
+    }
+    changed_.notify_all();
+  }
+  // A reader thread is waiting in the shut gate.
+  bool Holding() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return holding_ > 0 && !open_;
+  }
+  int Videos(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = videos_.find(id);
+    return found == videos_.end() ? 0 : found->second;
+  }
+  int Damaged() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return damaged_;
+  }
+  int Backwards() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return backwards_;
+  }
+  std::string FirstDamage() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return firstDamage_;
+  }
+
+ private:
+  const bool rampPictures_;
+  mutable std::mutex lock_;  // guards every field below
+  std::condition_variable changed_;
+  bool open_ = true;
+  int holding_ = 0;
+  std::map<std::string, int> videos_;
+  std::map<std::string, std::int64_t> lastNumber_;
+  int damaged_ = 0;
+  int backwards_ = 0;
+  std::string firstDamage_;
+};
+
+// One case's process tree: a registry folder, the host in this process with
+// its runner, and what the task reported. Senders made afterwards (in the
+// folder) go first. The sink must outlive the tree.
+struct Tree {
+  explicit Tree(pmhost::FrameSink* sink)
+      : host(pmtest::HostOptionsFor(folder), [this](const std::string& c, const json& m) { reports.Record(c, m); },
+             sink) {}
+  pmhost::Session& Session() { return host.GetSession(); }
+  pid_t Runner() const { return host.RunnerPid(); }
+  std::string Log() const { return folder.ReadRunnerLog(); }
+
+  Folder folder;
+  Reports reports;
+  pmhost::Host host;
+};
+
+// The runner's level: descriptors and threads at their lowest over a few
+// looks (a descriptor the runtime opens for a moment, say to list the
+// registry, is not part of it).
+std::optional<ProcessUsage> LevelOf(pid_t pid) {
+  std::optional<ProcessUsage> level;
+  for (int i = 0; i < 5; ++i) {
+    const std::optional<ProcessUsage> now = pmtest::UsageOf(pid);
+    if (!now) return std::nullopt;
+    if (!level) {
+      level = now;
+    } else {
+      level->descriptors = std::min(level->descriptors, now->descriptors);
+      level->threads = std::min(level->threads, now->threads);
+      level->residentKiB = std::max(level->residentKiB, now->residentKiB);
+    }
+    std::this_thread::sleep_for(10ms);
+  }
+  return level;
+}
+
+// Threads end and descriptors close a moment after the reply that stopped
+// them: waits for the level, then expects it exactly (no growth, and nothing
+// closed that should still be open).
+void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what) {
+  std::optional<ProcessUsage> now;
+  pmtest::WaitFor([&] {
+    now = pmtest::UsageOf(pid);
+    return now && now->descriptors == level.descriptors && now->threads == level.threads;
+  }, 10s);
+  ASSERT_TRUE(now.has_value()) << what << ": the process is gone";
+  EXPECT_EQ(now->descriptors, level.descriptors) << what << ": descriptors";
+  EXPECT_EQ(now->threads, level.threads) << what << ": threads";
+}
+
+// This process's own descriptors (the queue readers' connections, the
+// children's pipes) back where they were before the case.
+void ExpectOwnDescriptorsBackTo(const ProcessUsage& before) {
+  std::optional<ProcessUsage> now;
+  pmtest::WaitFor([&] {
+    now = pmtest::OwnUsage();
+    return now && now->descriptors == before.descriptors;
+  }, 5s);
+  ASSERT_TRUE(now.has_value());
+  EXPECT_EQ(now->descriptors, before.descriptors) << "descriptors of the test process";
+}
+
+int CountInText(const std::string& text, const std::string& what) {
+  int count = 0;
+  for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++count;
+  return count;
+}
+
+// Starts the host and discovery and waits until every sender is announced.
+void StartWithDiscovery(Tree& tree, const std::vector<std::string>& ids) {
+  ASSERT_TRUE(tree.host.Start());
+  ASSERT_TRUE(tree.Session().StartDiscovery());
+  for (const std::string& id : ids) {
+    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > 0; }, 15s)) << id << " never announced";
+  }
+}
+
+// Starts the source until a picture arrives, then stops it: whatever the
+// runtime makes once and keeps is then made before the level is taken.
+void WarmUp(Tree& tree, GateSink& sink, const std::string& id) {
+  const int before = sink.Videos(id);
+  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > before; }, 15s)) << tree.Log();
+  ASSERT_TRUE(tree.Session().StopSource(id));
+}
+
+// The orderly end of a tree whose only remaining task work is discovery
+// (stop_discovery alone does not end the task): stop it, close the
+// connection, and the runner exits 0 having removed every segment of every
+// memory base of the run itself.
+void EndDiscoveryAndExpectOrderlyExit(Tree& tree) {
+  const std::vector<std::string> bases = tree.Session().MemoryBases();
+  EXPECT_TRUE(tree.Session().StopDiscovery());
+  EXPECT_EQ(tree.host.Stop(), 0) << tree.Log();
+  EXPECT_EQ(SegmentsOf(bases), 0);
+  EXPECT_EQ(tree.host.RemovedSegments(), 0) << "an orderly runner removes its own segments";
+}
+
+std::string QueueBase(Tree& tree, const std::string& id) {
+  std::string base;
+  pmtest::WaitFor([&] {
+    const auto queue = tree.Session().Queue(id);
+    if (queue) base = queue->MemoryBase();
+    return !base.empty();
+  }, 10s);
+  return base;
+}
+
+TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsUntilItReadsAgain) {
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    // 256x144 UYVY: 72 KiB a picture, so that a copy kept per refused frame
+    // would show in the runner's resident memory within a second.
+    constexpr long kPictureKiB = 256 * 144 * 2 / 1024;
+    GateSink sink(/*rampPictures=*/true);
+    Tree tree(&sink);
+    Sender sender;
+    ASSERT_TRUE(sender.Start(tree.folder, "Stall", {"--width", "256", "--height", "144", "--fps", "120",
+                                                    "--pattern", "ramp", "--no-audio"}));
+    const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+    StartWithDiscovery(tree, {id});
+    WarmUp(tree, sink, id);
+    const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
+    ASSERT_TRUE(level);
+    const int warmUpVideos = sink.Videos(id);
+
+    sink.Shut();
+    ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+    const std::string base = QueueBase(tree, id);
+    ASSERT_FALSE(base.empty());
+    ASSERT_TRUE(pmtest::WaitFor([&] {
+      return SegmentsOf({base}) >= 240 && tree.Log().find("video well ran dry") != std::string::npos;
+    }, 20s)) << SegmentsOf({base}) << " segments\n" << tree.Log();
+    EXPECT_TRUE(sink.Holding());
+    const std::optional<ProcessUsage> dry = pmtest::UsageOf(tree.Runner());
+    ASSERT_TRUE(dry);
+
+    // A further second of pictures, every one refused: no new segment, and
+    // nothing of them kept.
+    const int refused = CountInText(tree.Log(), "video well ran dry");
+    ASSERT_TRUE(pmtest::WaitFor([&] { return CountInText(tree.Log(), "video well ran dry") >= refused + 120; }, 20s));
+    EXPECT_EQ(SegmentsOf({base}), 240);
+    const std::optional<ProcessUsage> later = pmtest::UsageOf(tree.Runner());
+    ASSERT_TRUE(later);
+    // 120 refused pictures kept would be 8.4 MiB.
+    EXPECT_LT(later->residentKiB - dry->residentKiB, 2 * 1024) << "grew while every picture was refused";
+    // Bounded by the pool: the level, the 240 segments it touched, and 16 MiB
+    // for the runtime's bounded frame queues and the allocator.
+    EXPECT_LT(later->residentKiB, level->residentKiB + 240 * kPictureKiB + 16 * 1024);
+    EXPECT_EQ(sink.Videos(id), warmUpVideos + 1) << "only the held picture reached the host";
+
+    // Reading again: the 240 queued pictures, then new ones through the same
+    // pool, intact and in order.
+    sink.Open();
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= warmUpVideos + 240 + 60; }, 20s))
+        << sink.Videos(id) - warmUpVideos << " pictures after the release";
+    const int dryAfterRecovery = CountInText(tree.Log(), "video well ran dry");
+    const int recovered = sink.Videos(id);
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= recovered + 60; }, 20s));
+    EXPECT_EQ(CountInText(tree.Log(), "video well ran dry"), dryAfterRecovery) << "still dry while the host reads";
+    EXPECT_EQ(SegmentsOf({base}), 240) << "segments are reused, not made anew";
+    EXPECT_EQ(sink.Damaged(), 0) << sink.FirstDamage();
+    EXPECT_EQ(sink.Backwards(), 0);
+
+    ASSERT_TRUE(tree.Session().StopSource(id));
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
+    ExpectBackAtLevel(tree.Runner(), *level, "after stop_source");
+    EndDiscoveryAndExpectOrderlyExit(tree);
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedAreReleased) {
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    GateSink sink;
+    Tree tree(&sink);
+    Sender sender;
+    ASSERT_TRUE(sender.Start(tree.folder, "Drop", {"--width", "64", "--height", "16", "--fps", "60", "--no-audio"}));
+    const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+    StartWithDiscovery(tree, {id});
+    WarmUp(tree, sink, id);
+    const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
+    ASSERT_TRUE(level);
+
+    // The host holds one picture and reads nothing more: every record sent
+    // from now on is owed.
+    sink.Shut();
+    ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+    const std::string base = QueueBase(tree, id);
+    ASSERT_FALSE(base.empty());
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Holding() && SegmentsOf({base}) >= 6; }, 15s)) << tree.Log();
+    const int heldSegments = SegmentsOf({base});
+
+    // The host closes its end while the reader thread still holds the
+    // picture (Stop joins that thread, so it runs beside the test).
+    const std::shared_ptr<pmhost::QueueReader> queue = tree.Session().Queue(id);
+    ASSERT_TRUE(queue);
+    std::thread closer([queue] { queue->Stop(); });
+    const bool dropped = pmtest::WaitFor(
+        [&] { return tree.Log().find("pm::ipc:queue::Producer : Reader gone") != std::string::npos; }, 10s);
+    sink.Open();
+    closer.join();
+    ASSERT_TRUE(dropped) << tree.Log();
+    const std::string log = tree.Log();
+    std::size_t owed = 0, released = 0;
+    const std::size_t line = log.find("pm::ipc:queue::Producer : Reader gone");
+    ASSERT_EQ(std::sscanf(log.c_str() + line, "pm::ipc:queue::Producer : Reader gone, %zu owed tokens given up, %zu released.",
+                          &owed, &released),
+              2)
+        << log.substr(line, 120);
+    EXPECT_GE(owed, static_cast<std::size_t>(heldSegments)) << "every held segment's token was owed";
+    EXPECT_EQ(released, owed) << "no other reader owes them";
+
+    // Without a reader every record is released as it is sent: the pool does
+    // not grow and never runs dry. (Time must pass here: 30 pictures at 60 fps.)
+    const int pool = SegmentsOf({base});
+    std::this_thread::sleep_for(500ms);
+    EXPECT_EQ(SegmentsOf({base}), pool);
+    EXPECT_EQ(tree.Log().find("video well ran dry"), std::string::npos);
+
+    // The runner still answers, and the source's loop still runs: the tally
+    // reaches the sender.
+    EXPECT_TRUE(tree.Session().ShotEvent(id, "TALLY_PREVIEW_ON").has_value());
+    EXPECT_TRUE(sender.WaitFor("tally", [](const json& e) { return e.value("preview", false); }));
+    EXPECT_EQ(tree.reports.States(id).back(), 2);
+
+    ASSERT_TRUE(tree.Session().StopSource(id));
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
+    ExpectBackAtLevel(tree.Runner(), *level, "after stop_source");
+    EndDiscoveryAndExpectOrderlyExit(tree);
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+// Makes this process the reaper of orphaned descendants for its life, so
+// that a runner whose host was killed becomes our child; reaps (killing it
+// first when it still runs) whatever pid it was told to watch.
+class Subreaper {
+ public:
+  Subreaper() { enabled_ = ::prctl(PR_SET_CHILD_SUBREAPER, 1) == 0; }
+  ~Subreaper() {
+    if (watched_ > 0 && !reaped_) {
+      ::kill(watched_, SIGKILL);
+      Reap(5s);
+    }
+    ::prctl(PR_SET_CHILD_SUBREAPER, 0);
+  }
+  Subreaper(const Subreaper&) = delete;
+  Subreaper& operator=(const Subreaper&) = delete;
+  bool Enabled() const { return enabled_; }
+  void Watch(pid_t pid) { watched_ = pid; }
+  // The watched process's wait status once it ended and was reaped by us.
+  std::optional<int> Reap(std::chrono::milliseconds limit) {
+    std::optional<int> status;
+    pmtest::WaitFor([&] {
+      int s = 0;
+      if (::waitpid(watched_, &s, WNOHANG) == watched_) status = s;
+      return status.has_value();
+    }, limit);
+    reaped_ = status.has_value();
+    return status;
+  }
+
+ private:
+  bool enabled_ = false;
+  pid_t watched_ = -1;
+  bool reaped_ = false;
+};
+
+// The children of `parent` whose command name is `name`, from /proc.
+std::vector<pid_t> ChildrenNamed(pid_t parent, const std::string& name) {
+  std::vector<pid_t> found;
+  DIR* proc = ::opendir("/proc");
+  if (proc == nullptr) return found;
+  while (const dirent* entry = ::readdir(proc)) {
+    const pid_t pid = static_cast<pid_t>(std::atoi(entry->d_name));
+    if (pid <= 0) continue;
+    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    const std::size_t open = text.find('('), close = text.rfind(')');
+    if (open == std::string::npos || close == std::string::npos) continue;
+    std::istringstream rest(text.substr(close + 1));
+    char state = 0;
+    pid_t ppid = 0;
+    rest >> state >> ppid;
+    if (ppid == parent && text.substr(open + 1, close - open - 1) == name) found.push_back(pid);
+  }
+  ::closedir(proc);
+  return found;
+}
+
+TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm) {
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    Subreaper reaper;
+    ASSERT_TRUE(reaper.Enabled());
+    Folder folder;
+    Sender sender;
+    ASSERT_TRUE(sender.Start(folder, "Orphan", {"--width", "64", "--height", "16", "--fps", "60", "--no-audio"}));
+
+    // `pm-host receive` as its own process, with its runner under it.
+    std::mutex lock;  // guards lines
+    std::vector<std::string> lines;
+    pmhost::ChildProcess host;
+    pmhost::ChildOptions o;
+    o.path = pmtest::BuiltPrograms().host;
+    o.args = {"--runner", pmtest::BuiltPrograms().runner, "--module", pmtest::BuiltPrograms().module,
+              "--runner-log", folder.RunnerLog(), "receive", sender.Name(), "--seconds", "60"};
+    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+    o.captureStdout = true;
+    o.onLine = [&](const std::string& line) {
+      std::lock_guard<std::mutex> guard(lock);
+      lines.push_back(line);
+    };
+    ASSERT_TRUE(host.Start(std::move(o)));
+    std::vector<pid_t> runners;
+    ASSERT_TRUE(pmtest::WaitFor([&] {
+      runners = ChildrenNamed(host.Pid(), "pm-runner");
+      return runners.size() == 1;
+    }, 10s));
+    const pid_t runner = runners[0];
+    reaper.Watch(runner);
+
+    // Pictures flow once the runner has segments mapped; their names are the
+    // queue's 22-character memory base followed by the segment id.
+    std::vector<std::string> mapped;
+    ASSERT_TRUE(pmtest::WaitFor([&] {
+      mapped = pmtest::SharedMemoryMappedBy(runner);
+      return !mapped.empty();
+    }, 15s)) << folder.ReadRunnerLog();
+    ASSERT_GT(mapped[0].size(), 22u) << mapped[0];
+    const std::string base = mapped[0].substr(0, 22);
+    ASSERT_TRUE(pmtest::WaitFor([&] {
+      std::lock_guard<std::mutex> guard(lock);
+      return std::any_of(lines.begin(), lines.end(), [](const std::string& l) {
+        return l.find("receiving") != std::string::npos && l.find(" 0 frames") == std::string::npos;
+      });
+    }, 15s)) << "pm-host never reported pictures";
+    ASSERT_GT(SegmentsOf({base}), 0);
+
+    const auto killed = Clock::now();
+    host.Signal(SIGKILL);
+    EXPECT_EQ(host.Wait(5s), std::optional<int>(128 + SIGKILL));
+    const std::optional<int> status = reaper.Reap(10s);
+    const double took = SecondsSince(killed);
+    ASSERT_TRUE(status.has_value()) << "the runner outlived its host\n" << folder.ReadRunnerLog();
+    EXPECT_LT(took, 5.0) << folder.ReadRunnerLog();
+    EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 0) << "wait status " << *status << "\n"
+                                                                 << folder.ReadRunnerLog();
+    EXPECT_EQ(SegmentsOf({base}), 0) << folder.ReadRunnerLog();
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyWaiting) {
+  // Four sources in one runner, each sender killed and restarted five times
+  // together: 20 kills and returns. A source notices a returned sender on
+  // its 5-second poll of the idle state, so 20 rounds one after another
+  // would take over 100 s; four at a time keep the same count in a quarter
+  // of that.
+  constexpr int kSenders = 4;
+  constexpr int kRounds = 5;
+  // 1080p at 30 fps: a 4 MB picture is on the socket a good part of each
+  // frame period, and every kill lands at a random point of one.
+  const std::vector<std::string> args = {"--width", "1920", "--height", "1080", "--fps", "30", "--no-audio"};
+  const unsigned seed = std::random_device{}();
+  SCOPED_TRACE("kill offsets seed " + std::to_string(seed));
+  std::mt19937 random(seed);
+  std::uniform_int_distribution<int> offsetUs(0, 33'333);
+
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    GateSink sink;
+    Tree tree(&sink);
+    std::vector<std::unique_ptr<Sender>> senders(kSenders);
+    std::vector<std::string> names, ids;
+    for (int i = 0; i < kSenders; ++i) {
+      senders[i] = std::make_unique<Sender>();
+      ASSERT_TRUE(senders[i]->Start(tree.folder, "Phoenix " + std::to_string(i), args));
+      names.push_back("Phoenix " + std::to_string(i));
+      ids.push_back(pmhost::kSourceIdPrefix + senders[i]->Name());
+    }
+    ASSERT_TRUE(tree.host.Start());
+    for (const std::string& id : ids) ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+    auto allReceivingSince = [&](const std::vector<std::size_t>& marks, const std::vector<int>& videos) {
+      for (int i = 0; i < kSenders; ++i) {
+        if (!tree.reports.ReportedSince(ids[i], marks[i], 2) || sink.Videos(ids[i]) <= videos[i]) return false;
+      }
+      return true;
+    };
+    std::vector<std::size_t> marks(kSenders, 0);
+    std::vector<int> videos(kSenders, 0);
+    ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, 20s)) << tree.Log();
+    const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
+    ASSERT_TRUE(level);
+
+    double goneCpu = 0, goneWall = 0;
+    std::vector<double> perRound;
+    long highestResident = level->residentKiB;
+    for (int round = 0; round < kRounds; ++round) {
+      SCOPED_TRACE("round " + std::to_string(round));
+      for (int i = 0; i < kSenders; ++i) marks[i] = tree.reports.StateCount(ids[i]);
+      for (auto& sender : senders) {
+        std::this_thread::sleep_for(std::chrono::microseconds(offsetUs(random)));
+        sender->Process().Signal(SIGKILL);
+      }
+      for (auto& sender : senders) ASSERT_TRUE(sender->Process().Wait(5s).has_value());
+      ASSERT_TRUE(pmtest::WaitFor([&] {
+        for (int i = 0; i < kSenders; ++i) {
+          if (!tree.reports.ReportedSince(ids[i], marks[i], 3)) return false;
+        }
+        return true;
+      }, 15s)) << "a source did not notice its sender's end";
+
+      // Every sender gone, every source idle: the runner must sleep. (Time
+      // must pass to measure it.)
+      const double cpuBefore = pmhost::ProcessCpuSeconds(tree.Runner());
+      const auto start = Clock::now();
+      std::this_thread::sleep_for(800ms);
+      const double cpu = pmhost::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
+      const double wall = SecondsSince(start);
+      goneCpu += cpu;
+      goneWall += wall;
+      perRound.push_back(cpu / wall);
+
+      for (int i = 0; i < kSenders; ++i) {
+        marks[i] = tree.reports.StateCount(ids[i]);
+        videos[i] = sink.Videos(ids[i]);
+        senders[i] = std::make_unique<Sender>();
+        ASSERT_TRUE(senders[i]->Start(tree.folder, names[i], args));
+      }
+      ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, 20s))
+          << "not every source came back\n" << tree.Log();
+      const std::optional<ProcessUsage> now = pmtest::UsageOf(tree.Runner());
+      ASSERT_TRUE(now);
+      highestResident = std::max(highestResident, now->residentKiB);
+    }
+    EXPECT_LT(goneCpu / goneWall, 0.05) << "runner CPU share while the senders were gone, by round: "
+                                        << ::testing::PrintToString(perRound);
+    std::printf("runner CPU while the senders were gone: %.2f%% of a core over %.1f s\n", 100 * goneCpu / goneWall,
+                goneWall);
+    ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round");
+    // Four sources' frame queues hold a few 4 MB pictures each; a picture
+    // kept per kill would be 80 MB.
+    EXPECT_LT(highestResident - level->residentKiB, 48 * 1024) << "resident KiB grew over the rounds";
+
+    const std::vector<std::string> bases = tree.Session().MemoryBases();
+    EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));
+    for (const std::string& id : ids) tree.Session().StopSource(id);
+    EXPECT_EQ(tree.host.WaitRunner(10s), std::optional<int>(0)) << tree.Log();
+    EXPECT_EQ(tree.host.Stop(), 0);
+    EXPECT_EQ(SegmentsOf(bases), 0);
+    senders.clear();
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryOrSegmentBehind) {
+  constexpr int kCycles = 1000;
+  constexpr int kWarmUpCycles = 10;
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    GateSink sink;
+    Tree tree(&sink);
+    Sender sender;
+    // Pictures often enough that some cycles stop a source that has started
+    // delivering.
+    ASSERT_TRUE(sender.Start(tree.folder, "Cycle", {"--width", "64", "--height", "16", "--fps", "120", "--no-audio"}));
+    const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+    StartWithDiscovery(tree, {id});
+    WarmUp(tree, sink, id);
+
+    std::optional<ProcessUsage> level, ownLevel;
+    const auto start = Clock::now();
+    for (int cycle = 0; cycle < kCycles; ++cycle) {
+      ASSERT_TRUE(tree.Session().StartSource(id, json::object())) << "cycle " << cycle << "\n" << tree.Log();
+      ASSERT_TRUE(tree.Session().StopSource(id)) << "cycle " << cycle << "\n" << tree.Log();
+      if (cycle + 1 == kWarmUpCycles) {
+        level = LevelOf(tree.Runner());
+        ownLevel = pmtest::OwnUsage();
+        ASSERT_TRUE(level && ownLevel);
+      }
+    }
+    const double seconds = SecondsSince(start);
+    std::printf("%d start_source/stop_source cycles: %.1f s (%.1f ms each), %d pictures\n", kCycles, seconds,
+                1000 * seconds / kCycles, sink.Videos(id));
+    ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
+    const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
+    ASSERT_TRUE(after);
+    // 4 MiB over 990 cycles is under one page (4 KiB) a cycle: a leaked
+    // thread stack page, picture or segment mapping per cycle shows; the
+    // allocator's own slack does not.
+    EXPECT_LT(after->residentKiB - level->residentKiB, 4 * 1024)
+        << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+    ExpectOwnDescriptorsBackTo(*ownLevel);
+    const std::vector<std::string> bases = tree.Session().MemoryBases();
+    EXPECT_EQ(bases.size(), static_cast<std::size_t>(kCycles + 1));
+    EXPECT_EQ(SegmentsOf(bases), 0);
+    EndDiscoveryAndExpectOrderlyExit(tree);
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrMemoryBehind) {
+  constexpr int kCycles = 200;
+  constexpr int kWarmUpCycles = 5;
+  const std::optional<ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  {
+    GateSink sink;
+    Tree tree(&sink);
+    Sender sender;
+    ASSERT_TRUE(sender.Start(tree.folder, "Scan", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+    const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+    StartWithDiscovery(tree, {id});
+    // The source keeps the runner up while discovery comes and goes.
+    ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, 15s));
+    ASSERT_TRUE(tree.Session().StopDiscovery());
+
+    std::optional<ProcessUsage> level;
+    const auto start = Clock::now();
+    for (int cycle = 0; cycle < kCycles; ++cycle) {
+      ASSERT_TRUE(tree.Session().StartDiscovery()) << "cycle " << cycle;
+      ASSERT_TRUE(tree.Session().StopDiscovery()) << "cycle " << cycle;
+      if (cycle + 1 == kWarmUpCycles) {
+        level = LevelOf(tree.Runner());
+        ASSERT_TRUE(level);
+      }
+    }
+    std::printf("%d discovery cycles: %.2f s\n", kCycles, SecondsSince(start));
+    ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
+    const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
+    ASSERT_TRUE(after);
+    // Under 5 KiB a cycle (a leaked finder or scan thread stack page shows).
+    EXPECT_LT(after->residentKiB - level->residentKiB, 1024)
+        << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+
+    // A discovery started after all those cycles still finds the sender.
+    const int announced = tree.reports.Announced(id);
+    ASSERT_TRUE(tree.Session().StartDiscovery());
+    EXPECT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > announced; }, 10s));
+    ASSERT_TRUE(tree.Session().StopDiscovery());
+    const std::vector<std::string> bases = tree.Session().MemoryBases();
+    // The last stop_source ends the task (its reply may not leave first).
+    tree.Session().StopSource(id);
+    EXPECT_EQ(tree.host.WaitRunner(10s), std::optional<int>(0)) << tree.Log();
+    EXPECT_EQ(tree.host.Stop(), 0);
+    EXPECT_EQ(SegmentsOf(bases), 0);
+  }
+  ExpectOwnDescriptorsBackTo(*own);
+}
+
+}  // namespace
