@@ -28,12 +28,7 @@ struct RpcDispatcherTestAccess {
 
 namespace {
 
-void Check(bool condition, const char* what) {
-  if (!condition) {
-    std::fprintf(stderr, "invariant broken: %s\n", what);
-    std::abort();
-  }
-}
+using pmfuzz::Check;
 
 }  // namespace
 

@@ -1,9 +1,11 @@
 #pragma once
 // Shared by the fuzz targets: silences the process log (PM_FUZZ_LOG=1 keeps
-// it on stderr) and splits an input into chunk sizes and a byte stream.
+// it on stderr), checks invariants, and splits an input into chunk sizes and
+// a byte stream.
 
 #include <cstddef>
 #include <cstdint>
+#include <cstdio>
 #include <cstdlib>
 
 #include "pm/runtime/context.h"
@@ -13,6 +15,14 @@ namespace pmfuzz {
 inline void QuietLog() {
   if (std::getenv("PM_FUZZ_LOG") != nullptr) return;
   pm::GetContext()->logSink = [](pm::LogType, const char*) {};
+}
+
+// An invariant of the code under test; a broken one is a finding.
+inline void Check(bool condition, const char* what) {
+  if (!condition) {
+    std::fprintf(stderr, "invariant broken: %s\n", what);
+    std::abort();
+  }
 }
 
 // The first kChunkTableBytes bytes of an input give the sizes of the pieces

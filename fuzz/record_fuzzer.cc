@@ -19,12 +19,7 @@
 
 namespace {
 
-void Check(bool condition, const char* what) {
-  if (!condition) {
-    std::fprintf(stderr, "invariant broken: %s\n", what);
-    std::abort();
-  }
-}
+using pmfuzz::Check;
 
 // Check bytes for the last two of the record's 60 bytes so that both running
 // sums over all 60 come out 0 (mod 255).

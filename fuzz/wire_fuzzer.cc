@@ -24,12 +24,7 @@ namespace {
 // leaves every check of the header in play.
 constexpr std::uint64_t kFuzzMaxPayload = std::uint64_t{16} << 20;
 
-void Check(bool condition, const char* what) {
-  if (!condition) {
-    std::fprintf(stderr, "invariant broken: %s\n", what);
-    std::abort();
-  }
-}
+using pmfuzz::Check;
 
 }  // namespace
 

@@ -14,6 +14,7 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -30,10 +31,12 @@ using namespace std::chrono_literals;
 // Generous: the sanitizer builds start processes slowly on a busy machine.
 inline constexpr auto kExitLimit = 20s;
 
-// The runner as a child process; its stderr goes to a file.
+// The runner as a child process; its stderr goes to a file. `env` entries
+// are added to (or replace those of) the inherited environment.
 class RunnerProcess {
  public:
-  explicit RunnerProcess(const std::vector<std::string>& args) {
+  explicit RunnerProcess(const std::vector<std::string>& args,
+                         const std::vector<std::pair<std::string, std::string>>& env = {}) {
     static std::atomic<int> counter{0};
     stderrPath_ = ::testing::TempDir() + "pm-runner-" + std::to_string(::getpid()) + "-" +
                   std::to_string(counter.fetch_add(1)) + ".log";
@@ -43,11 +46,23 @@ class RunnerProcess {
     for (auto& arg : all) argv.push_back(arg.data());
     argv.push_back(nullptr);
 
+    std::vector<std::string> entries;
+    for (char** e = environ; *e != nullptr; ++e) {
+      const std::string entry = *e;
+      bool replaced = false;
+      for (const auto& [key, value] : env) replaced = replaced || entry.rfind(key + "=", 0) == 0;
+      if (!replaced) entries.push_back(entry);
+    }
+    for (const auto& [key, value] : env) entries.push_back(key + "=" + value);
+    std::vector<char*> envp;
+    for (auto& entry : entries) envp.push_back(entry.data());
+    envp.push_back(nullptr);
+
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, stderrPath_.c_str(),
                                      O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    if (posix_spawn(&pid_, PM_RUNNER_PATH, &actions, nullptr, argv.data(), environ) != 0) pid_ = -1;
+    if (posix_spawn(&pid_, PM_RUNNER_PATH, &actions, nullptr, argv.data(), envp.data()) != 0) pid_ = -1;
     posix_spawn_file_actions_destroy(&actions);
   }
   ~RunnerProcess() {

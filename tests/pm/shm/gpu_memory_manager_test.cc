@@ -1,32 +1,14 @@
 #include "pm/shm/shared_gpu_memory.h"
 
+#include "fake_gpu.h"
+
 #include <gtest/gtest.h>
 
 #include <cstring>
 
 namespace {
 
-class FakeGpuMemory : public pm::SharedGpuMemory {
- public:
-  explicit FakeGpuMemory(pm::VideoFormat format) : format_(format) {}
-  std::uint64_t Size() const override { return 0; }
-  std::pair<std::uint8_t*, std::int32_t> Lock() override { return {nullptr, 0}; }
-  void Unlock() override {}
-  bool IsLocked() const override { return false; }
-  pm::VideoFormat Format() const override { return format_; }
-
- private:
-  pm::VideoFormat format_;
-};
-
-class FakeManager : public pm::SharedGpuMemoryManager {
- public:
-  std::shared_ptr<pm::SharedMemory> Allocate(const pm::VideoFormat& format) override {
-    ++calls;
-    return std::make_shared<FakeGpuMemory>(format);
-  }
-  int calls = 0;
-};
+using pmtest::FakeGpuManager;
 
 class OtherSingleton : public pm::Context::SingletonBase {};
 
@@ -55,7 +37,7 @@ TEST_F(GpuManagerLookup, NothingRegisteredGivesNoManagerAndLeavesAnEmptyEntry) {
 }
 
 TEST_F(GpuManagerLookup, RegisteredManagerIsFoundAndMakesGpuSegments) {
-  auto manager = std::make_shared<FakeManager>();
+  auto manager = std::make_shared<FakeGpuManager>();
   Register(manager);
   const std::shared_ptr<pm::SharedGpuMemoryManager> found = pm::GetSharedGpuMemoryManager();
   ASSERT_EQ(found, manager);
@@ -73,7 +55,7 @@ TEST_F(GpuManagerLookup, RegisteredManagerIsFoundAndMakesGpuSegments) {
   auto gpu = std::dynamic_pointer_cast<pm::SharedGpuMemory>(segment);
   ASSERT_NE(gpu, nullptr);
   EXPECT_EQ(gpu->Format().width, 1920);
-  EXPECT_EQ(manager->calls, 1);
+  EXPECT_EQ(manager->made, 1);
 }
 
 TEST_F(GpuManagerLookup, SingletonOfAnotherTypeUnderTheKeyIsNotAManager) {

@@ -11,6 +11,7 @@
 #include "pm/runtime/context.h"
 #include "pm/shm/shared_gpu_memory.h"
 #include "pm/shm/shared_memory_queue.h"
+#include "fake_gpu.h"
 #include "support/host_link.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
@@ -196,31 +197,8 @@ TEST(QueueShm, NothingIsLeftAfterTheQueueGoes) {
   EXPECT_FALSE(ShmExists(name));
 }
 
-// A GPU memory manager that the runner could register; records what it made.
-class FakeGpuSegment : public pm::SharedGpuMemory {
- public:
-  explicit FakeGpuSegment(const pm::VideoFormat& f) : format_(f) { descriptor.size = 1; }
-  std::uint64_t Size() const override { return descriptor.size; }
-  std::pair<std::uint8_t*, std::int32_t> Lock() override { return {nullptr, 0}; }
-  void Unlock() override {}
-  bool IsLocked() const override { return false; }
-  pm::VideoFormat Format() const override { return format_; }
-
- private:
-  pm::VideoFormat format_;
-};
-
-class FakeGpuManager : public pm::SharedGpuMemoryManager {
- public:
-  std::shared_ptr<pm::SharedMemory> Allocate(const pm::VideoFormat& format) override {
-    ++made;
-    return std::make_shared<FakeGpuSegment>(format);
-  }
-  int made = 0;
-};
-
 TEST(QueueGpu, ARegisteredManagerIsPreferredAndMatchedFieldByField) {
-  auto manager = std::make_shared<FakeGpuManager>();
+  auto manager = std::make_shared<pmtest::FakeGpuManager>();
   {
     std::lock_guard<std::mutex> guard(pm::GetContext()->registryLock);
     pm::GetContext()->registry["SharedGpuMemoryManager"] = manager;
