@@ -21,7 +21,6 @@
 #include <atomic>
 #include <chrono>
 #include <cmath>
-#include <condition_variable>
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
@@ -158,13 +157,22 @@ class Monitor {
  public:
   explicit Monitor(const Options& o)
       : width_(o.width), height_(o.height), fps_(o.fps), rate_(o.audioRate), channels_(o.audioChannels),
-        bufferSamples_(o.fps > 0 ? o.audioRate / o.fps : 0), warmup_(o.warmupSeconds) {}
+        bufferSamples_(o.fps > 0 ? o.audioRate / o.fps : 0), warmup_(o.warmupSeconds) {
+    const auto planes = ndits::PictureLayout(ndits::FourCCFromName(o.format), o.width, o.height);
+    tightStride_ = planes.empty() ? 0 : static_cast<std::uint32_t>(planes[0].stride);
+    tightBytes_ = ndits::PictureSize(planes);
+  }
 
   void OnVideo(const pmhost::VideoFrame& frame) {
     std::int64_t number = -1;
     std::string damage;
+    // Every plane's stride scales with the luma stride; the check reads that much.
+    const std::uint32_t stride = frame.stride > 0 ? frame.stride : tightStride_;
     if (frame.width != width_ || frame.height != height_) {
       damage = "picture is " + std::to_string(frame.width) + "x" + std::to_string(frame.height);
+    } else if (tightStride_ == 0 || stride < tightStride_ || frame.bytes < tightBytes_ / tightStride_ * stride) {
+      damage = "picture of " + std::to_string(frame.bytes) + " bytes at stride " + std::to_string(frame.stride) +
+               " is short";
     } else {
       damage = pmhost::CheckRampPicture(frame, &number);
     }
@@ -249,6 +257,8 @@ class Monitor {
   const int width_, height_, fps_, rate_, channels_;
   const std::int64_t bufferSamples_;
   const double warmup_;
+  std::uint32_t tightStride_ = 0;  // of the luma plane, as the sender lays it out
+  std::size_t tightBytes_ = 0;     // of the whole picture at that stride
   mutable std::mutex lock_;  // guards everything below
   Counts counts_;
   soak::ContentPairs pairs_;
@@ -376,13 +386,14 @@ int Run(const Options& o) {
   child.captureStdout = true;
   child.onLine = [&](const std::string& line) {
     const json event = json::parse(line, nullptr, false);
-    if (event.is_object() && event.value("event", "") == "connections") {
+    if (event.is_object() && event.contains("event") && event["event"] == "connections") {
       std::lock_guard<std::mutex> guard(senderLock);
       ++connectionChanges;
     }
   };
   if (!sender.Start(child)) {
-    std::filesystem::remove_all(folder);
+    std::error_code ignored;
+    std::filesystem::remove_all(folder, ignored);
     return 1;
   }
 
