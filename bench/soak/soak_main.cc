@@ -150,9 +150,9 @@ struct Counts {
 };
 
 // OnVideo and OnAudio run on the queue's reader thread, one call at a time;
-// Snapshot on the main thread. Lock: lock_ guards counts_, pairs_, lastAudio*_
-// and shift_ (taken alone; nothing is called out while it is held). The
-// pictures and sound are checked before it is taken.
+// Snapshot on the main thread. Lock: lock_ guards every member below it
+// (taken alone; nothing is called out while it is held: the pictures and
+// sound are checked before it is taken, damage is logged after).
 class Monitor {
  public:
   explicit Monitor(const Options& o)
@@ -177,11 +177,11 @@ class Monitor {
       damage = pmhost::CheckRampPicture(frame, &number);
     }
     const double media = static_cast<double>(frame.mediaTime) / soak::kTicksPerSecond;
-    std::lock_guard<std::mutex> guard(lock_);
     if (!damage.empty()) {
-      Damaged(counts_.picturesDamaged, "picture: " + damage);
+      Damaged(&Counts::picturesDamaged, "picture: " + damage);
       return;
     }
+    std::lock_guard<std::mutex> guard(lock_);
     if (counts_.pictures.first >= 0 && media < lastVideoMedia_) ++counts_.videoStepsBack;
     lastVideoMedia_ = media;
     counts_.pictures.Add(number);
@@ -203,11 +203,11 @@ class Monitor {
       damage = pmhost::CheckRampSound(frame, &residue);
     }
     const double media = static_cast<double>(frame.mediaTime) / soak::kTicksPerSecond;
-    std::lock_guard<std::mutex> guard(lock_);
     if (!damage.empty()) {
-      Damaged(counts_.soundDamaged, "sound: " + damage);
+      Damaged(&Counts::soundDamaged, "sound: " + damage);
       return;
     }
+    std::lock_guard<std::mutex> guard(lock_);
     soak::SoundPositions& sound = counts_.sound;
     // Where the media clock puts this buffer, for gaps of a period or more.
     double estimate = 0;
@@ -244,12 +244,17 @@ class Monitor {
   }
 
  private:
-  void Damaged(std::int64_t& count, const std::string& what) {
-    ++count;
-    if (counts_.firstDamage.empty()) counts_.firstDamage = what;
-    if (++damageLogged_ <= kDamageLines) {
+  void Damaged(std::int64_t Counts::*count, const std::string& what) {
+    int logged = 0;
+    {
+      std::lock_guard<std::mutex> guard(lock_);
+      ++(counts_.*count);
+      if (counts_.firstDamage.empty()) counts_.firstDamage = what;
+      logged = ++damageLogged_;
+    }
+    if (logged <= kDamageLines) {
       pm::Log(pm::LogType::Normal, "", "pm_soak: %s%s", what.c_str(),
-              damageLogged_ == kDamageLines ? " (further damage is counted, not logged)" : "");
+              logged == kDamageLines ? " (further damage is counted, not logged)" : "");
     }
   }
 
@@ -259,7 +264,7 @@ class Monitor {
   const double warmup_;
   std::uint32_t tightStride_ = 0;  // of the luma plane, as the sender lays it out
   std::size_t tightBytes_ = 0;     // of the whole picture at that stride
-  mutable std::mutex lock_;  // guards everything below
+  mutable std::mutex lock_;  // guards every member below
   Counts counts_;
   soak::ContentPairs pairs_;
   double lastVideoMedia_ = 0;
