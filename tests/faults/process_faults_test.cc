@@ -53,6 +53,17 @@ using pmtest::SegmentsOf;
 
 using Clock = std::chrono::steady_clock;
 
+// Resident memory measures leaks only without a sanitizer: AddressSanitizer
+// keeps freed memory in quarantine and ThreadSanitizer adds shadow memory in
+// proportion to what was touched, so both grow with traffic alone. Those runs
+// have their own checks instead: LeakSanitizer at the runner's exit (its
+// status must be 0) and the race reports.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kResidentMemoryTells = false;
+#else
+constexpr bool kResidentMemoryTells = true;
+#endif
+
 double SecondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
 // What the task reported to the host, by source id. Record runs on the
@@ -320,11 +331,15 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
     EXPECT_EQ(SegmentsOf({base}), 240);
     const std::optional<ProcessUsage> later = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(later);
-    // 120 refused pictures kept would be 8.4 MiB.
-    EXPECT_LT(later->residentKiB - dry->residentKiB, 2 * 1024) << "grew while every picture was refused";
-    // Bounded by the pool: the level, the 240 segments it touched, and 16 MiB
-    // for the runtime's bounded frame queues and the allocator.
-    EXPECT_LT(later->residentKiB, level->residentKiB + 240 * kPictureKiB + 16 * 1024);
+    std::printf("runner resident KiB: %ld at its level, %ld when dry, %ld after 120 refused pictures\n",
+                level->residentKiB, dry->residentKiB, later->residentKiB);
+    if (kResidentMemoryTells) {
+      // 120 refused pictures kept would be 8.4 MiB.
+      EXPECT_LT(later->residentKiB - dry->residentKiB, 2 * 1024) << "grew while every picture was refused";
+      // Bounded by the pool: the level, the 240 segments it touched, and 16
+      // MiB for the runtime's bounded frame queues and the allocator.
+      EXPECT_LT(later->residentKiB, level->residentKiB + 240 * kPictureKiB + 16 * 1024);
+    }
     EXPECT_EQ(sink.Videos(id), warmUpVideos + 1) << "only the held picture reached the host";
 
     // Reading again: the 240 queued pictures, then new ones through the same
@@ -563,6 +578,8 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
       ids.push_back(pmhost::kSourceIdPrefix + senders[i]->Name());
     }
     ASSERT_TRUE(tree.host.Start());
+    const std::optional<ProcessUsage> idle = pmtest::UsageOf(tree.Runner());
+    ASSERT_TRUE(idle);
     for (const std::string& id : ids) ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
     auto allReceivingSince = [&](const std::vector<std::size_t>& marks, const std::vector<int>& videos) {
       for (int i = 0; i < kSenders; ++i) {
@@ -579,6 +596,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
     double goneCpu = 0, goneWall = 0;
     std::vector<double> perRound;
     long highestResident = level->residentKiB;
+    std::vector<long> residentByRound;
     for (int round = 0; round < kRounds; ++round) {
       SCOPED_TRACE("round " + std::to_string(round));
       for (int i = 0; i < kSenders; ++i) marks[i] = tree.reports.StateCount(ids[i]);
@@ -601,6 +619,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
       std::this_thread::sleep_for(800ms);
       const double cpu = pmhost::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
       const double wall = SecondsSince(start);
+      if (const auto gone = pmtest::UsageOf(tree.Runner())) highestResident = std::max(highestResident, gone->residentKiB);
       goneCpu += cpu;
       goneWall += wall;
       perRound.push_back(cpu / wall);
@@ -616,16 +635,25 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
       const std::optional<ProcessUsage> now = pmtest::UsageOf(tree.Runner());
       ASSERT_TRUE(now);
       highestResident = std::max(highestResident, now->residentKiB);
+      residentByRound.push_back(now->residentKiB);
     }
     EXPECT_LT(goneCpu / goneWall, 0.05) << "runner CPU share while the senders were gone, by round: "
                                         << ::testing::PrintToString(perRound);
     std::printf("runner CPU while the senders were gone: %.2f%% of a core over %.1f s\n", 100 * goneCpu / goneWall,
                 goneWall);
     ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round");
-    // Four sources' frame queues hold a few 4 MB pictures each; a picture
-    // kept per kill would be 80 MB.
-    EXPECT_LT(highestResident - level->residentKiB, 48 * 1024) << "resident KiB grew over the rounds";
-
+    std::printf("runner resident KiB: %ld before the sources, %ld receiving, then after each round %s\n",
+                idle->residentKiB, level->residentKiB, ::testing::PrintToString(residentByRound).c_str());
+    if (kResidentMemoryTells) {
+      // The runtime keeps at most 8 queued and 4 pooled pictures for each
+      // receiver, and the source captures one: 13 pictures of 4,050 KiB for
+      // each of the four, plus 32 MiB for the allocator. That is where the
+      // runner settles after a few rounds; a picture kept per kill (20 of
+      // them, 79 MiB) would cross it.
+      constexpr long kPictureKiB = 1920L * 1080 * 2 / 1024;
+      EXPECT_LT(highestResident, idle->residentKiB + kSenders * 13 * kPictureKiB + 32 * 1024)
+          << "resident KiB after each round: " << ::testing::PrintToString(residentByRound);
+    }
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));
     for (const std::string& id : ids) tree.Session().StopSource(id);
@@ -670,11 +698,15 @@ TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryO
     ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
     const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(after);
-    // 4 MiB over 990 cycles is under one page (4 KiB) a cycle: a leaked
-    // thread stack page, picture or segment mapping per cycle shows; the
-    // allocator's own slack does not.
-    EXPECT_LT(after->residentKiB - level->residentKiB, 4 * 1024)
-        << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+    std::printf("runner resident KiB: %ld after %d cycles, %ld after %d\n", level->residentKiB, kWarmUpCycles,
+                after->residentKiB, kCycles);
+    if (kResidentMemoryTells) {
+      // 4 MiB over 990 cycles is under one page (4 KiB) a cycle: a leaked
+      // thread stack page, picture or segment mapping per cycle shows; the
+      // allocator's own slack does not.
+      EXPECT_LT(after->residentKiB - level->residentKiB, 4 * 1024)
+          << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+    }
     ExpectOwnDescriptorsBackTo(*ownLevel);
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     EXPECT_EQ(bases.size(), static_cast<std::size_t>(kCycles + 1));
@@ -715,9 +747,14 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
     ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
     const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(after);
-    // Under 5 KiB a cycle (a leaked finder or scan thread stack page shows).
-    EXPECT_LT(after->residentKiB - level->residentKiB, 1024)
-        << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+    std::printf("runner resident KiB: %ld after %d cycles, %ld after %d\n", level->residentKiB, kWarmUpCycles,
+                after->residentKiB, kCycles);
+    if (kResidentMemoryTells) {
+      // Under 5 KiB a cycle: a leaked finder, or a scan thread's stack page,
+      // per cycle shows.
+      EXPECT_LT(after->residentKiB - level->residentKiB, 1024)
+          << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
+    }
 
     // A discovery started after all those cycles still finds the sender.
     const int announced = tree.reports.Announced(id);

@@ -6,6 +6,7 @@
 #include <dirent.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <condition_variable>
@@ -272,23 +273,41 @@ struct CountingSink : pmhost::FrameSink {
 };
 
 TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
-  Folder folder;
-  Sender sender;
-  ASSERT_TRUE(sender.Start(folder, "Crash", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
-  CountingSink sink;
-  pmhost::Host host(pmtest::HostOptionsFor(folder), {}, &sink);
-  ASSERT_TRUE(host.Start());
-  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, 10s));
-  const std::vector<std::string> bases = host.GetSession().MemoryBases();
-  ASSERT_EQ(bases.size(), 1u);
-  ASSERT_GT(SegmentsOf(bases), 0);  // the runner's pool is there
-  ::kill(host.RunnerPid(), SIGKILL);
-  ASSERT_TRUE(host.WaitRunner(10s).has_value());
-  EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, 5s));
-  EXPECT_GT(host.RemovedSegments(), 0);
-  EXPECT_EQ(host.Stop(), 128 + SIGKILL);
+  const std::optional<pmtest::ProcessUsage> own = pmtest::OwnUsage();
+  ASSERT_TRUE(own);
+  std::vector<std::string> bases;
+  {
+    Folder folder;
+    Sender sender;
+    ASSERT_TRUE(sender.Start(folder, "Crash", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+    CountingSink sink;
+    pmhost::Host host(pmtest::HostOptionsFor(folder), {}, &sink);
+    ASSERT_TRUE(host.Start());
+    const std::string id = pmhost::kSourceIdPrefix + sender.Name();
+    ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, 10s));
+    bases = host.GetSession().MemoryBases();
+    ASSERT_EQ(bases.size(), 1u);
+    ASSERT_GT(SegmentsOf(bases), 0);  // the runner's pool is there
+    ::kill(host.RunnerPid(), SIGKILL);
+    ASSERT_TRUE(host.WaitRunner(10s).has_value());
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, 5s));
+    EXPECT_GT(host.RemovedSegments(), 0);
+    EXPECT_EQ(host.Stop(), 128 + SIGKILL);
+    // The host let go of the dead runner's segments as well: none is mapped
+    // here any more.
+    for (const std::string& name : pmtest::SharedMemoryMappedBy(::getpid())) {
+      EXPECT_NE(name.rfind(bases[0], 0), 0u) << name << " is still mapped";
+    }
+  }
+  // Nothing of the run is left open in this process (queue and command
+  // connections, the runner's and the sender's pipes).
+  std::optional<pmtest::ProcessUsage> now;
+  EXPECT_TRUE(pmtest::WaitFor([&] {
+    now = pmtest::OwnUsage();
+    return now && now->descriptors == own->descriptors;
+  }, 5s)) << (now ? now->descriptors : -1) << " descriptors, " << own->descriptors << " before";
+  EXPECT_EQ(SegmentsOf(bases), 0);
 }
 
 }  // namespace
