@@ -186,6 +186,14 @@ class GateSink : public pmhost::FrameSink {
   std::string firstDamage_;
 };
 
+// Opens the gate when a case leaves its scope, before the tree stops: a
+// failed assertion must not leave a reader thread waiting in it while the
+// host joins that thread.
+struct OpenAtExit {
+  GateSink& sink;
+  ~OpenAtExit() { sink.Open(); }
+};
+
 // One case's process tree: a registry folder, the host in this process with
 // its runner, and what the task reported. Senders made afterwards (in the
 // folder) go first. The sink must outlive the tree.
@@ -237,15 +245,17 @@ void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& 
 }
 
 // This process's own descriptors (the queue readers' connections, the
-// children's pipes) back where they were before the case.
-void ExpectOwnDescriptorsBackTo(const ProcessUsage& before) {
+// children's pipes) and threads (readers, child watchers) back where they
+// were before the case.
+void ExpectOwnUsageBackTo(const ProcessUsage& before) {
   std::optional<ProcessUsage> now;
   pmtest::WaitFor([&] {
     now = pmtest::OwnUsage();
-    return now && now->descriptors == before.descriptors;
+    return now && now->descriptors == before.descriptors && now->threads == before.threads;
   }, 5s);
   ASSERT_TRUE(now.has_value());
   EXPECT_EQ(now->descriptors, before.descriptors) << "descriptors of the test process";
+  EXPECT_EQ(now->threads, before.threads) << "threads of the test process";
 }
 
 int CountInText(const std::string& text, const std::string& what) {
@@ -303,12 +313,13 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
     constexpr long kPictureKiB = 256 * 144 * 2 / 1024;
     GateSink sink(/*rampPictures=*/true);
     Tree tree(&sink);
+    OpenAtExit opener{sink};
     Sender sender;
     ASSERT_TRUE(sender.Start(tree.folder, "Stall", {"--width", "256", "--height", "144", "--fps", "120",
                                                     "--pattern", "ramp", "--no-audio"}));
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-    StartWithDiscovery(tree, {id});
-    WarmUp(tree, sink, id);
+    ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+    ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
     const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
     ASSERT_TRUE(level);
     const int warmUpVideos = sink.Videos(id);
@@ -357,10 +368,10 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
 
     ASSERT_TRUE(tree.Session().StopSource(id));
     EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
-    ExpectBackAtLevel(tree.Runner(), *level, "after stop_source");
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
     EndDiscoveryAndExpectOrderlyExit(tree);
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedAreReleased) {
@@ -369,11 +380,12 @@ TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedA
   {
     GateSink sink;
     Tree tree(&sink);
+    OpenAtExit opener{sink};
     Sender sender;
     ASSERT_TRUE(sender.Start(tree.folder, "Drop", {"--width", "64", "--height", "16", "--fps", "60", "--no-audio"}));
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-    StartWithDiscovery(tree, {id});
-    WarmUp(tree, sink, id);
+    ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+    ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
     const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
     ASSERT_TRUE(level);
 
@@ -421,10 +433,10 @@ TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedA
 
     ASSERT_TRUE(tree.Session().StopSource(id));
     EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
-    ExpectBackAtLevel(tree.Runner(), *level, "after stop_source");
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
     EndDiscoveryAndExpectOrderlyExit(tree);
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 // Makes this process the reaper of orphaned descendants for its life, so
@@ -545,7 +557,7 @@ TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm
                                                                  << folder.ReadRunnerLog();
     EXPECT_EQ(SegmentsOf({base}), 0) << folder.ReadRunnerLog();
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyWaiting) {
@@ -641,7 +653,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
                                         << ::testing::PrintToString(perRound);
     std::printf("runner CPU while the senders were gone: %.2f%% of a core over %.1f s\n", 100 * goneCpu / goneWall,
                 goneWall);
-    ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round");
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round"));
     std::printf("runner resident KiB: %ld before the sources, %ld receiving, then after each round %s\n",
                 idle->residentKiB, level->residentKiB, ::testing::PrintToString(residentByRound).c_str());
     if (kResidentMemoryTells) {
@@ -662,7 +674,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
     EXPECT_EQ(SegmentsOf(bases), 0);
     senders.clear();
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryOrSegmentBehind) {
@@ -678,8 +690,8 @@ TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryO
     // delivering.
     ASSERT_TRUE(sender.Start(tree.folder, "Cycle", {"--width", "64", "--height", "16", "--fps", "120", "--no-audio"}));
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-    StartWithDiscovery(tree, {id});
-    WarmUp(tree, sink, id);
+    ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+    ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
 
     std::optional<ProcessUsage> level, ownLevel;
     const auto start = Clock::now();
@@ -695,7 +707,7 @@ TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryO
     const double seconds = SecondsSince(start);
     std::printf("%d start_source/stop_source cycles: %.1f s (%.1f ms each), %d pictures\n", kCycles, seconds,
                 1000 * seconds / kCycles, sink.Videos(id));
-    ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after the cycles"));
     const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(after);
     std::printf("runner resident KiB: %ld after %d cycles, %ld after %d\n", level->residentKiB, kWarmUpCycles,
@@ -707,13 +719,13 @@ TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryO
       EXPECT_LT(after->residentKiB - level->residentKiB, 4 * 1024)
           << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
     }
-    ExpectOwnDescriptorsBackTo(*ownLevel);
+    ExpectOwnUsageBackTo(*ownLevel);
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     EXPECT_EQ(bases.size(), static_cast<std::size_t>(kCycles + 1));
     EXPECT_EQ(SegmentsOf(bases), 0);
     EndDiscoveryAndExpectOrderlyExit(tree);
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrMemoryBehind) {
@@ -727,7 +739,7 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
     Sender sender;
     ASSERT_TRUE(sender.Start(tree.folder, "Scan", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-    StartWithDiscovery(tree, {id});
+    ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
     // The source keeps the runner up while discovery comes and goes.
     ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
     ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, 15s));
@@ -744,7 +756,7 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
       }
     }
     std::printf("%d discovery cycles: %.2f s\n", kCycles, SecondsSince(start));
-    ExpectBackAtLevel(tree.Runner(), *level, "after the cycles");
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after the cycles"));
     const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(after);
     std::printf("runner resident KiB: %ld after %d cycles, %ld after %d\n", level->residentKiB, kWarmUpCycles,
@@ -768,7 +780,7 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
     EXPECT_EQ(tree.host.Stop(), 0);
     EXPECT_EQ(SegmentsOf(bases), 0);
   }
-  ExpectOwnDescriptorsBackTo(*own);
+  ExpectOwnUsageBackTo(*own);
 }
 
 }  // namespace
