@@ -163,11 +163,9 @@ struct RunEnd {
 };
 
 // Receives `id` through the reference host until `done` (or the arrival
-// limit), runs `during` with the runner's process id, then stops the source
-// and lets the runner end by itself.
+// limit), then stops the source and lets the runner end by itself.
 RunEnd ReceiveThroughHost(const Folder& folder, const std::string& id, pmhost::FrameSink* sink,
-                          const std::function<bool()>& done,
-                          const std::function<void(pid_t runner)>& during = {}) {
+                          const std::function<bool()>& done) {
   RunEnd end;
   pmhost::Host host(pmtest::HostOptionsFor(folder), {}, sink);
   if (!host.Start()) {
@@ -176,7 +174,6 @@ RunEnd ReceiveThroughHost(const Folder& folder, const std::string& id, pmhost::F
   }
   EXPECT_TRUE(host.GetSession().StartSource(id, json::object()).has_value());
   EXPECT_TRUE(pmtest::WaitFor(done, kArrivalLimit)) << folder.ReadRunnerLog();
-  if (during) during(host.RunnerPid());
   end.bases = host.GetSession().MemoryBases();
   end.segmentsWhileRunning = SegmentsOf(end.bases);
   host.GetSession().StopSource(id);
@@ -190,6 +187,7 @@ RunEnd ReceiveThroughHost(const Folder& folder, const std::string& id, pmhost::F
 void ExpectCleanEnd(const RunEnd& end, const Folder& folder) {
   EXPECT_EQ(end.runnerExit, std::optional<int>(0)) << folder.ReadRunnerLog();
   EXPECT_EQ(end.bases.size(), 1u);
+  EXPECT_GT(end.segmentsWhileRunning, 0) << "nothing in /dev/shm to leave behind";
   EXPECT_EQ(end.leftInShm, 0);
   EXPECT_EQ(end.removedByHost, 0) << "the runner left segments for the host to remove";
 }
@@ -290,11 +288,10 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
   ExpectCleanEnd(end, folder);
   EXPECT_TRUE(sawTheSequence()) << ::testing::PrintToString(sink.SizeRuns());
   EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
-  // A size change never goes past a segment (the host would refuse that
-  // record), and the pool does not keep growing: segments too small for the
-  // new size are set aside, not multiplied.
-  EXPECT_GT(end.segmentsWhileRunning, 0);
-  EXPECT_LE(end.segmentsWhileRunning, 24);
+  // A picture never goes past its segment: the host refuses a record whose
+  // picture does not fit (counted as a problem above). How many segments the
+  // pool holds depends on how quickly the host gives them back (only the
+  // pool's cap bounds it), so it is not checked here.
 }
 
 // --- A host that misbehaves on its sockets --------------------------------
