@@ -303,7 +303,7 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
 //
 // Threads: the dispatcher's receive thread runs the handlers (queue
 // announcements, notifications); the tap thread reads records and returns
-// tokens. Lock: lock_ guards port_, memoryBase_, states_, repeated_ and the
+// tokens. Lock: lock_ guards port_, memoryBase_, repeated_ and the
 // setting of decoder_; the only lock taken inside it is the decoder's segment
 // cache lock (Forget).
 class RawHost {
@@ -331,12 +331,9 @@ class RawHost {
     if (!accepted) return false;
     connection_ = std::shared_ptr<pm::ipc::Connection>(std::move(accepted));
     dispatcher_ = std::make_shared<pm::RpcDispatcher>(connection_);
+    // The task's notifications are taken and left unread.
     for (const std::string& command : pmhost::Session::NotificationCommands()) {
-      dispatcher_->RegisterHandler(command, [this, command](const json& message, json&) {
-        if (command != "pm::tsrc::update_connection_state") return;
-        std::lock_guard<std::mutex> guard(lock_);
-        states_.push_back(static_cast<int>(message.value("state", 0)));
-      });
+      dispatcher_->RegisterHandler(command, [](const json&, json&) {});
     }
     dispatcher_->Start();
     return true;
@@ -429,10 +426,6 @@ class RawHost {
     std::lock_guard<std::mutex> guard(lock_);
     return memoryBase_;
   }
-  bool Receiving() {
-    std::lock_guard<std::mutex> guard(lock_);
-    return !states_.empty() && states_.back() == 2;
-  }
   pid_t RunnerPid() const { return runner_.Pid(); }
   std::optional<int> WaitRunner(std::chrono::milliseconds limit) { return runner_.Wait(limit); }
 
@@ -480,10 +473,9 @@ class RawHost {
   std::atomic<bool> tapRunning_{false};
   std::atomic<bool> queueEnded_{false};
   std::atomic<int> repeat_{0};
-  std::mutex lock_;  // guards port_, memoryBase_, states_, repeated_, the setting of decoder_
+  std::mutex lock_;  // guards port_, memoryBase_, repeated_, the setting of decoder_
   int port_ = 0;
   std::string memoryBase_;
-  std::vector<int> states_;
   std::vector<std::uint32_t> repeated_;
 };
 
