@@ -85,16 +85,21 @@ void SharedMemoryQueueProducer::StartQueue(std::shared_ptr<RpcDispatcher> dispat
     if (!server_) {
       std::shared_ptr<ipc::Server> server = ipc::Server::CreateListening();
       if (server) {
-        std::weak_ptr<ipc::Server> weakServer = server;
         // The server's listener thread is joined before this queue goes away
-        // (see the destructor), so it may use `this`.
+        // (see the destructor), so it may use `this`; and the server outlives
+        // its own listener thread, so the thread uses it by plain pointer. It
+        // must never hold an owner of it: a queue destroyed while the host's
+        // connection is being accepted would then leave the last owner on
+        // the listener thread, whose server destructor would join that very
+        // thread and end the process.
+        ipc::Server* listening = server.get();
         server->StartWaitingForConnections(
-            [this, weakServer, onHostConnected](std::unique_ptr<ipc::Connection> connection) {
+            [this, listening, onHostConnected](std::unique_ptr<ipc::Connection> connection) {
               producer_.AddConnection(std::shared_ptr<ipc::Connection>(std::move(connection)));
               hostConnected_ = true;
               if (onHostConnected) onHostConnected();
               // One host connection per queue.
-              if (auto s = weakServer.lock()) s->Stop();
+              listening->Stop();
             });
         server_ = std::move(server);
       }
