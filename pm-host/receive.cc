@@ -340,9 +340,11 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   const auto elapsed = [&] { return std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count(); };
   bool commandsSent = false;
   auto lastPrint = std::chrono::steady_clock::now() - 10s;
+  auto lastLatency = lastPrint;
+  double shownP50 = 0, shownP99 = 0;  // latency on the progress line, refreshed once a second
   bool printedTerminal = false;
   for (;;) {
-    const StatsSnapshot now = stats.Snapshot(SteadyNs());
+    StatsSnapshot now = stats.Snapshot(SteadyNs(), /*latency=*/false);
     if (!commandsSent && (now.state == 2 || now.frames > 0 || now.audioBuffers > 0 || elapsed() > 5)) {
       commandsSent = true;
       if (options.tally == "live" || options.tally == "both") session.ShotEvent(match.id, "TALLY_LIVE_ON");
@@ -355,6 +357,14 @@ ReceiveResult Receive(const ReceiveOptions& options) {
                       (options.frames >= 0 && now.frames >= static_cast<std::uint64_t>(options.frames)) ||
                       Interrupted(options.interrupted) || shutdownAsked || !host.RunnerRunning() || session.Ended();
     const auto t = std::chrono::steady_clock::now();
+    if (options.progress != Progress::None && t - lastLatency >= 1s) {
+      const StatsSnapshot withLatency = stats.Snapshot(SteadyNs());
+      shownP50 = withLatency.p50Ms;
+      shownP99 = withLatency.p99Ms;
+      lastLatency = t;
+    }
+    now.p50Ms = shownP50;
+    now.p99Ms = shownP99;
     if (options.progress == Progress::Terminal && t - lastPrint >= 250ms) {
       std::fprintf(options.out, "\r%s\x1b[K", ProgressText(now).c_str());
       std::fflush(options.out);

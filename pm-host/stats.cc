@@ -133,13 +133,13 @@ double ReceiveStats::Percentile(std::vector<double> values, double fraction) {
   return values[std::min(values.size() - 1, rank == 0 ? 0 : rank - 1)];
 }
 
-StatsSnapshot ReceiveStats::Snapshot(std::int64_t steadyNs) const {
+StatsSnapshot ReceiveStats::Snapshot(std::int64_t steadyNs, bool latency) const {
   std::vector<Offset> offsets;
   StatsSnapshot snapshot;
   {
     std::lock_guard<std::mutex> guard(lock_);
     snapshot = totals_;
-    offsets = !videoOffsets_.empty() ? videoOffsets_ : audioOffsets_;
+    if (latency) offsets = !videoOffsets_.empty() ? videoOffsets_ : audioOffsets_;
     std::size_t recent = 0;
     for (std::int64_t t : recentReads_) recent += t >= steadyNs - 1'000'000'000 ? 1 : 0;
     snapshot.recentFps = static_cast<double>(recent);

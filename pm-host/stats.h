@@ -57,7 +57,9 @@ class ReceiveStats {
   void State(int state);
   void Produces(int mask);
   void BadRecord();
-  StatsSnapshot Snapshot(std::int64_t steadyNs) const;
+  // With `latency` false the percentiles are left at 0: computing them sorts
+  // every sample kept so far, too much for a caller that polls often.
+  StatsSnapshot Snapshot(std::int64_t steadyNs, bool latency = true) const;
 
   // Nearest-rank percentile of `values` (0 for none).
   static double Percentile(std::vector<double> values, double fraction);
