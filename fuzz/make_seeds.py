@@ -1,6 +1,7 @@
 #!/usr/bin/env python3
-"""Writes the seed inputs of fuzz/corpus/<target>/ (run from anywhere; the
-files are committed, so this only needs running when a seed changes)."""
+"""Writes the named seed inputs of fuzz/corpus/<target>/ (run from anywhere;
+the files are committed, so this only needs running when a seed changes). The
+hash-named files beside them are inputs merged in from longer fuzzing runs."""
 import json
 import os
 import struct
