@@ -54,8 +54,9 @@ std::vector<std::string> OurDevShmEntries() {
   if (dir == nullptr) return names;
   while (dirent* entry = ::readdir(dir)) {
     const std::string name = entry->d_name;
-    if (name.rfind(Prefix(), 0) == 0 || name.find(pm::SharedCpuMemoryPosix::kPrivateNameSuffix) != std::string::npos)
-      names.push_back(name);
+    // Only names of this process: other test processes run beside this one
+    // and make private (unnamed) segments of their own.
+    if (name.rfind(Prefix(), 0) == 0) names.push_back(name);
   }
   ::closedir(dir);
   return names;
@@ -239,9 +240,11 @@ TEST_F(SharedCpuMemoryTest, CreateWithoutANameMakesAUniqueOne) {
   EXPECT_EQ(a->GetName().size(), 36u + std::strlen(".net.quillfront.pm"));
   EXPECT_TRUE(a->GetName().ends_with(".net.quillfront.pm"));
   EXPECT_TRUE(DevShmHas(a->GetName()));
-  const std::string name = a->GetName();
+  const std::string name = a->GetName(), other = b->GetName();
   a.reset();
+  b.reset();
   EXPECT_FALSE(DevShmHas(name));
+  EXPECT_FALSE(DevShmHas(other));
 }
 
 TEST_F(SharedCpuMemoryTest, LockReportsTheStrideBeforeAndMarksLinelessSegments) {
