@@ -1,0 +1,75 @@
+# Cross build for 64-bit Windows with Debian's mingw-w64 (the posix thread
+# model, so std::thread and std::mutex work), run under Wine on Linux.
+#
+#   scripts/windows-deps
+#   cmake -S . -B build/windows -G Ninja \
+#     -DCMAKE_TOOLCHAIN_FILE=cmake/toolchains/mingw-w64-x86_64.cmake
+#
+# scripts/windows-deps installs the compilers and Wine, builds GoogleTest and
+# tinyxml2 for Windows into PM_MINGW_DEPS, copies the JSON headers there and
+# makes the Wine prefix PM_WINEPREFIX. Both default to folders under
+# ${XDG_CACHE_HOME:-$HOME/.cache}/pm-ndisource and follow the environment
+# variables of the same names, as in the script.
+#
+# Executables and DLLs link libgcc, libstdc++ and winpthread statically, so
+# they run under Wine (and on Windows) without the compiler's DLLs beside
+# them. Tests run through CMAKE_CROSSCOMPILING_EMULATOR (Wine), so ctest and
+# gtest_discover_tests work as in a native build.
+
+set(CMAKE_SYSTEM_NAME Windows)
+set(CMAKE_SYSTEM_PROCESSOR AMD64)
+
+set(PM_MINGW_TRIPLE x86_64-w64-mingw32)
+set(CMAKE_C_COMPILER ${PM_MINGW_TRIPLE}-gcc-posix)
+set(CMAKE_CXX_COMPILER ${PM_MINGW_TRIPLE}-g++-posix)
+set(CMAKE_RC_COMPILER ${PM_MINGW_TRIPLE}-windres)
+
+# The cache folders; try_compile projects read this file again, so they are
+# computed the same way there (and passed on explicitly).
+if(DEFINED ENV{XDG_CACHE_HOME} AND NOT "$ENV{XDG_CACHE_HOME}" STREQUAL "")
+  set(_pm_cache "$ENV{XDG_CACHE_HOME}/pm-ndisource")
+else()
+  set(_pm_cache "$ENV{HOME}/.cache/pm-ndisource")
+endif()
+if(NOT PM_MINGW_DEPS)
+  if(DEFINED ENV{PM_MINGW_DEPS} AND NOT "$ENV{PM_MINGW_DEPS}" STREQUAL "")
+    set(PM_MINGW_DEPS "$ENV{PM_MINGW_DEPS}")
+  else()
+    set(PM_MINGW_DEPS "${_pm_cache}/mingw")
+  endif()
+endif()
+if(NOT PM_WINEPREFIX)
+  if(DEFINED ENV{PM_WINEPREFIX} AND NOT "$ENV{PM_WINEPREFIX}" STREQUAL "")
+    set(PM_WINEPREFIX "$ENV{PM_WINEPREFIX}")
+  else()
+    set(PM_WINEPREFIX "${_pm_cache}/wine")
+  endif()
+endif()
+set(PM_MINGW_DEPS "${PM_MINGW_DEPS}" CACHE PATH "Windows builds of the dependencies (scripts/windows-deps)")
+set(PM_WINEPREFIX "${PM_WINEPREFIX}" CACHE PATH "Wine prefix that runs the tests")
+list(APPEND CMAKE_TRY_COMPILE_PLATFORM_VARIABLES PM_MINGW_DEPS PM_WINEPREFIX)
+
+# Libraries, headers and CMake packages come from the mingw sysroot and the
+# dependency cache only, never from the build machine; programs (the
+# compilers, pkg-config) from the build machine.
+set(CMAKE_FIND_ROOT_PATH /usr/${PM_MINGW_TRIPLE} "${PM_MINGW_DEPS}")
+list(APPEND CMAKE_PREFIX_PATH "${PM_MINGW_DEPS}")
+set(CMAKE_FIND_ROOT_PATH_MODE_PROGRAM NEVER)
+set(CMAKE_FIND_ROOT_PATH_MODE_LIBRARY ONLY)
+set(CMAKE_FIND_ROOT_PATH_MODE_INCLUDE ONLY)
+set(CMAKE_FIND_ROOT_PATH_MODE_PACKAGE ONLY)
+# pkg-config must not hand the build machine's .pc files to the cross build.
+set(ENV{PKG_CONFIG_LIBDIR} "${PM_MINGW_DEPS}/lib/pkgconfig:${PM_MINGW_DEPS}/share/pkgconfig")
+set(ENV{PKG_CONFIG_PATH} "")
+
+# No compiler DLLs at run time: the C++ runtime, libgcc and winpthread are
+# linked into every executable and DLL.
+set(CMAKE_EXE_LINKER_FLAGS_INIT "-static")
+set(CMAKE_SHARED_LINKER_FLAGS_INIT "-static")
+set(CMAKE_MODULE_LINKER_FLAGS_INIT "-static")
+
+# Wine runs the .exe files for ctest and for gtest_discover_tests. It is not
+# on PATH in Debian's wine64 package; WINEDEBUG=-all keeps its own
+# diagnostics out of the tests' output.
+set(CMAKE_CROSSCOMPILING_EMULATOR
+  /usr/bin/env "WINEPREFIX=${PM_WINEPREFIX}" WINEDEBUG=-all /usr/lib/wine/wine64)
