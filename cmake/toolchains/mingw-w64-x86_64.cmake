@@ -5,11 +5,11 @@
 #   cmake -S . -B build/windows -G Ninja \
 #     -DCMAKE_TOOLCHAIN_FILE=cmake/toolchains/mingw-w64-x86_64.cmake
 #
-# scripts/windows-deps installs the compilers and Wine, builds GoogleTest and
-# tinyxml2 for Windows into PM_MINGW_DEPS, copies the JSON headers there and
-# makes the Wine prefix PM_WINEPREFIX. Both default to folders under
-# ${XDG_CACHE_HOME:-$HOME/.cache}/pm-ndisource and follow the environment
-# variables of the same names, as in the script.
+# scripts/windows-deps installs the compilers and Wine, builds GoogleTest,
+# tinyxml2, libpng and libsndfile for Windows into PM_MINGW_DEPS, copies the
+# JSON and CLI11 headers there and makes the Wine prefix PM_WINEPREFIX. Both
+# default to folders under ${XDG_CACHE_HOME:-$HOME/.cache}/pm-ndisource and
+# follow the environment variables of the same names, as in the script.
 #
 # Executables and DLLs link libgcc, libstdc++ and winpthread statically, so
 # they run under Wine (and on Windows) without the compiler's DLLs beside
@@ -58,6 +58,9 @@ set(CMAKE_FIND_ROOT_PATH_MODE_PROGRAM NEVER)
 set(CMAKE_FIND_ROOT_PATH_MODE_LIBRARY ONLY)
 set(CMAKE_FIND_ROOT_PATH_MODE_INCLUDE ONLY)
 set(CMAKE_FIND_ROOT_PATH_MODE_PACKAGE ONLY)
+# Debian's mingw zlib comes as an import library and a static one: the
+# static one, like everything else here.
+set(ZLIB_USE_STATIC_LIBS ON)
 # pkg-config must not hand the build machine's .pc files to the cross build.
 set(ENV{PKG_CONFIG_LIBDIR} "${PM_MINGW_DEPS}/lib/pkgconfig:${PM_MINGW_DEPS}/share/pkgconfig")
 set(ENV{PKG_CONFIG_PATH} "")
