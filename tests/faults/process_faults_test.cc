@@ -53,6 +53,8 @@ using pmtest::Folder;
 using pmtest::ProcessUsage;
 using pmtest::Sender;
 using pmtest::SegmentsOf;
+using pmtest::ExpectBackAtLevel;
+using pmtest::LevelOf;
 
 using Clock = std::chrono::steady_clock;
 
@@ -212,40 +214,6 @@ struct Tree {
   Reports reports;
   pmhost::Host host;
 };
-
-// The runner's level: descriptors and threads at their lowest over a few
-// looks (a descriptor the runtime opens for a moment, say to list the
-// registry, is not part of it).
-std::optional<ProcessUsage> LevelOf(pid_t pid) {
-  std::optional<ProcessUsage> level;
-  for (int i = 0; i < 5; ++i) {
-    const std::optional<ProcessUsage> now = pmtest::UsageOf(pid);
-    if (!now) return std::nullopt;
-    if (!level) {
-      level = now;
-    } else {
-      level->descriptors = std::min(level->descriptors, now->descriptors);
-      level->threads = std::min(level->threads, now->threads);
-      level->residentKiB = std::max(level->residentKiB, now->residentKiB);
-    }
-    std::this_thread::sleep_for(10ms);
-  }
-  return level;
-}
-
-// Threads end and descriptors close a moment after the reply that stopped
-// them: waits for the level, then expects it exactly (no growth, and nothing
-// closed that should still be open).
-void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what) {
-  std::optional<ProcessUsage> now;
-  pmtest::WaitFor([&] {
-    now = pmtest::UsageOf(pid);
-    return now && now->descriptors == level.descriptors && now->threads == level.threads;
-  }, 10s);
-  ASSERT_TRUE(now.has_value()) << what << ": the process is gone";
-  EXPECT_EQ(now->descriptors, level.descriptors) << what << ": descriptors";
-  EXPECT_EQ(now->threads, level.threads) << what << ": threads";
-}
 
 // This process's own descriptors (the queue readers' connections, the
 // children's pipes) and threads (readers, child watchers) back where they
@@ -619,8 +587,8 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
 
     double goneCpu = 0, goneWall = 0;
     std::vector<double> perRound;
-    long highestResident = level->residentKiB;
-    std::vector<long> residentByRound;
+    long highestPrivate = level->privateKiB;
+    std::vector<long> privateByRound;
     for (int round = 0; round < kRounds; ++round) {
       SCOPED_TRACE("round " + std::to_string(round));
       for (int i = 0; i < kSenders; ++i) marks[i] = tree.reports.StateCount(ids[i]);
@@ -643,7 +611,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
       std::this_thread::sleep_for(800ms);
       const double cpu = pmhost::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
       const double wall = SecondsSince(start);
-      if (const auto gone = pmtest::UsageOf(tree.Runner())) highestResident = std::max(highestResident, gone->residentKiB);
+      if (const auto gone = pmtest::UsageOf(tree.Runner())) highestPrivate = std::max(highestPrivate, gone->privateKiB);
       goneCpu += cpu;
       goneWall += wall;
       perRound.push_back(cpu / wall);
@@ -658,8 +626,8 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
           << "not every source came back\n" << tree.Log();
       const std::optional<ProcessUsage> now = pmtest::UsageOf(tree.Runner());
       ASSERT_TRUE(now);
-      highestResident = std::max(highestResident, now->residentKiB);
-      residentByRound.push_back(now->residentKiB);
+      highestPrivate = std::max(highestPrivate, now->privateKiB);
+      privateByRound.push_back(now->privateKiB);
     }
     // Only the optimised build tells: under the sanitizers the runner's
     // allocator and shadow bookkeeping for the pictures it just let go of
@@ -671,17 +639,21 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
     std::printf("runner CPU while the senders were gone: %.2f%% of a core over %.1f s\n", 100 * goneCpu / goneWall,
                 goneWall);
     ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round"));
-    std::printf("runner resident KiB: %ld before the sources, %ld receiving, then after each round %s\n",
-                idle->residentKiB, level->residentKiB, ::testing::PrintToString(residentByRound).c_str());
+    std::printf("runner private KiB: %ld before the sources, %ld receiving, then after each round %s\n",
+                idle->privateKiB, level->privateKiB, ::testing::PrintToString(privateByRound).c_str());
     if (kWithoutSanitizer) {
       // The runtime keeps at most 8 queued and 4 pooled pictures for each
       // receiver, and the source captures one: 13 pictures of 4,050 KiB for
-      // each of the four, plus 32 MiB for the allocator. That is where the
-      // runner settles after a few rounds; a picture kept per kill (20 of
-      // them, 79 MiB) would cross it.
+      // each of the four, plus 32 MiB for the allocator. The runner's
+      // private memory stays under that however full its queues get (110 to
+      // 145 MiB here, on a busy machine too); pictures kept beyond them add
+      // to that and cross it past about 100 MiB. The queues' shared-memory
+      // pools are left out: they grow as far as the host's readers lag
+      // behind, which is the machine's load, and are checked to be gone at
+      // the end.
       constexpr long kPictureKiB = 1920L * 1080 * 2 / 1024;
-      EXPECT_LT(highestResident, idle->residentKiB + kSenders * 13 * kPictureKiB + 32 * 1024)
-          << "resident KiB after each round: " << ::testing::PrintToString(residentByRound);
+      EXPECT_LT(highestPrivate, idle->privateKiB + kSenders * 13 * kPictureKiB + 32 * 1024)
+          << "private KiB after each round: " << ::testing::PrintToString(privateByRound);
     }
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));

@@ -124,13 +124,12 @@ TEST(EndToEnd, I420IsRefusedWithoutAnyVideoRecord) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Planar", {"--format", "i420", "--pattern", "ramp", "--width", "64", "--height",
                                               "16", "--fps", "30", "--no-audio"}));
-  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  const auto refused = [&] { return folder.ReadRunnerLog().find("unexpected raster format") != std::string::npos; };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(ReceiveFrom(folder, sender.Name()), refused);
   EXPECT_EQ(result.error, "");
   EXPECT_EQ(result.runnerExit, 0);
   EXPECT_EQ(result.stats.frames, 0u);
-  EXPECT_NE(folder.ReadRunnerLog().find("unexpected raster format"), std::string::npos) << folder.ReadRunnerLog();
+  EXPECT_TRUE(refused()) << folder.ReadRunnerLog();
 }
 
 TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
@@ -142,7 +141,6 @@ TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
   std::int64_t next = -1;  // reader thread only
   std::atomic<int> channels{0};
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.onAudio = [&](const pmhost::AudioFrame& frame) {
     std::int64_t first = -1;
     ++(pmhost::CheckRampSound(frame, &first).empty() ? intact : damaged);
@@ -150,7 +148,7 @@ TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
     next = first + frame.samples;
     channels = frame.channels;
   };
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(o, [&] { return intact >= 10; });
   ExpectOrderlyEnd(result, folder);
   EXPECT_GE(intact.load(), 10);
   EXPECT_EQ(damaged.load(), 0);
@@ -164,17 +162,19 @@ TEST(EndToEnd, PtzCommandsReachTheSenderWithTheirValues) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "PTZ", {"--ptz", "--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
-  ExpectOrderlyEnd(result, folder);
-  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+  const auto zoom = [](const json& e) {
     return e.value("command", "") == "zoom" && e["values"].value("zoom", 0.0) == 0.5;
-  }));
-  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+  };
+  const auto panTilt = [](const json& e) {
     return e.value("command", "") == "pan_tilt" && e["values"].value("pan", 0.0) == 0.25 &&
            e["values"].value("tilt", 0.0) == -0.5;
-  }));
+  };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(
+      o, [&] { return !sender.Find("ptz", zoom).is_null() && !sender.Find("ptz", panTilt).is_null(); });
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_FALSE(sender.Find("ptz", zoom).is_null());
+  EXPECT_FALSE(sender.Find("ptz", panTilt).is_null());
 }
 
 TEST(EndToEnd, TallyAndShotEventsReachTheSender) {
@@ -182,17 +182,17 @@ TEST(EndToEnd, TallyAndShotEventsReachTheSender) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Tally", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.tally = "preview";
   o.shotEvents = {"X"};
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
-  ExpectOrderlyEnd(result, folder);
-  EXPECT_TRUE(sender.WaitFor("tally", [](const json& e) {
-    return e.value("preview", false) && !e.value("program", true);
-  }));
-  EXPECT_TRUE(sender.WaitFor("metadata", [](const json& e) {
+  const auto preview = [](const json& e) { return e.value("preview", false) && !e.value("program", true); };
+  const auto shot = [](const json& e) {
     return e.value("xml", "") == "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
-  })) << "no shot event with the exact text";
+  };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(
+      o, [&] { return !sender.Find("tally", preview).is_null() && !sender.Find("metadata", shot).is_null(); });
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_FALSE(sender.Find("tally", preview).is_null());
+  EXPECT_FALSE(sender.Find("metadata", shot).is_null()) << "no shot event with the exact text";
 }
 
 TEST(EndToEnd, AudioOnlyBandwidthBringsNoPictures) {
@@ -200,12 +200,14 @@ TEST(EndToEnd, AudioOnlyBandwidthBringsNoPictures) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Radio", {"--width", "64", "--height", "16", "--fps", "30"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.bandwidth = "audio_only";
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  std::atomic<int> sound{0};
+  o.onAudio = [&](const pmhost::AudioFrame&) { ++sound; };
+  // A second of sound: about 30 pictures would have come with it.
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(o, [&] { return sound > 30; });
   ExpectOrderlyEnd(result, folder);
   EXPECT_EQ(result.stats.frames, 0u);
-  EXPECT_GT(result.stats.audioBuffers, 10u);
+  EXPECT_GT(result.stats.audioBuffers, 30u);
 }
 
 TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
