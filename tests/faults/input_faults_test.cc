@@ -528,7 +528,7 @@ TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTh
   // other connection left, ends in order, its segments gone.
   ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxMessageBytes + 1) + "{}"));
   EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
-  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, 5s));
+  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, kExitLimit));
   EXPECT_EQ(SegmentsOf({base}), 0);
   host.Shutdown();
   const std::string log = folder.ReadRunnerLog();
@@ -553,7 +553,7 @@ TEST_F(InputFaults, AHostLeavingInsideAFrameMidStreamEndsTheRunnerInOrder) {
   ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(1000) + "{\"pm::command\":\"pm::tsrc::stop_source\""));
   host.CloseRunnerConnection();
   EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
-  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, 5s));
+  EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, kExitLimit));
   EXPECT_EQ(SegmentsOf({base}), 0);
   host.Shutdown();
   const std::string log = folder.ReadRunnerLog();

@@ -55,6 +55,7 @@ using pmtest::Sender;
 using pmtest::SegmentsOf;
 using pmtest::ExpectBackAtLevel;
 using pmtest::LevelOf;
+using pmtest::kPatience;
 
 using Clock = std::chrono::steady_clock;
 
@@ -231,7 +232,7 @@ void ExpectOwnUsageBackTo(const ProcessUsage& before) {
   pmtest::WaitFor([&] {
     now = pmtest::OwnUsage();
     return now && now->descriptors == before.descriptors && now->threads == before.threads;
-  }, 5s);
+  }, kPatience);
   ASSERT_TRUE(now.has_value());
   EXPECT_EQ(now->descriptors, before.descriptors) << "descriptors of the test process";
   EXPECT_EQ(now->threads, before.threads) << "threads of the test process";
@@ -248,7 +249,7 @@ void StartWithDiscovery(Tree& tree, const std::vector<std::string>& ids) {
   ASSERT_TRUE(tree.host.Start());
   ASSERT_TRUE(tree.Session().StartDiscovery());
   for (const std::string& id : ids) {
-    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > 0; }, 15s)) << id << " never announced";
+    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > 0; }, kPatience)) << id << " never announced";
   }
 }
 
@@ -257,7 +258,7 @@ void StartWithDiscovery(Tree& tree, const std::vector<std::string>& ids) {
 void WarmUp(Tree& tree, GateSink& sink, const std::string& id) {
   const int before = sink.Videos(id);
   ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > before; }, 15s)) << tree.Log();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > before; }, kPatience)) << tree.Log();
   ASSERT_TRUE(tree.Session().StopSource(id));
 }
 
@@ -279,7 +280,7 @@ std::string QueueBase(Tree& tree, const std::string& id) {
     const auto queue = tree.Session().Queue(id);
     if (queue) base = queue->MemoryBase();
     return !base.empty();
-  }, 10s);
+  }, kPatience);
   return base;
 }
 
@@ -309,7 +310,7 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
     ASSERT_FALSE(base.empty());
     ASSERT_TRUE(pmtest::WaitFor([&] {
       return SegmentsOf({base}) >= 240 && tree.Log().find("video well ran dry") != std::string::npos;
-    }, 20s)) << SegmentsOf({base}) << " segments\n" << tree.Log();
+    }, kPatience)) << SegmentsOf({base}) << " segments\n" << tree.Log();
     EXPECT_TRUE(sink.Holding());
     const std::optional<ProcessUsage> dry = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(dry);
@@ -317,7 +318,8 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
     // A further second of pictures, every one refused: no new segment, and
     // nothing of them kept.
     const int refused = CountInText(tree.Log(), "video well ran dry");
-    ASSERT_TRUE(pmtest::WaitFor([&] { return CountInText(tree.Log(), "video well ran dry") >= refused + 120; }, 20s));
+    ASSERT_TRUE(
+        pmtest::WaitFor([&] { return CountInText(tree.Log(), "video well ran dry") >= refused + 120; }, kPatience));
     EXPECT_EQ(SegmentsOf({base}), 240);
     const std::optional<ProcessUsage> later = pmtest::UsageOf(tree.Runner());
     ASSERT_TRUE(later);
@@ -335,18 +337,18 @@ TEST(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsU
     // Reading again: the 240 queued pictures, then new ones through the same
     // pool, intact and in order.
     sink.Open();
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= warmUpVideos + 240 + 60; }, 20s))
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= warmUpVideos + 240 + 60; }, kPatience))
         << sink.Videos(id) - warmUpVideos << " pictures after the release";
     const int dryAfterRecovery = CountInText(tree.Log(), "video well ran dry");
     const int recovered = sink.Videos(id);
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= recovered + 60; }, 20s));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= recovered + 60; }, kPatience));
     EXPECT_EQ(CountInText(tree.Log(), "video well ran dry"), dryAfterRecovery) << "still dry while the host reads";
     EXPECT_EQ(SegmentsOf({base}), 240) << "segments are reused, not made anew";
     EXPECT_EQ(sink.Damaged(), 0) << sink.FirstDamage();
     EXPECT_EQ(sink.Backwards(), 0);
 
     ASSERT_TRUE(tree.Session().StopSource(id));
-    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
     ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
     EndDiscoveryAndExpectOrderlyExit(tree);
   }
@@ -374,7 +376,7 @@ TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedA
     ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
     const std::string base = QueueBase(tree, id);
     ASSERT_FALSE(base.empty());
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Holding() && SegmentsOf({base}) >= 6; }, 15s)) << tree.Log();
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Holding() && SegmentsOf({base}) >= 6; }, kPatience)) << tree.Log();
     const int heldSegments = SegmentsOf({base});
 
     // The host closes its end while the reader thread still holds the
@@ -383,7 +385,7 @@ TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedA
     ASSERT_TRUE(queue);
     std::thread closer([queue] { queue->Stop(); });
     const bool dropped = pmtest::WaitFor(
-        [&] { return tree.Log().find("pm::ipc:queue::Producer : Reader gone") != std::string::npos; }, 10s);
+        [&] { return tree.Log().find("pm::ipc:queue::Producer : Reader gone") != std::string::npos; }, kPatience);
     sink.Open();
     closer.join();
     ASSERT_TRUE(dropped) << tree.Log();
@@ -411,7 +413,7 @@ TEST(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedA
     EXPECT_EQ(tree.reports.States(id).back(), 2);
 
     ASSERT_TRUE(tree.Session().StopSource(id));
-    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, 10s)) << SegmentsOf({base});
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
     ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
     EndDiscoveryAndExpectOrderlyExit(tree);
   }
@@ -427,7 +429,7 @@ class Subreaper {
   ~Subreaper() {
     if (watched_ > 0 && !reaped_) {
       ::kill(watched_, SIGKILL);
-      Reap(5s);
+      Reap(kPatience);
     }
     ::prctl(PR_SET_CHILD_SUBREAPER, 0);
   }
@@ -504,7 +506,7 @@ TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm
     ASSERT_TRUE(pmtest::WaitFor([&] {
       runners = ChildrenNamed(host.Pid(), "pm-runner");
       return runners.size() == 1;
-    }, 10s));
+    }, kPatience));
     const pid_t runner = runners[0];
     reaper.Watch(runner);
 
@@ -514,7 +516,7 @@ TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm
     ASSERT_TRUE(pmtest::WaitFor([&] {
       mapped = pmtest::SharedMemoryMappedBy(runner);
       return !mapped.empty();
-    }, 15s)) << folder.ReadRunnerLog();
+    }, kPatience)) << folder.ReadRunnerLog();
     ASSERT_GT(mapped[0].size(), 22u) << mapped[0];
     const std::string base = mapped[0].substr(0, 22);
     ASSERT_TRUE(pmtest::WaitFor([&] {
@@ -522,13 +524,13 @@ TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm
       return std::any_of(lines.begin(), lines.end(), [](const std::string& l) {
         return l.find("receiving") != std::string::npos && l.find(" 0 frames") == std::string::npos;
       });
-    }, 15s)) << "pm-host never reported pictures";
+    }, kPatience)) << "pm-host never reported pictures";
     ASSERT_GT(SegmentsOf({base}), 0);
 
     const auto killed = Clock::now();
     host.Signal(SIGKILL);
-    EXPECT_EQ(host.Wait(5s), std::optional<int>(128 + SIGKILL));
-    const std::optional<int> status = reaper.Reap(10s);
+    EXPECT_EQ(host.Wait(kPatience), std::optional<int>(128 + SIGKILL));
+    const std::optional<int> status = reaper.Reap(kPatience);
     const double took = SecondsSince(killed);
     std::printf("the runner ended %.2f s after its host was killed\n", took);
     ASSERT_TRUE(status.has_value()) << "the runner outlived its host\n" << folder.ReadRunnerLog();
@@ -581,7 +583,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
     };
     std::vector<std::size_t> marks(kSenders, 0);
     std::vector<int> videos(kSenders, 0);
-    ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, 20s)) << tree.Log();
+    ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience)) << tree.Log();
     const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
     ASSERT_TRUE(level);
 
@@ -596,13 +598,13 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
         std::this_thread::sleep_for(std::chrono::microseconds(offsetUs(random)));
         sender->Process().Signal(SIGKILL);
       }
-      for (auto& sender : senders) ASSERT_TRUE(sender->Process().Wait(5s).has_value());
+      for (auto& sender : senders) ASSERT_TRUE(sender->Process().Wait(kPatience).has_value());
       ASSERT_TRUE(pmtest::WaitFor([&] {
         for (int i = 0; i < kSenders; ++i) {
           if (!tree.reports.ReportedSince(ids[i], marks[i], 3)) return false;
         }
         return true;
-      }, 15s)) << "a source did not notice its sender's end";
+      }, kPatience)) << "a source did not notice its sender's end";
 
       // Every sender gone, every source idle: the runner must sleep. (Time
       // must pass to measure it.)
@@ -622,7 +624,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
         senders[i] = std::make_unique<Sender>();
         ASSERT_TRUE(senders[i]->Start(tree.folder, names[i], args));
       }
-      ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, 20s))
+      ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience))
           << "not every source came back\n" << tree.Log();
       const std::optional<ProcessUsage> now = pmtest::UsageOf(tree.Runner());
       ASSERT_TRUE(now);
@@ -658,7 +660,7 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));
     for (const std::string& id : ids) tree.Session().StopSource(id);
-    EXPECT_EQ(tree.host.WaitRunner(10s), std::optional<int>(0)) << tree.Log();
+    EXPECT_EQ(tree.host.WaitRunner(kPatience), std::optional<int>(0)) << tree.Log();
     EXPECT_EQ(tree.host.Stop(), 0);
     EXPECT_EQ(SegmentsOf(bases), 0);
     senders.clear();
@@ -767,7 +769,7 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
     ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
     // The source keeps the runner up while discovery comes and goes.
     ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, 15s));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, kPatience));
     ASSERT_TRUE(tree.Session().StopDiscovery());
 
     std::optional<ProcessUsage> level;
@@ -796,12 +798,12 @@ TEST(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrM
     // A discovery started after all those cycles still finds the sender.
     const int announced = tree.reports.Announced(id);
     ASSERT_TRUE(tree.Session().StartDiscovery());
-    EXPECT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > announced; }, 10s));
+    EXPECT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > announced; }, kPatience));
     ASSERT_TRUE(tree.Session().StopDiscovery());
     const std::vector<std::string> bases = tree.Session().MemoryBases();
     // The last stop_source ends the task (its reply may not leave first).
     tree.Session().StopSource(id);
-    EXPECT_EQ(tree.host.WaitRunner(10s), std::optional<int>(0)) << tree.Log();
+    EXPECT_EQ(tree.host.WaitRunner(kPatience), std::optional<int>(0)) << tree.Log();
     EXPECT_EQ(tree.host.Stop(), 0);
     EXPECT_EQ(SegmentsOf(bases), 0);
   }

@@ -56,7 +56,7 @@ bool Sender::Start(const Folder& folder, const std::string& name, std::vector<st
     if (event.is_object()) events_.push_back(std::move(event));
   };
   if (!process_.Start(std::move(o))) return false;
-  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, 10s);
+  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, kPatience);
 }
 
 json Sender::Find(const std::string& kind, const std::function<bool(const json&)>& match) {
@@ -68,7 +68,7 @@ json Sender::Find(const std::string& kind, const std::function<bool(const json&)
 }
 
 bool Sender::WaitFor(const std::string& kind, const std::function<bool(const json&)>& match) {
-  return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, 10s);
+  return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, kPatience);
 }
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
@@ -174,7 +174,7 @@ void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& 
   pmtest::WaitFor([&] {
     now = UsageOf(pid);
     return now && now->descriptors == level.descriptors && now->threads == level.threads;
-  }, 10s);
+  }, kPatience);
   ASSERT_TRUE(now.has_value()) << what << ": the process is gone";
   EXPECT_EQ(now->descriptors, level.descriptors) << what << ": descriptors";
   EXPECT_EQ(now->threads, level.threads) << what << ": threads";

@@ -21,6 +21,12 @@
 
 namespace pmtest {
 
+// How long a case waits for something the programs are to do. Waits end as
+// soon as it happens, so the limit costs nothing when all is well; it is
+// generous because the sanitizer builds on a busy two-core machine start
+// processes and move pictures many times slower than a quiet optimised one.
+inline constexpr std::chrono::seconds kPatience{30};
+
 // The programs under test; set from the build (see pm_e2e_support).
 struct Programs {
   std::string runner;

@@ -32,6 +32,7 @@ using pmtest::Folder;
 using pmtest::ReceiveFrom;
 using pmtest::Sender;
 using pmtest::SegmentsOf;
+using pmtest::kPatience;
 
 TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   Folder folder;
@@ -57,12 +58,12 @@ TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   EXPECT_TRUE(pmtest::WaitFor([&] {
     std::lock_guard<std::mutex> guard(lock);
     return seen.count(nameA) == 1 && seen.count(nameB) == 1;
-  }, 15s));
+  }, kPatience));
   b.Process().Terminate();
   EXPECT_TRUE(pmtest::WaitFor([&] {
     std::lock_guard<std::mutex> guard(lock);
     return gone.count(nameB) == 1;
-  }, 15s));
+  }, kPatience));
   stop = true;
   listing.join();
   EXPECT_EQ(status, 0);
@@ -235,14 +236,14 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
     states.push_back(message.value("state", 0));
   };
   o.whileReceiving = [&](pmhost::Session&, const std::string&) {
-    if (!pmtest::WaitFor([&] { return frames > 0; }, 10s)) return stop = true, void();
+    if (!pmtest::WaitFor([&] { return frames > 0; }, kPatience)) return stop = true, void();
     std::size_t mark = statesAfter(0).size();
     sender->Process().Signal(SIGKILL);
-    sender->Process().Wait(10s);
+    sender->Process().Wait(kPatience);
     pmtest::WaitFor([&] {
       const auto s = statesAfter(mark);
       return std::find(s.begin(), s.end(), 3) != s.end();
-    }, 15s);
+    }, kPatience);
     afterDeath = statesAfter(mark);
     mark += afterDeath.size();
     sender = std::make_unique<Sender>();
@@ -251,7 +252,7 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
     pmtest::WaitFor([&] {
       const auto s = statesAfter(mark);
       return std::find(s.begin(), s.end(), 2) != s.end() && frames > before;
-    }, 20s);
+    }, kPatience);
     afterReturn = statesAfter(mark);
     framesAgain = frames > before;
     stop = true;
@@ -287,13 +288,13 @@ TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
     ASSERT_TRUE(host.Start());
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
     ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, 10s));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, kPatience));
     bases = host.GetSession().MemoryBases();
     ASSERT_EQ(bases.size(), 1u);
     ASSERT_GT(SegmentsOf(bases), 0);  // the runner's pool is there
     ::kill(host.RunnerPid(), SIGKILL);
-    ASSERT_TRUE(host.WaitRunner(10s).has_value());
-    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, 5s));
+    ASSERT_TRUE(host.WaitRunner(kPatience).has_value());
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, kPatience));
     EXPECT_GT(host.RemovedSegments(), 0);
     EXPECT_EQ(host.Stop(), 128 + SIGKILL);
     // The host let go of the dead runner's segments as well: none is mapped
@@ -308,7 +309,7 @@ TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
   EXPECT_TRUE(pmtest::WaitFor([&] {
     now = pmtest::OwnUsage();
     return now && now->descriptors == own->descriptors;
-  }, 5s)) << (now ? now->descriptors : -1) << " descriptors, " << own->descriptors << " before";
+  }, kPatience)) << (now ? now->descriptors : -1) << " descriptors, " << own->descriptors << " before";
   EXPECT_EQ(SegmentsOf(bases), 0);
 }
 
