@@ -668,6 +668,49 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
   ExpectOwnUsageBackTo(*own);
 }
 
+// A sender killed and started again under its name, at several delays after
+// its source reported it gone: each time the source reports it connecting
+// and receiving once, and pictures come with "receiving" (not a second
+// connecting/receiving cycle later). Delays are the input; everything else
+// waits for its condition.
+TEST(ProcessFaults, ASenderStartedAgainSoonAfterItWentIsReceivedFromItsFirstReceivingReport) {
+  const std::vector<std::chrono::milliseconds> delays = {200ms, 500ms, 1000ms, 2000ms, 6000ms};
+  const std::vector<std::string> args = {"--width", "64", "--height", "16", "--fps", "30"};
+  GateSink sink;
+  Tree tree(&sink);
+  auto sender = std::make_unique<Sender>();
+  ASSERT_TRUE(sender->Start(tree.folder, "Return", args));
+  const std::string id = pmhost::kSourceIdPrefix + sender->Name();
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0 && tree.reports.ReportedSince(id, 0, 2); }, kPatience))
+      << tree.Log();
+  for (const auto delay : delays) {
+    SCOPED_TRACE("started again " + std::to_string(delay.count()) + " ms after state 3");
+    const std::size_t mark = tree.reports.StateCount(id);
+    sender->Process().Signal(SIGKILL);
+    ASSERT_TRUE(sender->Process().Wait(kPatience).has_value());
+    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.ReportedSince(id, mark, 3); }, kPatience)) << tree.Log();
+    std::this_thread::sleep_for(delay);
+    const int videos = sink.Videos(id);
+    const auto restarted = Clock::now();
+    sender = std::make_unique<Sender>();
+    ASSERT_TRUE(sender->Start(tree.folder, "Return", args));
+    // The source looks for its sender every 5 s while idle. A picture may
+    // overtake the report it came with.
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > videos && tree.reports.ReportedSince(id, mark, 2); },
+                                kPatience))
+        << tree.Log();
+    std::printf("started again %lld ms after state 3: pictures %.2f s later\n",
+                static_cast<long long>(delay.count()), SecondsSince(restarted));
+    const std::vector<int> all = tree.reports.States(id);
+    EXPECT_EQ(std::vector<int>(all.begin() + static_cast<long>(mark), all.end()), (std::vector<int>{3, 1, 2}))
+        << "states since the kill, when pictures came again";
+  }
+  ASSERT_TRUE(tree.Session().StopSource(id));
+  EndDiscoveryAndExpectOrderlyExit(tree);
+}
+
 TEST(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryOrSegmentBehind) {
   constexpr int kCycles = 1000;
   constexpr int kWarmUpCycles = 10;
