@@ -4,7 +4,10 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <atomic>
 #include <filesystem>
+#include <thread>
 #include <set>
 #include <fstream>
 #include <sstream>
@@ -53,7 +56,7 @@ bool Sender::Start(const Folder& folder, const std::string& name, std::vector<st
     if (event.is_object()) events_.push_back(std::move(event));
   };
   if (!process_.Start(std::move(o))) return false;
-  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, 10s);
+  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, kPatience);
 }
 
 json Sender::Find(const std::string& kind, const std::function<bool(const json&)>& match) {
@@ -65,7 +68,7 @@ json Sender::Find(const std::string& kind, const std::function<bool(const json&)
 }
 
 bool Sender::WaitFor(const std::string& kind, const std::function<bool(const json&)>& match) {
-  return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, 10s);
+  return pmtest::WaitFor([&] { return !Find(kind, match).is_null(); }, kPatience);
 }
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
@@ -83,6 +86,21 @@ pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& sour
   o.source = source;
   o.out = stderr;
   return o;
+}
+
+pmhost::ReceiveResult ReceiveUntil(pmhost::ReceiveOptions o, const std::function<bool()>& done,
+                                   std::chrono::milliseconds limit) {
+  std::atomic<bool> stop{false};
+  o.seconds = -1;
+  o.interrupted = &stop;
+  std::thread watcher([&] {
+    pmtest::WaitFor([&] { return stop.load() || done(); }, limit);
+    stop = true;
+  });
+  pmhost::ReceiveResult result = pmhost::Receive(o);
+  stop = true;  // the run ended on its own (the runner went): let the watcher go
+  watcher.join();
+  return result;
 }
 
 int SegmentsOf(const std::vector<std::string>& bases) {
@@ -118,6 +136,7 @@ std::optional<ProcessUsage> UsageAt(const std::string& proc) {
   while (std::getline(status, line)) {
     if (line.rfind("Threads:", 0) == 0) usage.threads = std::atoi(line.c_str() + 8);
     if (line.rfind("VmRSS:", 0) == 0) usage.residentKiB = std::atol(line.c_str() + 6);
+    if (line.rfind("RssAnon:", 0) == 0) usage.privateKiB = std::atol(line.c_str() + 8);
   }
   return usage;
 }
@@ -131,6 +150,35 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
 }
 
 std::optional<ProcessUsage> OwnUsage() { return UsageAt("/proc/self"); }
+
+std::optional<ProcessUsage> LevelOf(pid_t pid) {
+  std::optional<ProcessUsage> level;
+  for (int i = 0; i < 5; ++i) {
+    const std::optional<ProcessUsage> now = UsageOf(pid);
+    if (!now) return std::nullopt;
+    if (!level) {
+      level = now;
+    } else {
+      level->descriptors = std::min(level->descriptors, now->descriptors);
+      level->threads = std::min(level->threads, now->threads);
+      level->residentKiB = std::max(level->residentKiB, now->residentKiB);
+      level->privateKiB = std::max(level->privateKiB, now->privateKiB);
+    }
+    std::this_thread::sleep_for(10ms);
+  }
+  return level;
+}
+
+void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what) {
+  std::optional<ProcessUsage> now;
+  pmtest::WaitFor([&] {
+    now = UsageOf(pid);
+    return now && now->descriptors == level.descriptors && now->threads == level.threads;
+  }, kPatience);
+  ASSERT_TRUE(now.has_value()) << what << ": the process is gone";
+  EXPECT_EQ(now->descriptors, level.descriptors) << what << ": descriptors";
+  EXPECT_EQ(now->threads, level.threads) << what << ": threads";
+}
 
 std::vector<std::string> SharedMemoryMappedBy(pid_t pid) {
   std::set<std::string> names;

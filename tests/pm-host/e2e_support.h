@@ -4,6 +4,7 @@
 // built runner and module, and probes of a process's and /dev/shm's state.
 #include <sys/types.h>
 
+#include <chrono>
 #include <functional>
 #include <map>
 #include <memory>
@@ -19,6 +20,12 @@
 #include "pm-host/receive.h"
 
 namespace pmtest {
+
+// How long a case waits for something the programs are to do. Waits end as
+// soon as it happens, so the limit costs nothing when all is well; it is
+// generous because the sanitizer builds on a busy two-core machine start
+// processes and move pictures many times slower than a quiet optimised one.
+inline constexpr std::chrono::seconds kPatience{30};
 
 // The programs under test; set from the build (see pm_e2e_support).
 struct Programs {
@@ -63,6 +70,12 @@ class Sender {
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
 pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source);
+// Receives until `done` holds (looked at every few milliseconds from the
+// start) or `limit` passes, instead of for a fixed time that a loaded machine
+// may not give the chain to get going. `o.seconds` and `o.interrupted` are
+// taken over.
+pmhost::ReceiveResult ReceiveUntil(pmhost::ReceiveOptions o, const std::function<bool()>& done,
+                                   std::chrono::milliseconds limit = std::chrono::seconds(30));
 
 // Entries of /dev/shm whose names start with one of the bases.
 int SegmentsOf(const std::vector<std::string>& bases);
@@ -72,15 +85,27 @@ int SegmentsOf(const std::vector<std::string>& bases);
 void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder);
 
 // What a live process holds, from /proc/PID: open descriptors, threads and
-// resident memory. nullopt when the process cannot be read.
+// resident memory, with its private (anonymous) part apart: the resident
+// shared memory is the pool the host is handed pictures in, which grows with
+// the host's reading pace, not with what the process keeps for itself.
+// nullopt when the process cannot be read.
 struct ProcessUsage {
   int descriptors = 0;
   int threads = 0;
   long residentKiB = 0;
+  long privateKiB = 0;
 };
 std::optional<ProcessUsage> UsageOf(pid_t pid);
 // Of this process.
 std::optional<ProcessUsage> OwnUsage();
+// A process's level: descriptors and threads at their lowest, memory at its
+// highest, over a few looks (a descriptor the runtime opens for a moment, say
+// to list the registry, is not part of it).
+std::optional<ProcessUsage> LevelOf(pid_t pid);
+// Threads end and descriptors close a moment after the reply that stopped
+// them: waits for the level, then expects it exactly (no growth, and nothing
+// closed that should still be open).
+void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what);
 
 // The /dev/shm entries a live process has mapped (names without the folder,
 // each once), from /proc/PID/maps; entries already unlinked are included.

@@ -32,6 +32,7 @@ using pmtest::Folder;
 using pmtest::ReceiveFrom;
 using pmtest::Sender;
 using pmtest::SegmentsOf;
+using pmtest::kPatience;
 
 TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   Folder folder;
@@ -57,12 +58,12 @@ TEST(EndToEnd, DiscoveryListsTwoSendersAndNoticesOneLeaving) {
   EXPECT_TRUE(pmtest::WaitFor([&] {
     std::lock_guard<std::mutex> guard(lock);
     return seen.count(nameA) == 1 && seen.count(nameB) == 1;
-  }, 15s));
+  }, kPatience));
   b.Process().Terminate();
   EXPECT_TRUE(pmtest::WaitFor([&] {
     std::lock_guard<std::mutex> guard(lock);
     return gone.count(nameB) == 1;
-  }, 15s));
+  }, kPatience));
   stop = true;
   listing.join();
   EXPECT_EQ(status, 0);
@@ -124,13 +125,12 @@ TEST(EndToEnd, I420IsRefusedWithoutAnyVideoRecord) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Planar", {"--format", "i420", "--pattern", "ramp", "--width", "64", "--height",
                                               "16", "--fps", "30", "--no-audio"}));
-  pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  const auto refused = [&] { return folder.ReadRunnerLog().find("unexpected raster format") != std::string::npos; };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(ReceiveFrom(folder, sender.Name()), refused);
   EXPECT_EQ(result.error, "");
   EXPECT_EQ(result.runnerExit, 0);
   EXPECT_EQ(result.stats.frames, 0u);
-  EXPECT_NE(folder.ReadRunnerLog().find("unexpected raster format"), std::string::npos) << folder.ReadRunnerLog();
+  EXPECT_TRUE(refused()) << folder.ReadRunnerLog();
 }
 
 TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
@@ -142,7 +142,6 @@ TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
   std::int64_t next = -1;  // reader thread only
   std::atomic<int> channels{0};
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.onAudio = [&](const pmhost::AudioFrame& frame) {
     std::int64_t first = -1;
     ++(pmhost::CheckRampSound(frame, &first).empty() ? intact : damaged);
@@ -150,7 +149,7 @@ TEST(EndToEnd, SoundArrivesInterleavedAndIntact) {
     next = first + frame.samples;
     channels = frame.channels;
   };
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(o, [&] { return intact >= 10; });
   ExpectOrderlyEnd(result, folder);
   EXPECT_GE(intact.load(), 10);
   EXPECT_EQ(damaged.load(), 0);
@@ -164,17 +163,19 @@ TEST(EndToEnd, PtzCommandsReachTheSenderWithTheirValues) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "PTZ", {"--ptz", "--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
-  ExpectOrderlyEnd(result, folder);
-  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+  const auto zoom = [](const json& e) {
     return e.value("command", "") == "zoom" && e["values"].value("zoom", 0.0) == 0.5;
-  }));
-  EXPECT_TRUE(sender.WaitFor("ptz", [](const json& e) {
+  };
+  const auto panTilt = [](const json& e) {
     return e.value("command", "") == "pan_tilt" && e["values"].value("pan", 0.0) == 0.25 &&
            e["values"].value("tilt", 0.0) == -0.5;
-  }));
+  };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(
+      o, [&] { return !sender.Find("ptz", zoom).is_null() && !sender.Find("ptz", panTilt).is_null(); });
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_FALSE(sender.Find("ptz", zoom).is_null());
+  EXPECT_FALSE(sender.Find("ptz", panTilt).is_null());
 }
 
 TEST(EndToEnd, TallyAndShotEventsReachTheSender) {
@@ -182,17 +183,17 @@ TEST(EndToEnd, TallyAndShotEventsReachTheSender) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Tally", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.tally = "preview";
   o.shotEvents = {"X"};
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
-  ExpectOrderlyEnd(result, folder);
-  EXPECT_TRUE(sender.WaitFor("tally", [](const json& e) {
-    return e.value("preview", false) && !e.value("program", true);
-  }));
-  EXPECT_TRUE(sender.WaitFor("metadata", [](const json& e) {
+  const auto preview = [](const json& e) { return e.value("preview", false) && !e.value("program", true); };
+  const auto shot = [](const json& e) {
     return e.value("xml", "") == "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
-  })) << "no shot event with the exact text";
+  };
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(
+      o, [&] { return !sender.Find("tally", preview).is_null() && !sender.Find("metadata", shot).is_null(); });
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_FALSE(sender.Find("tally", preview).is_null());
+  EXPECT_FALSE(sender.Find("metadata", shot).is_null()) << "no shot event with the exact text";
 }
 
 TEST(EndToEnd, AudioOnlyBandwidthBringsNoPictures) {
@@ -200,12 +201,14 @@ TEST(EndToEnd, AudioOnlyBandwidthBringsNoPictures) {
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Radio", {"--width", "64", "--height", "16", "--fps", "30"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
-  o.seconds = 1.5;
   o.bandwidth = "audio_only";
-  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  std::atomic<int> sound{0};
+  o.onAudio = [&](const pmhost::AudioFrame&) { ++sound; };
+  // A second of sound: about 30 pictures would have come with it.
+  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(o, [&] { return sound > 30; });
   ExpectOrderlyEnd(result, folder);
   EXPECT_EQ(result.stats.frames, 0u);
-  EXPECT_GT(result.stats.audioBuffers, 10u);
+  EXPECT_GT(result.stats.audioBuffers, 30u);
 }
 
 TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
@@ -233,14 +236,14 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
     states.push_back(message.value("state", 0));
   };
   o.whileReceiving = [&](pmhost::Session&, const std::string&) {
-    if (!pmtest::WaitFor([&] { return frames > 0; }, 10s)) return stop = true, void();
+    if (!pmtest::WaitFor([&] { return frames > 0; }, kPatience)) return stop = true, void();
     std::size_t mark = statesAfter(0).size();
     sender->Process().Signal(SIGKILL);
-    sender->Process().Wait(10s);
+    sender->Process().Wait(kPatience);
     pmtest::WaitFor([&] {
       const auto s = statesAfter(mark);
       return std::find(s.begin(), s.end(), 3) != s.end();
-    }, 15s);
+    }, kPatience);
     afterDeath = statesAfter(mark);
     mark += afterDeath.size();
     sender = std::make_unique<Sender>();
@@ -249,7 +252,7 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
     pmtest::WaitFor([&] {
       const auto s = statesAfter(mark);
       return std::find(s.begin(), s.end(), 2) != s.end() && frames > before;
-    }, 20s);
+    }, kPatience);
     afterReturn = statesAfter(mark);
     framesAgain = frames > before;
     stop = true;
@@ -285,13 +288,13 @@ TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
     ASSERT_TRUE(host.Start());
     const std::string id = pmhost::kSourceIdPrefix + sender.Name();
     ASSERT_TRUE(host.GetSession().StartSource(id, json::object()));
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, 10s));
+    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.videos > 3; }, kPatience));
     bases = host.GetSession().MemoryBases();
     ASSERT_EQ(bases.size(), 1u);
     ASSERT_GT(SegmentsOf(bases), 0);  // the runner's pool is there
     ::kill(host.RunnerPid(), SIGKILL);
-    ASSERT_TRUE(host.WaitRunner(10s).has_value());
-    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, 5s));
+    ASSERT_TRUE(host.WaitRunner(kPatience).has_value());
+    EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf(bases) == 0; }, kPatience));
     EXPECT_GT(host.RemovedSegments(), 0);
     EXPECT_EQ(host.Stop(), 128 + SIGKILL);
     // The host let go of the dead runner's segments as well: none is mapped
@@ -306,7 +309,7 @@ TEST(EndToEnd, ACrashedRunnersSegmentsAreRemovedByTheHost) {
   EXPECT_TRUE(pmtest::WaitFor([&] {
     now = pmtest::OwnUsage();
     return now && now->descriptors == own->descriptors;
-  }, 5s)) << (now ? now->descriptors : -1) << " descriptors, " << own->descriptors << " before";
+  }, kPatience)) << (now ? now->descriptors : -1) << " descriptors, " << own->descriptors << " before";
   EXPECT_EQ(SegmentsOf(bases), 0);
 }
 
