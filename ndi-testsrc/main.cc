@@ -360,13 +360,18 @@ int main(int argc, char** argv) {
   app.add_option("--pattern", o.pattern, "test pattern")->check(CLI::IsMember({"bars", "ramp"}));
   app.add_option("--audio-rate", o.audio_rate, "audio sample rate")->check(CLI::Range(1, 384000));
   app.add_option("--audio-channels", o.audio_channels, "audio channels")->check(CLI::Range(1, 1024));
-  app.add_option("--audio-samples", o.audio_samples, "samples per audio frame (default: one video frame)")
-      ->check(CLI::Range(1, 1 << 20));
+  app.add_option("--audio-samples", o.audio_samples, "samples per audio frame")
+      ->check(CLI::Range(1, 1 << 20))
+      ->default_str("one picture's worth");
   app.add_flag("--no-audio", o.no_audio, "send no audio");
   app.add_flag("--ptz", o.ptz, "accept PTZ commands (reported as events)");
   app.add_option("--model", o.model, "model name sent as connection metadata");
-  auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")->check(CLI::NonNegativeNumber);
-  auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")->check(CLI::NonNegativeNumber);
+  auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")
+                     ->check(CLI::NonNegativeNumber)
+                     ->default_str("until interrupted");
+  auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")
+                      ->check(CLI::NonNegativeNumber)
+                      ->default_str("until interrupted");
   frames->excludes(seconds);
   app.add_option("--sizes", o.sizes, "picture sizes WxH,WxH,... in turn (instead of --width/--height)");
   app.add_option("--frames-per-size", o.frames_per_size, "frames of each of --sizes before the next")
