@@ -291,8 +291,9 @@ int Discover(const ListOptions& options) {
          host.RunnerRunning()) {
     std::this_thread::sleep_for(50ms);
   }
-  const bool died = !host.RunnerRunning();
-  if (!died) host.GetSession().StopDiscovery();
+  // Ctrl-C on a terminal reaches the runner too, which then ends in order.
+  const bool died = !host.RunnerRunning() && !Interrupted(options.interrupted);
+  if (host.RunnerRunning()) host.GetSession().StopDiscovery();
   const int runnerExit = host.Stop();
   if (died || runnerExit != 0) {
     pm::Log(pm::LogType::Normal, "", "pm-host: the runner ended %s with status %d\n",
@@ -414,7 +415,8 @@ ReceiveResult Receive(const ReceiveOptions& options) {
     std::this_thread::sleep_for(20ms);
   }
   if (printedTerminal) std::fprintf(options.out, "\n");
-  if (!host.RunnerRunning()) result.error = "the runner ended during the run";
+  // Ctrl-C on a terminal reaches the runner too, which then ends in order.
+  if (!host.RunnerRunning() && !Interrupted(options.interrupted)) result.error = "the runner ended during the run";
 
   result.memoryBases = session.MemoryBases();
   result.runnerCpuSeconds = ProcessCpuSeconds(host.RunnerPid());
