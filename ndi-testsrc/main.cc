@@ -347,7 +347,10 @@ int Run(const Options& o) {
 
 int main(int argc, char** argv) {
   Options o;
-  CLI::App app{"ndi-testsrc: an NDI sender of test pictures and sound"};
+  CLI::App app{"ndi-testsrc: an NDI sender of test pictures and sound; every event it sees is a JSON line on stdout.\n"
+               "Exit status: 0 success, 1 the sender failed, 2 a usage error."};
+  app.set_version_flag("--version", "ndi-testsrc " PM_VERSION);
+  app.option_defaults()->always_capture_default();
   app.add_option("--name", o.name, "NDI source name (the part in parentheses)")->required();
   app.add_option("--width", o.width, "picture width")->check(CLI::Range(2, 16384));
   app.add_option("--height", o.height, "picture height")->check(CLI::Range(2, 16384));
@@ -357,18 +360,27 @@ int main(int argc, char** argv) {
   app.add_option("--pattern", o.pattern, "test pattern")->check(CLI::IsMember({"bars", "ramp"}));
   app.add_option("--audio-rate", o.audio_rate, "audio sample rate")->check(CLI::Range(1, 384000));
   app.add_option("--audio-channels", o.audio_channels, "audio channels")->check(CLI::Range(1, 1024));
-  app.add_option("--audio-samples", o.audio_samples, "samples per audio frame (default: one video frame)")
-      ->check(CLI::Range(1, 1 << 20));
+  app.add_option("--audio-samples", o.audio_samples, "samples per audio frame")
+      ->check(CLI::Range(1, 1 << 20))
+      ->default_str("one picture's worth");
   app.add_flag("--no-audio", o.no_audio, "send no audio");
   app.add_flag("--ptz", o.ptz, "accept PTZ commands (reported as events)");
   app.add_option("--model", o.model, "model name sent as connection metadata");
-  auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")->check(CLI::NonNegativeNumber);
-  auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")->check(CLI::NonNegativeNumber);
+  auto* frames = app.add_option("--frames", o.frames, "send N video frames, then exit")
+                     ->check(CLI::NonNegativeNumber)
+                     ->default_str("until interrupted");
+  auto* seconds = app.add_option("--seconds", o.seconds, "run S seconds, then exit")
+                      ->check(CLI::NonNegativeNumber)
+                      ->default_str("until interrupted");
   frames->excludes(seconds);
   app.add_option("--sizes", o.sizes, "picture sizes WxH,WxH,... in turn (instead of --width/--height)");
   app.add_option("--frames-per-size", o.frames_per_size, "frames of each of --sizes before the next")
       ->check(CLI::Range(1, 1 << 30));
-  CLI11_PARSE(app, argc, argv);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    return app.exit(e) == 0 ? 0 : 2;  // help and --version: 0; a mistake on the line: 2
+  }
 
   struct sigaction action {};
   action.sa_handler = OnSignal;

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "ndi-testsrc/pattern.h"
+#include "pm-host/picture.h"
 #include "pm/task/formats.h"
 #include "taskndisource/ndi_abi.h"
 
@@ -69,6 +70,30 @@ std::string CheckBars(const VideoFrame& frame) {
       if (std::memcmp(row + x, expected + x, 4) != 0 && std::memcmp(row + x, kMarker, 4) != 0) {
         return "row " + std::to_string(y) + " byte " + std::to_string(x) + " is neither bars nor marker";
       }
+    }
+  }
+  return {};
+}
+
+std::string CheckBarsPng(const std::string& path) {
+  int width = 0, height = 0;
+  std::vector<std::uint8_t> rgb;
+  if (!ReadPng(path, &width, &height, &rgb)) return "cannot read " + path;
+  if (width < 2 || height < 2 || width % 2 != 0) return "odd picture size";
+  const std::vector<std::uint8_t>& bars = BarsPicture(width, height);
+  const std::vector<std::uint8_t> expected =
+      ToRgb(Picture{pm::kCode2vuy, width, height, static_cast<std::uint32_t>(width) * 2, bars});
+  if (expected.size() != rgb.size()) return "no bars of this size";
+  const int size = std::max(2, (height / 8) & ~1);
+  const int band = ((height - size) / 2) & ~1;
+  std::uint8_t marker[3];
+  YuvToRgb(235, 128, 128, marker);
+  for (int y = 0; y < height; ++y) {
+    const bool inBand = y >= band && y < band + size;
+    for (int x = 0; x < width; ++x) {
+      const std::size_t at = (static_cast<std::size_t>(y) * width + x) * 3;
+      if (std::memcmp(&rgb[at], &expected[at], 3) == 0 || (inBand && std::memcmp(&rgb[at], marker, 3) == 0)) continue;
+      return "pixel " + std::to_string(x) + "," + std::to_string(y) + " is neither bars nor marker";
     }
   }
   return {};

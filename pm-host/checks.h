@@ -15,6 +15,11 @@ namespace pmhost {
 // either the bars or the white marker. Empty when intact, else where not.
 std::string CheckBars(const VideoFrame& frame);
 
+// A snapshot (PNG) of the bars: every pixel is the bars' colour as the
+// host's RGB conversion gives it, or the white marker inside its band. Empty
+// when intact.
+std::string CheckBarsPng(const std::string& path);
+
 // Interleaved 'fl32' sound of the tone 0.25 x sin(2 pi 1000 t / rate) with t
 // counting samples: each buffer continues some phase of it exactly. Empty
 // when intact.

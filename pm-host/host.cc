@@ -2,19 +2,17 @@
 
 #include <thread>
 
+#include "pm-host/locate.h"
 #include "pm-host/segments.h"
 #include "pm/ipc/server.h"
 #include "pm/runtime/log.h"
 
 namespace pmhost {
 
-std::string DefaultRunnerPath() { return ProgramDirectory() + "../pm-runner/pm-runner"; }
-std::string DefaultModulePath() { return ProgramDirectory() + "../lib/libtaskndisource.so"; }
-
 Host::Host(HostOptions options, NotificationListener listener, FrameSink* sink)
     : options_(std::move(options)), listener_(std::move(listener)), sink_(sink) {
-  if (options_.runnerPath.empty()) options_.runnerPath = DefaultRunnerPath();
-  if (options_.modulePath.empty()) options_.modulePath = DefaultModulePath();
+  if (options_.runnerPath.empty()) options_.runnerPath = Locate(Companion::Runner);
+  if (options_.modulePath.empty()) options_.modulePath = Locate(Companion::Module);
 }
 
 Host::~Host() {
@@ -22,7 +20,7 @@ Host::~Host() {
 }
 
 bool Host::Start() {
-  if (started_) return false;
+  if (started_ || options_.runnerPath.empty() || options_.modulePath.empty()) return false;
   std::unique_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
   if (!server) {
     pm::Log(pm::LogType::Normal, "", "pm-host: cannot listen on 127.0.0.1\n");

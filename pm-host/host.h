@@ -23,16 +23,12 @@
 namespace pmhost {
 
 struct HostOptions {
-  std::string runnerPath;                  // empty: pm-runner built beside this program
-  std::string modulePath;                  // empty: libtaskndisource.so built beside it
+  std::string runnerPath;                  // empty: pm-runner found beside this program (locate.h)
+  std::string modulePath;                  // empty: libtaskndisource.so found from it (locate.h)
   std::map<std::string, std::string> env;  // for the runner (NDI_LOOPBACK_DIR)
   std::string runnerLog;                   // the runner's stderr; empty: ours
   std::chrono::milliseconds connectLimit{10000};
 };
-
-// ../pm-runner/pm-runner and ../lib/libtaskndisource.so beside this program.
-std::string DefaultRunnerPath();
-std::string DefaultModulePath();
 
 class Host {
  public:
@@ -42,7 +38,8 @@ class Host {
   Host& operator=(const Host&) = delete;
 
   // Starts the runner and waits for its connection. False (logged) when the
-  // runner cannot be started or does not connect in time (it is stopped).
+  // runner or the module cannot be found, the runner cannot be started or
+  // does not connect in time (it is stopped).
   bool Start();
   // Closes the connection (an orderly runner ends by itself), waits up to
   // `grace`, then terminates the runner; removes its segments. Returns the

@@ -94,4 +94,25 @@ bool WritePng(const std::string& path, int width, int height, const std::vector<
   return true;
 }
 
+bool ReadPng(const std::string& path, int* width, int* height, std::vector<std::uint8_t>* rgb) {
+  png_image image{};
+  image.version = PNG_IMAGE_VERSION;
+  if (png_image_begin_read_from_file(&image, path.c_str()) == 0) {
+    pm::Log(pm::LogType::Normal, "", "ReadPng: cannot read '%s': %s\n", path.c_str(), image.message);
+    png_image_free(&image);
+    return false;
+  }
+  image.format = PNG_FORMAT_RGB;
+  std::vector<std::uint8_t> pixels(PNG_IMAGE_SIZE(image));
+  if (png_image_finish_read(&image, nullptr, pixels.data(), 0, nullptr) == 0) {
+    pm::Log(pm::LogType::Normal, "", "ReadPng: cannot decode '%s': %s\n", path.c_str(), image.message);
+    png_image_free(&image);
+    return false;
+  }
+  *width = static_cast<int>(image.width);
+  *height = static_cast<int>(image.height);
+  *rgb = std::move(pixels);
+  return true;
+}
+
 }  // namespace pmhost

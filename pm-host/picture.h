@@ -34,4 +34,8 @@ std::vector<std::uint8_t> ToRgb(const Picture& picture);
 // Writes an 8-bit RGB PNG. False (logged) on failure.
 bool WritePng(const std::string& path, int width, int height, const std::vector<std::uint8_t>& rgb);
 
+// Reads a PNG as 8-bit RGB (libpng converts other formats). False (logged)
+// when it cannot be read.
+bool ReadPng(const std::string& path, int* width, int* height, std::vector<std::uint8_t>* rgb);
+
 }  // namespace pmhost

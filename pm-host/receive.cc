@@ -1,11 +1,14 @@
 #include "pm-host/receive.h"
 
+#include <fcntl.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cmath>
 #include <condition_variable>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -15,6 +18,7 @@
 #include <thread>
 
 #include "pm-host/checks.h"
+#include "pm-host/locate.h"
 #include "pm-host/picture.h"
 #include "pm-host/wav.h"
 #include "pm/runtime/json.h"
@@ -55,6 +59,18 @@ std::string Lower(std::string text) {
 }
 
 bool Interrupted(const std::atomic<bool>* flag) { return flag != nullptr && flag->load(); }
+
+// Empty when `path` can be written: it is opened for writing (created when
+// missing, and then removed again), so that a run never ends by finding out
+// that its output cannot be kept.
+std::string CannotWrite(const std::string& path) {
+  const bool existed = ::access(path.c_str(), F_OK) == 0;
+  const int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_NONBLOCK | O_CLOEXEC, 0644);
+  if (fd < 0) return "cannot write " + path + ": " + std::strerror(errno);
+  ::close(fd);
+  if (!existed) ::unlink(path.c_str());
+  return {};
+}
 
 const char* StateName(int state) {
   switch (state) {
@@ -137,7 +153,13 @@ class ReceiveSink : public FrameSink {
     return std::move(picture_);
   }
 
-  void CloseWav() { wav_.Close(); }
+  // Closes the WAV file; true when every sound buffer of the run went into
+  // it (false when none came or one could not be written).
+  bool CloseWav() {
+    const bool complete = wav_.IsOpen() && !wavFailed_;
+    wav_.Close();
+    return complete;
+  }
 
  private:
   void WriteWav(const AudioFrame& frame) {
@@ -152,14 +174,17 @@ class ReceiveSink : public FrameSink {
       return;
     }
     const auto count = static_cast<std::size_t>(frame.samples) * static_cast<std::size_t>(frame.channels);
+    bool written = false;
     if (frame.code == pm::kCodeFl32) {
-      wav_.Write(reinterpret_cast<const float*>(frame.data), frame.samples);
+      written = wav_.Write(reinterpret_cast<const float*>(frame.data), frame.samples);
     } else {
       std::vector<float> samples(count);
       const auto* in = reinterpret_cast<const std::int16_t*>(frame.data);
       for (std::size_t i = 0; i < count; ++i) samples[i] = static_cast<float>(in[i]) / 32768.0f;
-      wav_.Write(samples.data(), frame.samples);
+      written = wav_.Write(samples.data(), frame.samples);
     }
+    if (!written && !wavFailed_) pm::Log(pm::LogType::Normal, "", "pm-host: cannot write to '%s'\n", options_.wav.c_str());
+    wavFailed_ = wavFailed_ || !written;
   }
 
   ReceiveStats& stats_;
@@ -167,7 +192,7 @@ class ReceiveSink : public FrameSink {
   // Reader thread only:
   std::int64_t lastCopy_ = INT64_MIN / 2;
   WavWriter wav_;  // closed by the owner after the readers stopped
-  bool wavFailed_ = false;
+  bool wavFailed_ = false;  // it could not be opened or written
   bool formatChangeLogged_ = false;
   std::mutex pictureLock_;  // guards picture_
   Picture picture_;
@@ -195,7 +220,7 @@ json ReceiveResult::ToJson() const {
 }
 
 std::string SummaryText(const ReceiveResult& r) {
-  if (!r.error.empty()) return "pm-host: " + r.error;
+  if (r.id.empty()) return {};
   const StatsSnapshot& s = r.stats;
   char text[512];
   std::snprintf(text, sizeof text,
@@ -266,13 +291,24 @@ int Discover(const ListOptions& options) {
          host.RunnerRunning()) {
     std::this_thread::sleep_for(50ms);
   }
-  host.GetSession().StopDiscovery();
-  host.Stop();
+  // Ctrl-C on a terminal reaches the runner too, which then ends in order.
+  const bool died = !host.RunnerRunning() && !Interrupted(options.interrupted);
+  if (host.RunnerRunning()) host.GetSession().StopDiscovery();
+  const int runnerExit = host.Stop();
+  if (died || runnerExit != 0) {
+    pm::Log(pm::LogType::Normal, "", "pm-host: the runner ended %s with status %d\n",
+            died ? "during the run" : "after it", runnerExit);
+    return 1;
+  }
   return 0;
 }
 
 ReceiveResult Receive(const ReceiveOptions& options) {
   ReceiveResult result;
+  for (const std::string* path : {&options.snapshot, &options.wav}) {
+    if (!path->empty() && result.error.empty()) result.error = CannotWrite(*path);
+  }
+  if (!result.error.empty()) return result;
   ReceiveStats stats;
   SourceTable table;
   ReceiveSink sink(stats, options);
@@ -379,7 +415,8 @@ ReceiveResult Receive(const ReceiveOptions& options) {
     std::this_thread::sleep_for(20ms);
   }
   if (printedTerminal) std::fprintf(options.out, "\n");
-  if (!host.RunnerRunning()) result.error = "the runner ended during the run";
+  // Ctrl-C on a terminal reaches the runner too, which then ends in order.
+  if (!host.RunnerRunning() && !Interrupted(options.interrupted)) result.error = "the runner ended during the run";
 
   result.memoryBases = session.MemoryBases();
   result.runnerCpuSeconds = ProcessCpuSeconds(host.RunnerPid());
@@ -387,8 +424,14 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   // With no discovery running, the last stop_source ends the task and the
   // runner with it.
   result.runnerExit = host.Stop();
-  sink.CloseWav();
+  if (result.error.empty() && result.runnerExit != 0) {
+    result.error = "the runner exited with status " + std::to_string(result.runnerExit);
+  }
+  const bool wavComplete = sink.CloseWav();
   result.stats = stats.Snapshot(SteadyNs());
+  if (!options.wav.empty() && !wavComplete && result.error.empty()) {
+    result.error = (result.stats.audioBuffers == 0 ? "no sound for " : "the sound could not be written to ") + options.wav;
+  }
   result.stats.badRecords = std::max(result.stats.badRecords, session.BadRecords());
   if (!options.snapshot.empty()) {
     Picture picture = sink.TakePicture();
@@ -402,15 +445,17 @@ ReceiveResult Receive(const ReceiveOptions& options) {
 }
 
 int RunDemo(const DemoOptions& options) {
+  // With --json the one JSON document is the only thing on `out`; every
+  // other line goes to `err`.
+  std::FILE* info = options.json ? options.err : options.out;
   std::string pattern = (std::filesystem::temp_directory_path() / "pm-host-demo-XXXXXX").string();
   if (::mkdtemp(pattern.data()) == nullptr) {
-    std::fprintf(options.out, "pm-host demo: cannot make a temporary folder\n");
+    std::fprintf(options.err, "pm-host demo: cannot make a temporary folder\n");
     return 1;
   }
   const std::string folder = pattern;
   const std::string registry = folder + "/registry";
-  const std::string senderPath =
-      options.senderPath.empty() ? ProgramDirectory() + "../ndi-testsrc/ndi-testsrc" : options.senderPath;
+  const std::string senderPath = options.senderPath.empty() ? Locate(Companion::Sender) : options.senderPath;
 
   std::mutex readyLock;  // guards senderName
   std::condition_variable readyChanged;
@@ -433,8 +478,8 @@ int RunDemo(const DemoOptions& options) {
   };
   int status = 1;
   std::error_code ignored;
-  if (!sender.Start(child)) {
-    std::fprintf(options.out, "pm-host demo: cannot start the sender %s\n", senderPath.c_str());
+  if (senderPath.empty() || !sender.Start(child)) {
+    std::fprintf(options.err, "pm-host demo: cannot start the sender %s\n", senderPath.c_str());
     std::filesystem::remove_all(folder, ignored);
     return 1;
   }
@@ -445,11 +490,11 @@ int RunDemo(const DemoOptions& options) {
     name = senderName;
   }
   if (name.empty()) {
-    std::fprintf(options.out, "pm-host demo: the sender did not start\n");
+    std::fprintf(options.err, "pm-host demo: the sender did not start\n");
   } else {
-    std::fprintf(options.out, "pm-host demo: sending colour bars and a 1 kHz tone as '%s'; receiving for %.0f s\n",
+    std::fprintf(info, "pm-host demo: sending colour bars and a 1 kHz tone as '%s'; receiving for %.0f s\n",
                  name.c_str(), options.seconds);
-    std::fflush(options.out);
+    std::fflush(info);
     std::atomic<std::uint64_t> goodPictures{0}, badPictures{0}, goodSound{0}, badSound{0};
     std::mutex firstLock;  // guards firstProblem
     std::string firstProblem;
@@ -467,7 +512,7 @@ int RunDemo(const DemoOptions& options) {
     receive.seconds = options.seconds;
     receive.snapshot = options.png;
     receive.progress = options.progress;
-    receive.out = options.out;
+    receive.out = info;
     receive.interrupted = options.interrupted;
     receive.onVideo = [&](const VideoFrame& frame) {
       const std::string check = CheckBars(frame);
@@ -480,14 +525,30 @@ int RunDemo(const DemoOptions& options) {
       if (!check.empty()) problem("sound: " + check);
     };
     const ReceiveResult result = Receive(receive);
+    // The snapshot on disk must show the bars too.
+    if (result.exitStatus == 0) {
+      const std::string check = CheckBarsPng(options.png);
+      if (!check.empty()) problem("snapshot " + options.png + ": " + check);
+    }
+    int left = 0;
+    for (const std::string& base : result.memoryBases) left += CountSegments(base);
+    const bool intact = result.exitStatus == 0 && goodPictures > 0 && badPictures == 0 && goodSound > 0 &&
+                        badSound == 0 && result.stats.badRecords == 0 && left == 0 && firstProblem.empty();
+    if (!result.error.empty()) std::fprintf(options.err, "pm-host demo: %s\n", result.error.c_str());
+    if (!firstProblem.empty()) std::fprintf(options.err, "pm-host demo: first damage seen: %s\n", firstProblem.c_str());
+    if (left > 0) std::fprintf(options.err, "pm-host demo: %d segments are left in /dev/shm\n", left);
     if (options.json) {
       json out = result.ToJson();
       out["pictures_intact"] = goodPictures.load();
       out["pictures_damaged"] = badPictures.load();
       out["sound_buffers_intact"] = goodSound.load();
       out["sound_buffers_damaged"] = badSound.load();
+      out["segments_left"] = left;
+      out["png"] = options.png;
+      out["passed"] = intact;
+      if (!firstProblem.empty()) out["first_damage"] = firstProblem;
       std::fprintf(options.out, "%s\n", out.dump().c_str());
-    } else {
+    } else if (!result.id.empty()) {
       std::fprintf(options.out, "%s\n", SummaryText(result).c_str());
       std::fprintf(options.out, "pictures intact: %llu of %llu; sound buffers intact: %llu of %llu\n",
                    static_cast<unsigned long long>(goodPictures.load()),
@@ -495,28 +556,23 @@ int RunDemo(const DemoOptions& options) {
                    static_cast<unsigned long long>(goodSound.load()),
                    static_cast<unsigned long long>(goodSound.load() + badSound.load()));
     }
-    if (!firstProblem.empty()) std::fprintf(options.out, "first damage seen: %s\n", firstProblem.c_str());
-    int left = 0;
-    for (const std::string& base : result.memoryBases) left += CountSegments(base);
-    if (left > 0) std::fprintf(options.out, "pm-host demo: %d segments are left in /dev/shm\n", left);
-    const bool intact = result.exitStatus == 0 && goodPictures > 0 && badPictures == 0 && goodSound > 0 &&
-                        badSound == 0 && result.stats.badRecords == 0 && left == 0;
     if (intact) {
-      std::fprintf(options.out, "pm-host demo: frames arrived intact; wrote %s\n", options.png.c_str());
+      std::fprintf(info, "pm-host demo: frames arrived intact; wrote %s\n", options.png.c_str());
       status = 0;
     } else {
       if (ownLog) {
         std::ifstream in(receive.host.runnerLog);
         std::stringstream text;
         text << in.rdbuf();
-        std::fprintf(options.out, "the runner's log:\n%s", text.str().c_str());
+        if (!text.str().empty()) std::fprintf(options.err, "the runner's log:\n%s", text.str().c_str());
       }
-      std::fprintf(options.out, "pm-host demo: FAILED\n");
+      std::fprintf(options.err, "pm-host demo: FAILED\n");
     }
   }
   sender.Terminate();
   std::filesystem::remove_all(folder, ignored);
   std::fflush(options.out);
+  std::fflush(options.err);
   return status;
 }
 

@@ -34,7 +34,7 @@ struct ListOptions {
 };
 
 // Runs discovery for options.seconds; returns 0, or 1 when the runner could
-// not be started.
+// not be started or did not end in order (it died during the run).
 int Discover(const ListOptions& options);
 
 struct ReceiveOptions {
@@ -63,7 +63,7 @@ struct ReceiveOptions {
 };
 
 struct ReceiveResult {
-  int exitStatus = 1;      // of the job: 0 when it ran to its end
+  int exitStatus = 1;      // of the job: 0 when it ran to its end and kept its outputs
   std::string id;          // the source's unique id
   std::string name;
   std::string error;       // why it did not run
@@ -80,21 +80,23 @@ ReceiveResult Receive(const ReceiveOptions& options);
 // when it cannot be read.
 double ProcessCpuSeconds(pid_t pid);
 
-// A one-line human summary.
+// A one-line human summary; empty when no source was resolved.
 std::string SummaryText(const ReceiveResult& result);
 
 struct DemoOptions {
   HostOptions host;
-  std::string senderPath;        // empty: ndi-testsrc beside this program
+  std::string senderPath;        // empty: ndi-testsrc found beside this program (locate.h)
   std::string png = "demo.png";
   double seconds = 5;
   Progress progress = Progress::None;
-  std::FILE* out = stdout;
+  std::FILE* out = stdout;       // the summary (with json: only the JSON document)
+  std::FILE* err = stderr;       // failures (with json: every other line too)
   const std::atomic<bool>* interrupted = nullptr;
   bool json = false;
 };
 
-// Returns the exit status: 0 only when pictures and sound arrived intact.
+// Returns the exit status: 0 only when pictures and sound arrived intact and
+// the snapshot on disk shows the bars.
 int RunDemo(const DemoOptions& options);
 
 }  // namespace pmhost

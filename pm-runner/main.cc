@@ -9,8 +9,10 @@
 // and exits 0.
 //
 // Exit status: 0 after an orderly end; 1 when the task did not stop within 5
-// seconds; 2 for a bad command line or a module that cannot be loaded; 3 when
-// the factory gives no task; 4 when a connection cannot be opened.
+// seconds (or the runner cannot set up its signal handling); 2 for a bad command line (a --module that names no file among
+// it); 3 when the module cannot run here (it cannot be loaded, has no
+// pmTask_Factory, or the factory gives no task); 4 when a connection cannot be
+// opened.
 //
 // Threads: the main thread does all the set-up and the shutdown; each
 // dispatcher has a receive thread (runs the task's handlers) and an expiry
@@ -54,8 +56,9 @@ pm::Context g_context;
 int g_wakeRead = -1;
 int g_wakeWrite = -1;
 
-constexpr int kExitBadSetup = 2;
-constexpr int kExitNoTask = 3;
+constexpr int kExitFailed = 1;
+constexpr int kExitUsage = 2;
+constexpr int kExitModuleCannotRun = 3;
 constexpr int kExitNoConnection = 4;
 constexpr auto kStopLimit = std::chrono::seconds(5);
 
@@ -136,7 +139,7 @@ class StopWatchdog {
     std::unique_lock<std::mutex> lock(mutex_);
     if (condition_.wait_for(lock, kStopLimit, [this] { return done_; })) return;
     pm::Log(pm::LogType::Normal, "", "pm-runner: the task did not stop within 5 seconds\n");
-    std::_Exit(1);
+    std::_Exit(kExitFailed);
   }
 
   std::mutex mutex_;  // guards done_
@@ -182,34 +185,38 @@ extern "C" __attribute__((visibility("default"))) pm::Context* QFProcessManageme
 }
 
 int main(int argc, char** argv) {
-  CLI::App app{"Runs a task module and connects it to its host."};
+  CLI::App app{"pm-runner: runs a task module and connects it to its host.\n"
+               "Exit status: 0 orderly end, 1 the task did not stop within 5 s, 2 a usage error,\n"
+               "3 the module cannot run here, 4 a connection cannot be opened."};
+  app.set_version_flag("--version", "pm-runner " PM_VERSION);
   std::string modulePath;
   std::vector<int> ports;
-  app.add_option("--module", modulePath, "the task module (shared library) to load")->required();
+  app.add_option("--module", modulePath, "the task module (shared library) to load")
+      ->required()
+      ->check(CLI::ExistingFile);
   app.add_option("--connect", ports, "a port on 127.0.0.1 to connect to; one dispatcher each")
       ->required()
       ->check(CLI::Range(1, 65535));
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
-    const int status = app.exit(e);
-    return status == 0 ? 0 : kExitBadSetup;
+    return app.exit(e) == 0 ? 0 : kExitUsage;
   }
 
   // Every line of the runner and of the task goes to stderr unchanged.
   pm::Context* context = pm::GetContext();
   context->logSink = [](pm::LogType, const char* line) { WriteToStderr(line); };
-  if (!InstallSignalHandlers()) return kExitBadSetup;
+  if (!InstallSignalHandlers()) return kExitFailed;
 
   void* module = ::dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (module == nullptr) {
     pm::Log(pm::LogType::Normal, "", "pm-runner: cannot load '%s': %s\n", modulePath.c_str(), ::dlerror());
-    return kExitBadSetup;
+    return kExitModuleCannotRun;
   }
   auto factory = reinterpret_cast<TaskFactory>(::dlsym(module, "pmTask_Factory"));
   if (factory == nullptr) {
     pm::Log(pm::LogType::Normal, "", "pm-runner: '%s' has no pmTask_Factory\n", modulePath.c_str());
-    return kExitBadSetup;
+    return kExitModuleCannotRun;
   }
 
   std::vector<std::shared_ptr<pm::RpcDispatcher>> dispatchers;
@@ -228,7 +235,7 @@ int main(int argc, char** argv) {
     if (base == nullptr) {
       pm::Log(pm::LogType::Normal, "", "pm-runner: pmTask_Factory of '%s' gave no task; it cannot run here\n",
               modulePath.c_str());
-      return kExitNoTask;
+      return kExitModuleCannotRun;
     }
     // Every task module's task derives from pm::Task.
     auto* task = static_cast<pm::Task*>(base);

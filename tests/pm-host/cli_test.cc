@@ -1,0 +1,183 @@
+// The command line of every program, run as programs: the exit statuses (0
+// success, 1 the job failed, 2 a usage error; pm-runner's own 3), host
+// options before and after the command, --version and --help, --json output
+// that is exactly one document, failures that exit non-zero; and
+// `pm-host demo` itself, whose snapshot must show the bars.
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+
+#include <fstream>
+#include <mutex>
+
+#include "e2e_support.h"
+#include "pm-host/checks.h"
+
+namespace {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+
+struct Output {
+  int status = -1;
+  std::string out, err;
+};
+
+std::string Replace(std::string text, const std::string& from, const std::string& to) {
+  for (std::size_t at = text.find(from); at != std::string::npos; at = text.find(from, at + to.size())) {
+    text.replace(at, from.size(), to);
+  }
+  return text;
+}
+
+// Runs a program to its end with standard output and error apart.
+Output RunProgram(const std::string& path, const std::vector<std::string>& args, const pmtest::Folder& folder) {
+  Output result;
+  std::mutex lock;  // guards result.out
+  {
+    pmhost::ChildProcess child;
+    pmhost::ChildOptions o;
+    o.path = path;
+    o.args = args;
+    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+    o.stderrPath = folder.path + "/stderr.txt";
+    o.captureStdout = true;
+    o.onLine = [&](const std::string& line) {
+      std::lock_guard<std::mutex> guard(lock);
+      result.out += line + "\n";
+    };
+    if (!child.Start(std::move(o))) return result;
+    result.status = child.Wait(90s).value_or(-2);
+  }  // joins the reader of standard output
+  std::ifstream in(folder.path + "/stderr.txt");
+  result.err.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+  return result;
+}
+
+enum class Program { Host, Runner, Testsrc };
+
+struct Case {
+  const char* name;
+  Program program;
+  // {runner} {module} {folder} {sender} {dying-runner} stand for paths and
+  // the running sender's name.
+  std::vector<std::string> args;
+  int status;
+  const char* out;  // nullptr: not checked; "": nothing; else a text it holds
+  const char* err = "";  // a text standard error holds
+  bool sender = false;   // a sender runs in the registry
+  bool json = false;     // standard output is exactly one JSON document
+};
+
+void PrintTo(const Case& c, std::ostream* os) { *os << c.name; }
+
+class CommandLine : public ::testing::TestWithParam<Case> {};
+
+TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
+  const Case& c = GetParam();
+  const pmtest::Programs& programs = pmtest::BuiltPrograms();
+  pmtest::Folder folder;
+  pmtest::Sender sender;
+  if (c.sender) {
+    ASSERT_TRUE(sender.Start(folder, "Cli", {"--width", "64", "--height", "16", "--fps", "60"}));
+  }
+  // Not a module; and a runner that dies (SIGKILL) once its task has started
+  // discovery for the host.
+  std::ofstream(folder.path + "/not-a-module.so") << "text";
+  const std::string dying = folder.path + "/dying-runner";
+  std::ofstream(dying) << "#!/bin/sh\n\"" << programs.runner << "\" \"$@\" 2>\"$0.log\" &\npid=$!\n"
+                       << "until grep -q 'creating discovery' \"$0.log\"; do sleep 0.05; done\n"
+                       << "kill -9 $pid\nwait $pid\n";
+  ::chmod(dying.c_str(), 0755);
+
+  std::vector<std::string> args;
+  for (std::string arg : c.args) {
+    arg = Replace(arg, "{runner}", programs.runner);
+    arg = Replace(arg, "{module}", programs.module);
+    arg = Replace(arg, "{folder}", folder.path);
+    arg = Replace(arg, "{dying-runner}", dying);
+    args.push_back(Replace(arg, "{sender}", c.sender ? sender.Name() : ""));
+  }
+  const std::string& path =
+      c.program == Program::Host ? programs.host : c.program == Program::Runner ? programs.runner : programs.testsrc;
+  const Output run = RunProgram(path, args, folder);
+  EXPECT_EQ(run.status, c.status) << run.err;
+  if (c.out != nullptr) {
+    EXPECT_TRUE(*c.out == '\0' ? run.out.empty() : run.out.find(c.out) != std::string::npos) << run.out;
+  }
+  EXPECT_NE(run.err.find(c.err), std::string::npos) << run.err;
+  if (c.json) {
+    const json document = json::parse(run.out, nullptr, false);
+    ASSERT_TRUE(document.is_object()) << run.out;
+    EXPECT_GE(document.value("frames", 0), 10) << run.out;
+    EXPECT_EQ(document.value("source", ""), sender.Name());
+  }
+}
+
+const std::vector<std::string> kHostOptions{"--runner", "{runner}", "--module", "{module}",
+                                            "--runner-log", "{folder}/runner.log"};
+
+std::vector<std::string> Join(std::vector<std::string> a, const std::vector<std::string>& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Programs, CommandLine,
+    ::testing::Values(
+        // --version and --help end with 0 and print to standard output; help
+        // shows the defaults.
+        Case{"HostVersion", Program::Host, {"--version"}, 0, "pm-host "},
+        Case{"RunnerVersion", Program::Runner, {"--version"}, 0, "pm-runner "},
+        Case{"TestsrcVersion", Program::Testsrc, {"--version"}, 0, "ndi-testsrc "},
+        Case{"HostHelp", Program::Host, {"--help"}, 0, "2 a usage error"},
+        Case{"ListHelp", Program::Host, {"list", "--help"}, 0, "NONNEGATIVE=5"},
+        Case{"ReceiveHelp", Program::Host, {"receive", "--help"}, 0, "=highest"},
+        Case{"DemoHelp", Program::Host, {"demo", "--help"}, 0, "=demo.png"},
+        Case{"RunnerHelp", Program::Runner, {"--help"}, 0, "--connect"},
+        Case{"TestsrcHelp", Program::Testsrc, {"--help"}, 0, "=1280"},
+        // Usage errors: 2 from every program, nothing on standard output.
+        Case{"HostWithoutCommand", Program::Host, {}, 2, "", "subcommand is required"},
+        Case{"HostUnknownCommand", Program::Host, {"play"}, 2, ""},
+        Case{"HostNegativeSeconds", Program::Host, {"list", "--seconds", "-1"}, 2, "", "--seconds"},
+        Case{"HostSecondsAndFrames", Program::Host, {"receive", "x", "--seconds", "1", "--frames", "1"}, 2, ""},
+        Case{"HostRunnerAfterCommandMissing", Program::Host, {"receive", "x", "--runner", "{folder}/none"}, 2, "",
+             "--runner"},
+        Case{"HostBadPtz", Program::Host, {"receive", "x", "--ptz", "[1]"}, 2, "", "not a JSON object"},
+        Case{"RunnerWithoutConnect", Program::Runner, {"--module", "{module}"}, 2, ""},
+        Case{"RunnerModuleMissing", Program::Runner, {"--module", "{folder}/none.so", "--connect", "1"}, 2, ""},
+        Case{"TestsrcWithoutName", Program::Testsrc, {"--width", "64"}, 2, "", "--name"},
+        Case{"TestsrcBadRate", Program::Testsrc, {"--name", "x", "--fps", "fast"}, 2, "", "--fps"},
+        // Jobs that fail.
+        Case{"RunnerModuleCannotRun", Program::Runner, {"--module", "{folder}/not-a-module.so", "--connect", "1"}, 3,
+             "", "cannot load"},
+        Case{"ReceiveWavCannotBeWritten", Program::Host,
+             Join({"receive", "{sender}", "--seconds", "1", "--wav", "{folder}/none/x.wav"}, kHostOptions), 1, "",
+             "cannot write", true},
+        Case{"ListRunnerDies", Program::Host, {"list", "--seconds", "60", "--runner", "{dying-runner}"}, 1, nullptr,
+             "during the run"},
+        Case{"ReceiveNoSuchSource", Program::Host, Join({"receive", "nobody", "--seconds", "1"}, kHostOptions), 1,
+             "", "no source matches"},
+        // The host options before and after the command.
+        Case{"ListOptionsAfter", Program::Host, Join({"list", "--seconds", "1"}, kHostOptions), 0, "+ ", "", true},
+        Case{"ListOptionsBefore", Program::Host, Join(kHostOptions, {"list", "--seconds", "1"}), 0, "+ ", "", true},
+        Case{"ReceiveJson", Program::Host,
+             Join({"receive", "{sender}", "--frames", "10", "--json", "--wav", "{folder}/x.wav"}, kHostOptions), 0,
+             "\"frames\"", "", true, true}),
+    [](const ::testing::TestParamInfo<Case>& info) { return std::string(info.param.name); });
+
+TEST(Demo, RunsIntactAndItsSnapshotShowsTheBars) {
+  pmtest::Folder folder;
+  const std::string png = folder.path + "/demo.png";
+  const Output run = RunProgram(pmtest::BuiltPrograms().host, {"demo", "--json", "--png", png}, folder);
+  EXPECT_EQ(run.status, 0) << run.err;
+  const json document = json::parse(run.out, nullptr, false);
+  ASSERT_TRUE(document.is_object()) << run.out;
+  EXPECT_EQ(document.value("passed", false), true) << run.out;
+  EXPECT_GT(document.value("pictures_intact", 0), 0) << run.out;
+  EXPECT_EQ(document.value("pictures_damaged", 1), 0) << run.out;
+  EXPECT_EQ(pmhost::CheckBarsPng(png), "");
+  EXPECT_NE(run.err.find("frames arrived intact"), std::string::npos) << run.err;
+}
+
+}  // namespace
