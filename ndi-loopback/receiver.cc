@@ -37,13 +37,17 @@ int MaxOf(int slot) {
 
 }  // namespace
 
-std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values) {
-  std::string xml = std::string("<ptz_command name=\"") + name + "\"";
-  for (const auto& [key, value] : values) {
-    char number[64];
-    std::snprintf(number, sizeof number, "%.9g", value);
-    xml += std::string(" ") + key + "=\"" + number + "\"";
-  }
+PtzValue PtzNumber(const char* key, double value) {
+  char number[64];
+  std::snprintf(number, sizeof number, "%f", value);
+  return {key, number};
+}
+
+PtzValue PtzInteger(const char* key, int value) { return {key, std::to_string(value)}; }
+
+std::string PtzXml(const char* element, std::initializer_list<PtzValue> values) {
+  std::string xml = std::string("<ntk_ptz_") + element;
+  for (const PtzValue& v : values) xml += std::string(" ") + v.key + "=\"" + v.text + "\"";
   return xml + "/>";
 }
 
@@ -53,6 +57,12 @@ Receiver::Receiver(const ndi_recv_create& settings)
       bandwidth_(settings.bandwidth),
       pool_(std::make_shared<BufferPool>(4)) {
   wake_fd_ = MakeWakeFd();
+  // As with the vendor runtime, the first capture reports a status change
+  // at once, before any connection; a later one comes with each connection
+  // whose sender takes PTZ.
+  auto created = std::make_unique<Item>();
+  created->type = kNdiFrameStatusChange;
+  Enqueue(std::move(created));
   thread_ = std::thread([this] { Run(); });
 }
 
@@ -150,6 +160,7 @@ void Receiver::Serve(int fd) {
         case MessageType::Ready:
           ptz_ = message->ptz_supported;
           connected_ = true;
+          if (!message->ptz_supported) continue;
           item->type = kNdiFrameStatusChange;
           break;
         default:
@@ -298,9 +309,11 @@ bool Receiver::WriteMessage(const void* head, std::size_t head_size, const std::
 bool Receiver::SetTally(const ndi_tally& tally) {
   std::lock_guard<std::mutex> lock(write_mutex_);
   tally_ = tally;  // also sent with the hello of every later connection
-  if (!connected_) return false;
+  // Taken whether or not a sender is connected, as the vendor runtime does.
+  if (!connected_) return true;
   EncodedHead head = EncodeTally(tally.on_program, tally.on_preview);
-  return WriteMessage(head.bytes, head.size, std::string());
+  WriteMessage(head.bytes, head.size, std::string());
+  return true;
 }
 
 bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
@@ -311,14 +324,15 @@ bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
   if (text.size() > (1u << 20)) return false;
   std::lock_guard<std::mutex> lock(write_mutex_);
   if (!connected_) return false;
-  const std::int64_t timecode = frame.timecode == kNdiSendTimecodeSynthesize ? NowTimestamp() : frame.timecode;
-  EncodedHead head = EncodeMetadata(MessageType::Metadata, timecode, static_cast<std::uint32_t>(text.size()));
+  // The timecode goes as given: the vendor runtime does not make one up on
+  // this side.
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, frame.timecode, static_cast<std::uint32_t>(text.size()));
   return WriteMessage(head.bytes, head.size, text);
 }
 
 bool Receiver::SendPtz(const std::string& xml) {
   std::lock_guard<std::mutex> lock(write_mutex_);
-  if (!connected_ || !ptz_) return false;
+  if (!connected_) return false;
   EncodedHead head = EncodeMetadata(MessageType::Metadata, 0, static_cast<std::uint32_t>(xml.size()));
   return WriteMessage(head.bytes, head.size, xml);
 }

@@ -47,8 +47,8 @@ class Receiver {
   bool SetTally(const ndi_tally& tally);
   bool SendMetadata(const ndi_metadata_frame& frame);
   bool PtzSupported() const { return connected_.load() && ptz_.load(); }
-  // Sends a PTZ command document; false when not connected or the sender
-  // does not accept PTZ.
+  // Sends a PTZ command document; false when not connected. As with the
+  // vendor runtime, it goes out whether or not the sender said it takes PTZ.
   bool SendPtz(const std::string& xml);
 
  private:
@@ -85,8 +85,15 @@ class Receiver {
   std::map<const void*, std::unique_ptr<Item>> held_;  // captured, not yet freed
 };
 
-// The PTZ command document of the loopback runtime:
-// <ptz_command name="NAME" key="value" .../> with values printed "%.9g".
-std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values);
+// A PTZ command as the sender sees it through NDIlib_send_capture, in the
+// vendor runtime's words: <ntk_ptz_ELEMENT key="value" .../>, attributes in
+// the given order; numbers are printed "%f" (presets as integers).
+struct PtzValue {
+  const char* key;
+  std::string text;
+};
+PtzValue PtzNumber(const char* key, double value);
+PtzValue PtzInteger(const char* key, int value);
+std::string PtzXml(const char* element, std::initializer_list<PtzValue> values);
 
 }  // namespace ndilb

@@ -116,16 +116,17 @@ std::set<std::string> UrlsOf(const std::string& full_name) {
   return urls;
 }
 
-// One metadata text from a receiver: a PTZ command or plain metadata.
+// One metadata text from a receiver: a PTZ command (an <ntk_ptz_NAME .../>
+// element, reported as command NAME with its attributes, numbers as numbers)
+// or plain metadata.
 void ReportMetadata(const std::string& xml) {
+  static constexpr char kPtzPrefix[] = "ntk_ptz_";
   tinyxml2::XMLDocument doc;
   if (doc.Parse(xml.c_str(), xml.size()) == tinyxml2::XML_SUCCESS && doc.RootElement() != nullptr &&
-      std::strcmp(doc.RootElement()->Name(), "ptz_command") == 0) {
+      std::strncmp(doc.RootElement()->Name(), kPtzPrefix, sizeof kPtzPrefix - 1) == 0) {
     const tinyxml2::XMLElement* root = doc.RootElement();
-    const char* command = root->Attribute("name");
     nlohmann::json values = nlohmann::json::object();
     for (const tinyxml2::XMLAttribute* a = root->FirstAttribute(); a != nullptr; a = a->Next()) {
-      if (std::strcmp(a->Name(), "name") == 0) continue;
       double v = 0;
       if (a->QueryDoubleValue(&v) == tinyxml2::XML_SUCCESS) {
         values[a->Name()] = v;
@@ -133,7 +134,7 @@ void ReportMetadata(const std::string& xml) {
         values[a->Name()] = a->Value();
       }
     }
-    Emit({{"event", "ptz"}, {"command", command != nullptr ? command : ""}, {"values", values}, {"xml", xml}});
+    Emit({{"event", "ptz"}, {"command", root->Name() + sizeof kPtzPrefix - 1}, {"values", values}, {"xml", xml}});
     return;
   }
   Emit({{"event", "metadata"}, {"xml", xml}});
@@ -265,7 +266,7 @@ int Run(const Options& o) {
     doc.Print(&printer);
     add_connection_metadata(printer.CStr());
   }
-  if (o.ptz) add_connection_metadata("<ptz_capabilities supported=\"true\"/>");
+  if (o.ptz) add_connection_metadata("<ndi_capabilities ntk_ptz=\"true\"/>");
 
   Emit({{"event", "ready"}, {"name", full_name}, {"url", FindOwnUrl(full_name, before)}});
 
