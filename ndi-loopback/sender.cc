@@ -174,21 +174,21 @@ bool Sender::Handle(Conn& conn, Message& m) {
       conn.on_preview = m.on_preview;
     }
     bool ptz = false;
+    for (const std::string& xml : metadata) ptz = ptz || AnnouncesPtz(xml);
     {
+      // As with the vendor runtime, the receiver learns PTZ support (Ready,
+      // a status change) before it captures the connection metadata.
       std::lock_guard<std::mutex> lock(conn.write_mutex);
-      for (const std::string& xml : metadata) {
-        if (AnnouncesPtz(xml)) {
-          ptz = true;
-          continue;
-        }
-        EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, 0, static_cast<std::uint32_t>(xml.size()));
-        iovec iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
-        if (conn.dead || !WriteAll(conn.fd, iov, 2)) return false;
-      }
-      if (!WriteTallyEcho(conn, m.on_program, m.on_preview)) return false;
       EncodedHead ready = EncodeReady(ptz);
       iovec iov[1] = {Iov(ready.bytes, ready.size)};
       if (conn.dead || !WriteAll(conn.fd, iov, 1)) return false;
+      for (const std::string& xml : metadata) {
+        if (AnnouncesPtz(xml)) continue;
+        EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, 0, static_cast<std::uint32_t>(xml.size()));
+        iovec parts[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+        if (conn.dead || !WriteAll(conn.fd, parts, 2)) return false;
+      }
+      if (!WriteTallyEcho(conn, m.on_program, m.on_preview)) return false;
     }
     std::lock_guard<std::mutex> lock(mutex_);
     conn.active = true;
