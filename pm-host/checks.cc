@@ -179,6 +179,7 @@ BlocksReading ReadBlocks(const VideoFrame& frame, int tolerance) {
     r.problem = "picture code " + CodeText(frame.code) + " is not one blocks are read from";
     return r;
   }
+  if (tolerance < 0) tolerance = yuv ? 16 : 32;
   const int w = frame.width, h = frame.height;
   const std::uint64_t rows = frame.code == pm::kCodeNV12 ? static_cast<std::uint64_t>(h) * 3 / 2 : h;
   const std::uint64_t rowBytes = static_cast<std::uint64_t>(w) * (frame.code == pm::kCode2vuy ? 2 : frame.code == pm::kCodeNV12 ? 1 : 4);

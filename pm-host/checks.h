@@ -35,11 +35,14 @@ std::string CheckRampSound(const AudioFrame& frame, std::int64_t* firstSample, f
 // proxy too): the average of the middle of each bar is within `tolerance` of
 // the bar's colour in every channel, and the cells, each read from its
 // middle, give a number whose check bits hold. Made for pictures that went
-// through a lossy codec or a colour conversion.
+// through a lossy codec or a colour conversion. The default tolerance is 16
+// for YUV pictures and 32 for RGB ones: the vendor runtime's YUV to RGB
+// conversion puts the green of the cyan and green bars up to 24 above their
+// BT.709 values.
 struct BlocksReading {
   std::int64_t number = -1;  // the frame number's low 32 bits; -1 when unreadable
   std::string problem;       // empty when the bars and the number are right
 };
-BlocksReading ReadBlocks(const VideoFrame& frame, int tolerance = 16);
+BlocksReading ReadBlocks(const VideoFrame& frame, int tolerance = -1);
 
 }  // namespace pmhost
