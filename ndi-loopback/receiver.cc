@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "ndi-loopback/net.h"
+#include "ndi-loopback/picture.h"
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/sender.h"
 #include "pm/runtime/log.h"
@@ -55,6 +56,7 @@ Receiver::Receiver(const ndi_recv_create& settings)
     : name_(settings.source_to_connect_to.ndi_name != nullptr ? settings.source_to_connect_to.ndi_name : ""),
       url_(settings.source_to_connect_to.url_address != nullptr ? settings.source_to_connect_to.url_address : ""),
       bandwidth_(settings.bandwidth),
+      color_format_(settings.color_format),
       pool_(std::make_shared<BufferPool>(4)) {
   wake_fd_ = MakeWakeFd();
   // As with the vendor runtime, the first capture reports a status change
@@ -147,6 +149,7 @@ void Receiver::Serve(int fd) {
       switch (message->type) {
         case MessageType::Video:
           if (bandwidth_ == kNdiBandwidthAudioOnly || bandwidth_ == kNdiBandwidthMetadataOnly) continue;
+          if (!Deliverable(*message)) continue;
           item->type = kNdiFrameVideo;
           break;
         case MessageType::Audio:
@@ -176,6 +179,27 @@ void Receiver::Serve(int fd) {
     fd_ = -1;
   }
   // Frames of the connection that are still queued stay capturable.
+}
+
+bool Receiver::Deliverable(Message& m) {
+  VideoInfo& v = m.video;
+  const bool alpha = HasAlpha(v.fourcc, v.xres, v.yres, v.line_stride, m.payload.data());
+  const std::uint32_t to = DeliveredFourCC(color_format_, alpha);
+  const int stride = DeliveredStride(to, v.xres);
+  if (to == v.fourcc && stride == v.line_stride) return true;  // as it came
+  const std::uint64_t bytes = PictureBytes(to, v.xres, v.yres, stride);
+  Buffer out = bytes > 0 ? pool_->Acquire(static_cast<std::size_t>(bytes)) : Buffer();
+  if (!out || !ConvertPicture(v.fourcc, v.xres, v.yres, v.line_stride, m.payload.data(), to, stride, out.data())) {
+    if (out) pool_->Release(std::move(out));
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: receiver of %s dropped a %dx%d picture it cannot deliver",
+            name_.empty() ? url_.c_str() : name_.c_str(), v.xres, v.yres);
+    return false;
+  }
+  pool_->Release(std::move(m.payload));
+  m.payload = std::move(out);
+  v.fourcc = to;
+  v.line_stride = stride;
+  return true;
 }
 
 void Receiver::Enqueue(std::unique_ptr<Item> item) {

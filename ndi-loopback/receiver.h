@@ -3,7 +3,8 @@
 // receiver ("ndi-lb receiver") finds the sender by name in the registry,
 // connects, and reads frames straight into pooled buffers; whole frames go
 // into a bounded queue (the oldest frame of a kind is dropped when full) from
-// which Capture hands them out. When the sender goes, the thread looks the
+// which Capture hands them out, in the FourCC and stride the vendor runtime
+// would deliver for the receiver's colour format (picture.h). When the sender goes, the thread looks the
 // name up again every 150 ms and reconnects, also to a new URL.
 //
 // Threads: any thread may call the public operations; the network thread is
@@ -62,11 +63,16 @@ class Receiver {
   // Reads until the connection ends or the receiver stops.
   void Serve(int fd);
   void Enqueue(std::unique_ptr<Item> item);
+  // Turns a received picture into what the vendor runtime would deliver for
+  // this receiver's colour format (FourCC, 16-pixel stride); false when it
+  // cannot (the frame is dropped).
+  bool Deliverable(Message& message);
   bool WriteMessage(const void* head, std::size_t head_size, const std::string& text);
 
   const std::string name_;
   const std::string url_;
   const std::int32_t bandwidth_;
+  const std::int32_t color_format_;
   const std::shared_ptr<BufferPool> pool_;
   int wake_fd_ = -1;
   std::atomic<bool> stop_{false};

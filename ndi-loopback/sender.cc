@@ -338,26 +338,33 @@ void Sender::SendVideo(const ndi_video_frame_v2& frame) {
   if (text.size() > (1u << 20)) return;
 
   const auto conns = ActiveConns();
-  HalfPicture half;
-  bool half_done = false, half_ok = false;
+  // "lowest": the vendor runtime's proxy size, made once per frame when a
+  // receiver asks for it (a picture that fits goes as it is).
+  int proxy_width = 0, proxy_height = 0;
+  ProxySize(frame.xres, frame.yres, &proxy_width, &proxy_height);
+  const bool proxy_same = proxy_width == frame.xres && proxy_height == frame.yres;
+  ScaledPicture proxy;
+  bool proxy_done = false, proxy_ok = false;
   for (const auto& c : conns) {
-    if (c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly) {
+    const bool full = c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly;
+    if (full || (c->bandwidth == kNdiBandwidthLowest && proxy_same)) {
       EncodedHead head = EncodeVideo(info, static_cast<std::uint32_t>(text.size()), bytes);
       iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(frame.data, bytes)};
       WriteTo(*c, iov, 3);
     } else if (c->bandwidth == kNdiBandwidthLowest) {
-      if (!half_done) {
-        half_done = true;
-        half_ok = HalvePicture(frame.FourCC, frame.xres, frame.yres, stride, frame.data, &half);
+      if (!proxy_done) {
+        proxy_done = true;
+        proxy_ok = ScalePicture(frame.FourCC, frame.xres, frame.yres, stride, frame.data, proxy_width, proxy_height,
+                                &proxy);
       }
-      if (!half_ok) continue;
+      if (!proxy_ok) continue;
       VideoInfo small = info;
-      small.xres = half.xres;
-      small.yres = half.yres;
-      small.line_stride = half.stride;
-      EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), half.bytes.size());
+      small.xres = proxy.xres;
+      small.yres = proxy.yres;
+      small.line_stride = proxy.stride;
+      EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), proxy.bytes.size());
       iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()),
-                      Iov(half.bytes.data(), half.bytes.size())};
+                      Iov(proxy.bytes.data(), proxy.bytes.size())};
       WriteTo(*c, iov, 3);
     }
     // audio only and metadata only: no video
