@@ -334,7 +334,9 @@ bool Receiver::SetTally(const ndi_tally& tally) {
   std::lock_guard<std::mutex> lock(write_mutex_);
   tally_ = tally;  // also sent with the hello of every later connection
   // Taken whether or not a sender is connected, as the vendor runtime does.
-  if (!connected_) return true;
+  // Once the hello is out (fd_ is set under this lock right after it), the
+  // change must follow it on the wire even before the sender's Ready.
+  if (fd_ < 0) return true;
   EncodedHead head = EncodeTally(tally.on_program, tally.on_preview);
   WriteMessage(head.bytes, head.size, std::string());
   return true;
