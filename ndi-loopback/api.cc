@@ -169,10 +169,10 @@ NDILB_EXPORT bool NDIlib_recv_ptz_pan_tilt_speed(void* receiver, float pan_speed
 NDILB_EXPORT bool NDIlib_recv_ptz_zoom(void* receiver, float zoom) {
   return ndilb::Ptz(receiver, PtzXml("zoom", {PtzNumber("zoom", zoom)}));
 }
-// The vendor runtime names the speed "distance" too.
 NDILB_EXPORT bool NDIlib_recv_ptz_focus(void* receiver, float focus) {
   return ndilb::Ptz(receiver, PtzXml("focus", {{"mode", "manual"}, PtzNumber("distance", focus)}));
 }
+// The vendor runtime calls the speed "distance" too.
 NDILB_EXPORT bool NDIlib_recv_ptz_focus_speed(void* receiver, float focus_speed) {
   return ndilb::Ptz(receiver, PtzXml("focus_speed", {{"mode", "manual"}, PtzNumber("distance", focus_speed)}));
 }

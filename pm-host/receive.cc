@@ -352,6 +352,9 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   bool printedTerminal = false;
   for (;;) {
     StatsSnapshot now = stats.Snapshot(SteadyNs(), /*latency=*/false);
+    if (now.frames > 0 && result.runnerCpuAtFirstPicture == 0) {
+      result.runnerCpuAtFirstPicture = ProcessCpuSeconds(host.RunnerPid());
+    }
     if (!commandsSent && (now.state == 2 || now.frames > 0 || now.audioBuffers > 0 || elapsed() > 5)) {
       commandsSent = true;
       if (options.tally == "live" || options.tally == "both") session.ShotEvent(match.id, "TALLY_LIVE_ON");

@@ -70,6 +70,7 @@ struct ReceiveResult {
   int runnerExit = -1;
   double runnerCpuSeconds = 0;           // user + system time of pm-runner, read before stop_source
   double firstPictureSeconds = -1;       // from sending start_source to reading the first picture; -1: none
+  double runnerCpuAtFirstPicture = 0;    // runnerCpuSeconds as it was when the first picture was read (20 ms)
   std::vector<std::string> memoryBases;  // of the source's queue (its segments' names start so)
   StatsSnapshot stats;
   nlohmann::json ToJson() const;

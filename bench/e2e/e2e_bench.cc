@@ -1,10 +1,11 @@
 // The whole chain between processes, on the NDI runtime this build's task
 // loads (the loopback runtime, or the vendor's: then run it inside
 // scripts/ndi-sandbox). A sender (this program again, "--sender NAME W H FPS
-// FRAMES") sends exactly FRAMES pictures of W x H UYVY "blocks" (colour bars
-// and the picture number in cells that survive lossy compression) at FPS,
-// each with one picture's worth of 48 kHz stereo sound, once a receiver is
-// connected. pm-runner with the task module receives them; the host library
+// FRAMES") sends exactly FRAMES counted pictures of W x H UYVY "blocks"
+// (colour bars and the picture number in cells that survive lossy
+// compression) at FPS, each with one picture's worth of 48 kHz stereo sound,
+// from half a second after a receiver connected (before that it sends
+// uncounted pictures, so that the receiver meets a live sender). pm-runner with the task module receives them; the host library
 // reads them from shared memory. Then, in the same run, the same stream goes
 // to a bare receive loop (this program again, "--bare NAME FRAMES"): the same
 // runtime and receiver settings, capture and free only.
@@ -16,8 +17,8 @@
 //   first_picture_ms                               start_source sent to the
 //        first picture read by the host (the sender already on the network)
 //   runner_cpu_ms_per_frame                        pm-runner's user+system time
-//                                                  per received picture
-//   bare_cpu_ms_per_frame                          the bare loop's, per picture
+//        from its first picture to its last, per picture in between
+//   bare_cpu_ms_per_frame                          the bare loop's, the same way
 //   cpu_vs_bare                                    the ratio of the two
 // With two sources the figures are summed (pictures, CPU) or the larger one
 // (first picture, latency) over both.
@@ -33,6 +34,7 @@
 #include <cstring>
 #include <filesystem>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <thread>
@@ -77,11 +79,18 @@ int RunSender(const std::string& name, int width, int height, int fps, std::int6
   const ndits::Bars blocks(kNdiFourCCUYVY, width, height, true);
   const int samples = 48000 / fps;
   std::vector<float> sound(static_cast<std::size_t>(samples) * 2);
-  // Once a receiver is there, and a moment for it to set up.
-  NDIlib_send_get_no_connections(sender, 30000);
-  std::this_thread::sleep_for(500ms);
+  // Until a receiver is there, and for a moment while it sets up, the
+  // sender already sends, at its pace, pictures numbered kIdle (not counted):
+  // the first picture a receiver sees comes from a live sender. Then the
+  // FRAMES counted pictures 0, 1, ...
+  constexpr std::int64_t kIdle = 0x7FFFFFFF;
+  const auto giveUp = std::chrono::steady_clock::now() + 60s;
+  std::optional<std::chrono::steady_clock::time_point> counted;
   std::int64_t t = 0;
-  for (std::int64_t n = 0; n < frames; ++n) {
+  for (std::int64_t n = 0; n < frames;) {
+    const auto now = std::chrono::steady_clock::now();
+    if (!counted && (NDIlib_send_get_no_connections(sender, 0) > 0 || now > giveUp)) counted = now + 500ms;
+    const bool live = counted && now >= *counted;
     for (int c = 0; c < 2; ++c) {
       for (int s = 0; s < samples; ++s) sound[static_cast<std::size_t>(c) * samples + s] = ndits::AudioRampSample(t + s, c);
     }
@@ -94,7 +103,7 @@ int RunSender(const std::string& name, int width, int height, int fps, std::int6
     a.data = sound.data();
     a.channel_stride_in_bytes = samples * 4;
     NDIlib_send_send_audio_v2(sender, &a);
-    blocks.Fill(n, picture.data());
+    blocks.Fill(live ? n : kIdle, picture.data());
     ndi_video_frame_v2 f{};
     f.xres = width;
     f.yres = height;
@@ -106,6 +115,7 @@ int RunSender(const std::string& name, int width, int height, int fps, std::int6
     f.data = picture.data();
     f.line_stride_in_bytes = width * 2;
     NDIlib_send_send_video_v2(sender, &f);  // paced by the runtime
+    if (live) ++n;
   }
   std::this_thread::sleep_for(500ms);
   NDIlib_send_destroy(sender);
@@ -114,8 +124,8 @@ int RunSender(const std::string& name, int width, int height, int fps, std::int6
 }
 
 // The baseline: what the task's receiver does minus the task's own work.
-// Prints {"pictures":N,"cpu_seconds":S} when FRAMES pictures came, or 60 s
-// went by.
+// Prints {"pictures":N,"cpu_seconds":S} once the sender stopped (a second
+// without pictures), FRAMES pictures came, or 60 s went by.
 int RunBare(const std::string& name, std::int64_t frames) {
   if (!NDIlib_initialize()) return 1;
   ndi_find_create find{true, nullptr, nullptr};
@@ -136,22 +146,29 @@ int RunBare(const std::string& name, std::int64_t frames) {
   ndi_recv_create settings{{full.c_str(), url.c_str()}, kNdiColorUyvyBgra, kNdiBandwidthHighest, false};
   void* receiver = NDIlib_recv_create_v2(&settings);
   std::int64_t pictures = 0;
-  while (receiver != nullptr && pictures < frames && std::chrono::steady_clock::now() < deadline) {
+  double cpuAtFirst = 0, cpuAtLast = 0;
+  auto last = std::chrono::steady_clock::now();
+  // Until the sender has stopped (a second without pictures) or FRAMES came.
+  while (receiver != nullptr && pictures < frames && std::chrono::steady_clock::now() < deadline &&
+         (pictures == 0 || std::chrono::steady_clock::now() - last < 1s)) {
     ndi_video_frame_v2 v{};
     ndi_audio_frame_v2 a{};
     ndi_metadata_frame m{};
     switch (NDIlib_recv_capture_v2(receiver, &v, &a, &m, 250)) {
       case kNdiFrameVideo:
-        ++pictures;
         NDIlib_recv_free_video_v2(receiver, &v);
+        if (++pictures == 1) cpuAtFirst = OwnCpuSeconds();
+        cpuAtLast = OwnCpuSeconds();
+        last = std::chrono::steady_clock::now();
         break;
       case kNdiFrameAudio: NDIlib_recv_free_audio_v2(receiver, &a); break;
       case kNdiFrameMetadata: NDIlib_recv_free_metadata(receiver, &m); break;
       default: break;
     }
   }
-  const double cpu = OwnCpuSeconds();
-  std::printf("%s\n", nlohmann::json{{"pictures", pictures}, {"cpu_seconds", cpu}}.dump().c_str());
+  // From the first picture to the last: the set-up and the wait for the end
+  // are left out, as for the runner.
+  std::printf("%s\n", nlohmann::json{{"pictures", pictures}, {"cpu_seconds", cpuAtLast - cpuAtFirst}}.dump().c_str());
   std::fflush(stdout);
   if (receiver != nullptr) NDIlib_recv_destroy(receiver);
   NDIlib_find_destroy(finder);
@@ -175,7 +192,8 @@ bool StartSender(Stream& s, const std::string& registry, int width, int height, 
 }
 
 struct ChainFigures {
-  std::int64_t received = 0;
+  std::int64_t received = 0;  // counted pictures
+  std::int64_t read = 0;      // every picture the host read
   double p50 = 0, p99 = 0, firstMs = 0, runnerCpu = 0;
   std::string error;
 };
@@ -192,8 +210,7 @@ ChainFigures ThroughTheTask(Stream& s, const std::string& folder, std::int64_t f
   o.host.runnerLog = folder + "/runner-" + s.name + ".log";
   o.source = FullName(s.name);
   o.discoverySeconds = 20;
-  o.frames = frames;
-  o.seconds = 60;
+  o.seconds = 90;  // ends when the sender has sent everything (below)
   o.interrupted = &stop;
   o.out = stderr;
   o.onVideo = [&](const pmhost::VideoFrame& f) {
@@ -216,10 +233,11 @@ ChainFigures ThroughTheTask(Stream& s, const std::string& folder, std::int64_t f
     std::lock_guard<std::mutex> guard(lock);
     f.received = static_cast<std::int64_t>(seen.size());
   }
+  f.read = static_cast<std::int64_t>(result.stats.frames);
   f.p50 = result.stats.p50Ms;
   f.p99 = result.stats.p99Ms;
   f.firstMs = result.firstPictureSeconds * 1000;
-  f.runnerCpu = result.runnerCpuSeconds;
+  f.runnerCpu = result.runnerCpuSeconds - result.runnerCpuAtFirstPicture;
   f.error = result.error;
   return f;
 }
@@ -235,7 +253,7 @@ BareFigures Bare(Stream& s, const std::string& registry, std::int64_t frames) {
   pmhost::ChildProcess bare;
   pmhost::ChildOptions child;
   child.path = g_self;
-  child.args = {"--bare", s.name, std::to_string(frames)};
+  child.args = {"--bare", s.name, std::to_string(2 * frames)};
   child.env = {{"NDI_LOOPBACK_DIR", registry}};
   child.captureStdout = true;
   child.onLine = [&](const std::string& line) {
@@ -301,11 +319,12 @@ void Chain(benchmark::State& state, int width, int height, int fps, int seconds,
       }
       for (auto& t : runs) t.join();
     }
-    std::int64_t received = 0, barePictures = 0;
+    std::int64_t received = 0, read = 0, barePictures = 0;
     double p50 = 0, p99 = 0, first = 0, runnerCpu = 0, bareCpu = 0;
     std::string error;
     for (std::size_t i = 0; i < streams.size(); ++i) {
       received += chain[i].received;
+      read += chain[i].read;
       p50 = std::max(p50, chain[i].p50);
       p99 = std::max(p99, chain[i].p99);
       first = std::max(first, chain[i].firstMs);
@@ -314,8 +333,14 @@ void Chain(benchmark::State& state, int width, int height, int fps, int seconds,
       barePictures += bare[i].pictures;
       bareCpu += bare[i].cpu;
     }
-    const double runnerPer = received > 0 ? runnerCpu * 1000 / static_cast<double>(received) : 0;
-    const double barePer = barePictures > 0 ? bareCpu * 1000 / static_cast<double>(barePictures) : 0;
+    // CPU from each one's first picture to its last, per picture after the
+    // first; the uncounted pictures before the stream count for both.
+    const auto per = [](double cpu, std::int64_t pictures, std::size_t streams) {
+      const auto after = pictures - static_cast<std::int64_t>(streams);
+      return after > 0 ? cpu * 1000 / static_cast<double>(after) : 0.0;
+    };
+    const double runnerPer = per(runnerCpu, read, streams.size());
+    const double barePer = per(bareCpu, barePictures, streams.size());
     state.counters["frames_sent"] = static_cast<double>(frames * sources);
     state.counters["frames_received"] = static_cast<double>(received);
     state.counters["frames_lost"] = static_cast<double>(frames * sources - received);
