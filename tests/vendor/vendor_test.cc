@@ -145,6 +145,10 @@ class Watch {
   std::vector<json> notes_;
 };
 
+bool Has(const std::vector<int>& states, int state) {
+  return std::find(states.begin(), states.end(), state) != states.end();
+}
+
 // States in order: `first`, later `then`.
 bool InOrder(const std::vector<int>& states, int first, int then) {
   const auto at = std::find(states.begin(), states.end(), first);
@@ -340,7 +344,7 @@ TEST_F(Vendor, AKilledSenderGives3AndItsReturn1Then2AndPicturesAgain) {
       const std::size_t mark = watch.States().size();
       sender->Process().Signal(SIGKILL);
       sender->Process().Wait(10s);
-      pmtest::WaitFor([&] { return InOrder(since(mark), 3, 3); }, 20s);
+      pmtest::WaitFor([&] { return Has(since(mark), 3); }, 20s);
       afterDeath = since(mark);
       const std::size_t back = watch.States().size();
       sender = std::make_unique<Sender>();
@@ -354,7 +358,7 @@ TEST_F(Vendor, AKilledSenderGives3AndItsReturn1Then2AndPicturesAgain) {
   const pmhost::ReceiveResult result = pmhost::Receive(o);
   pmtest::ExpectOrderlyEnd(result, Place());
   EXPECT_TRUE(restarted);
-  EXPECT_TRUE(InOrder(afterDeath, 3, 3)) << ::testing::PrintToString(afterDeath);
+  EXPECT_TRUE(Has(afterDeath, 3)) << ::testing::PrintToString(afterDeath);
   EXPECT_TRUE(InOrder(afterReturn, 1, 2)) << ::testing::PrintToString(afterReturn);
   EXPECT_GT(watch.Pictures(), before);
   EXPECT_EQ(watch.Damaged(), 0) << watch.Problem();
