@@ -88,6 +88,8 @@ bool Ptz(void* receiver, const std::string& xml) {
 
 using ndilb::Guard;
 using ndilb::GuardVoid;
+using ndilb::PtzInteger;
+using ndilb::PtzNumber;
 using ndilb::PtzXml;
 
 NDILB_EXPORT bool NDIlib_initialize(void) { return true; }
@@ -152,49 +154,51 @@ NDILB_EXPORT bool NDIlib_recv_ptz_is_supported(void* receiver) {
   return receiver != nullptr && ndilb::R(receiver)->PtzSupported();
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_recall_preset(void* receiver, int preset, float speed) {
-  return ndilb::Ptz(receiver, PtzXml("recall_preset", {{"preset", preset}, {"speed", speed}}));
+  return ndilb::Ptz(receiver, PtzXml("recall_preset", {PtzInteger("index", preset), PtzNumber("speed", speed)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_store_preset(void* receiver, int preset) {
-  return ndilb::Ptz(receiver, PtzXml("store_preset", {{"preset", preset}}));
+  return ndilb::Ptz(receiver, PtzXml("store_preset", {PtzInteger("index", preset)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_pan_tilt(void* receiver, float pan, float tilt) {
-  return ndilb::Ptz(receiver, PtzXml("pan_tilt", {{"pan", pan}, {"tilt", tilt}}));
+  return ndilb::Ptz(receiver, PtzXml("pan_tilt", {PtzNumber("pan", pan), PtzNumber("tilt", tilt)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_pan_tilt_speed(void* receiver, float pan_speed, float tilt_speed) {
-  return ndilb::Ptz(receiver, PtzXml("pan_tilt_speed", {{"pan_speed", pan_speed}, {"tilt_speed", tilt_speed}}));
+  return ndilb::Ptz(receiver,
+                    PtzXml("pan_tilt_speed", {PtzNumber("pan_speed", pan_speed), PtzNumber("tilt_speed", tilt_speed)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_zoom(void* receiver, float zoom) {
-  return ndilb::Ptz(receiver, PtzXml("zoom", {{"zoom", zoom}}));
+  return ndilb::Ptz(receiver, PtzXml("zoom", {PtzNumber("zoom", zoom)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_focus(void* receiver, float focus) {
-  return ndilb::Ptz(receiver, PtzXml("focus", {{"focus", focus}}));
+  return ndilb::Ptz(receiver, PtzXml("focus", {{"mode", "manual"}, PtzNumber("distance", focus)}));
 }
+// The vendor runtime calls the speed "distance" too.
 NDILB_EXPORT bool NDIlib_recv_ptz_focus_speed(void* receiver, float focus_speed) {
-  return ndilb::Ptz(receiver, PtzXml("focus_speed", {{"focus_speed", focus_speed}}));
+  return ndilb::Ptz(receiver, PtzXml("focus_speed", {{"mode", "manual"}, PtzNumber("distance", focus_speed)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_auto_focus(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("auto_focus", {}));
+  return ndilb::Ptz(receiver, PtzXml("focus", {{"mode", "auto"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_exposure_auto(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("exposure_auto", {}));
+  return ndilb::Ptz(receiver, PtzXml("exposure", {{"mode", "auto"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_exposure_manual(void* receiver, float level) {
-  return ndilb::Ptz(receiver, PtzXml("exposure_manual", {{"level", level}}));
+  return ndilb::Ptz(receiver, PtzXml("exposure", {{"mode", "manual"}, PtzNumber("value", level)}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_white_balance_auto(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("white_balance_auto", {}));
+  return ndilb::Ptz(receiver, PtzXml("white_balance", {{"mode", "auto"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_white_balance_indoor(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("white_balance_indoor", {}));
+  return ndilb::Ptz(receiver, PtzXml("white_balance", {{"mode", "indoor"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_white_balance_outdoor(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("white_balance_outdoor", {}));
+  return ndilb::Ptz(receiver, PtzXml("white_balance", {{"mode", "outdoor"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_white_balance_oneshot(void* receiver) {
-  return ndilb::Ptz(receiver, PtzXml("white_balance_oneshot", {}));
+  return ndilb::Ptz(receiver, PtzXml("white_balance", {{"mode", "one_shot"}}));
 }
 NDILB_EXPORT bool NDIlib_recv_ptz_white_balance_manual(void* receiver, float red, float blue) {
-  return ndilb::Ptz(receiver, PtzXml("white_balance_manual", {{"red", red}, {"blue", blue}}));
+  return ndilb::Ptz(receiver, PtzXml("white_balance", {{"mode", "manual"}, PtzNumber("red", red), PtzNumber("blue", blue)}));
 }
 
 NDILB_EXPORT void NDIlib_util_audio_to_interleaved_32f_v2(const ndi_audio_frame_v2* src,

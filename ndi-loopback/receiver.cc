@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "ndi-loopback/net.h"
+#include "ndi-loopback/picture.h"
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/sender.h"
 #include "pm/runtime/log.h"
@@ -37,13 +38,17 @@ int MaxOf(int slot) {
 
 }  // namespace
 
-std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values) {
-  std::string xml = std::string("<ptz_command name=\"") + name + "\"";
-  for (const auto& [key, value] : values) {
-    char number[64];
-    std::snprintf(number, sizeof number, "%.9g", value);
-    xml += std::string(" ") + key + "=\"" + number + "\"";
-  }
+PtzValue PtzNumber(const char* key, double value) {
+  char number[64];
+  std::snprintf(number, sizeof number, "%f", value);
+  return {key, number};
+}
+
+PtzValue PtzInteger(const char* key, int value) { return {key, std::to_string(value)}; }
+
+std::string PtzXml(const char* element, std::initializer_list<PtzValue> values) {
+  std::string xml = std::string("<ntk_ptz_") + element;
+  for (const PtzValue& v : values) xml += std::string(" ") + v.key + "=\"" + v.text + "\"";
   return xml + "/>";
 }
 
@@ -51,8 +56,15 @@ Receiver::Receiver(const ndi_recv_create& settings)
     : name_(settings.source_to_connect_to.ndi_name != nullptr ? settings.source_to_connect_to.ndi_name : ""),
       url_(settings.source_to_connect_to.url_address != nullptr ? settings.source_to_connect_to.url_address : ""),
       bandwidth_(settings.bandwidth),
+      color_format_(settings.color_format),
       pool_(std::make_shared<BufferPool>(4)) {
   wake_fd_ = MakeWakeFd();
+  // As with the vendor runtime, the first capture reports a status change
+  // at once, before any connection; a later one comes with each connection
+  // whose sender takes PTZ.
+  auto created = std::make_unique<Item>();
+  created->type = kNdiFrameStatusChange;
+  Enqueue(std::move(created));
   thread_ = std::thread([this] { Run(); });
 }
 
@@ -137,6 +149,7 @@ void Receiver::Serve(int fd) {
       switch (message->type) {
         case MessageType::Video:
           if (bandwidth_ == kNdiBandwidthAudioOnly || bandwidth_ == kNdiBandwidthMetadataOnly) continue;
+          if (!Deliverable(*message)) continue;
           item->type = kNdiFrameVideo;
           break;
         case MessageType::Audio:
@@ -150,6 +163,7 @@ void Receiver::Serve(int fd) {
         case MessageType::Ready:
           ptz_ = message->ptz_supported;
           connected_ = true;
+          if (!message->ptz_supported) continue;
           item->type = kNdiFrameStatusChange;
           break;
         default:
@@ -165,6 +179,27 @@ void Receiver::Serve(int fd) {
     fd_ = -1;
   }
   // Frames of the connection that are still queued stay capturable.
+}
+
+bool Receiver::Deliverable(Message& m) {
+  VideoInfo& v = m.video;
+  const bool alpha = HasAlpha(v.fourcc, v.xres, v.yres, v.line_stride, m.payload.data());
+  const std::uint32_t to = DeliveredFourCC(color_format_, alpha);
+  const int stride = DeliveredStride(to, v.xres);
+  if (to == v.fourcc && stride == v.line_stride) return true;  // as it came
+  const std::uint64_t bytes = PictureBytes(to, v.xres, v.yres, stride);
+  Buffer out = bytes > 0 ? pool_->Acquire(static_cast<std::size_t>(bytes)) : Buffer();
+  if (!out || !ConvertPicture(v.fourcc, v.xres, v.yres, v.line_stride, m.payload.data(), to, stride, out.data())) {
+    if (out) pool_->Release(std::move(out));
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: receiver of %s dropped a %dx%d picture it cannot deliver",
+            name_.empty() ? url_.c_str() : name_.c_str(), v.xres, v.yres);
+    return false;
+  }
+  pool_->Release(std::move(m.payload));
+  m.payload = std::move(out);
+  v.fourcc = to;
+  v.line_stride = stride;
+  return true;
 }
 
 void Receiver::Enqueue(std::unique_ptr<Item> item) {
@@ -298,9 +333,13 @@ bool Receiver::WriteMessage(const void* head, std::size_t head_size, const std::
 bool Receiver::SetTally(const ndi_tally& tally) {
   std::lock_guard<std::mutex> lock(write_mutex_);
   tally_ = tally;  // also sent with the hello of every later connection
-  if (!connected_) return false;
+  // Taken whether or not a sender is connected, as the vendor runtime does.
+  // Once the hello is out (fd_ is set under this lock right after it), the
+  // change must follow it on the wire even before the sender's Ready.
+  if (fd_ < 0) return true;
   EncodedHead head = EncodeTally(tally.on_program, tally.on_preview);
-  return WriteMessage(head.bytes, head.size, std::string());
+  WriteMessage(head.bytes, head.size, std::string());
+  return true;
 }
 
 bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
@@ -311,14 +350,15 @@ bool Receiver::SendMetadata(const ndi_metadata_frame& frame) {
   if (text.size() > (1u << 20)) return false;
   std::lock_guard<std::mutex> lock(write_mutex_);
   if (!connected_) return false;
-  const std::int64_t timecode = frame.timecode == kNdiSendTimecodeSynthesize ? NowTimestamp() : frame.timecode;
-  EncodedHead head = EncodeMetadata(MessageType::Metadata, timecode, static_cast<std::uint32_t>(text.size()));
+  // The timecode goes as given: the vendor runtime does not make one up on
+  // this side.
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, frame.timecode, static_cast<std::uint32_t>(text.size()));
   return WriteMessage(head.bytes, head.size, text);
 }
 
 bool Receiver::SendPtz(const std::string& xml) {
   std::lock_guard<std::mutex> lock(write_mutex_);
-  if (!connected_ || !ptz_) return false;
+  if (!connected_) return false;
   EncodedHead head = EncodeMetadata(MessageType::Metadata, 0, static_cast<std::uint32_t>(xml.size()));
   return WriteMessage(head.bytes, head.size, xml);
 }

@@ -3,7 +3,8 @@
 // receiver ("ndi-lb receiver") finds the sender by name in the registry,
 // connects, and reads frames straight into pooled buffers; whole frames go
 // into a bounded queue (the oldest frame of a kind is dropped when full) from
-// which Capture hands them out. When the sender goes, the thread looks the
+// which Capture hands them out, in the FourCC and stride the vendor runtime
+// would deliver for the receiver's colour format (picture.h). When the sender goes, the thread looks the
 // name up again every 150 ms and reconnects, also to a new URL.
 //
 // Threads: any thread may call the public operations; the network thread is
@@ -47,8 +48,8 @@ class Receiver {
   bool SetTally(const ndi_tally& tally);
   bool SendMetadata(const ndi_metadata_frame& frame);
   bool PtzSupported() const { return connected_.load() && ptz_.load(); }
-  // Sends a PTZ command document; false when not connected or the sender
-  // does not accept PTZ.
+  // Sends a PTZ command document; false when not connected. As with the
+  // vendor runtime, it goes out whether or not the sender said it takes PTZ.
   bool SendPtz(const std::string& xml);
 
  private:
@@ -62,11 +63,16 @@ class Receiver {
   // Reads until the connection ends or the receiver stops.
   void Serve(int fd);
   void Enqueue(std::unique_ptr<Item> item);
+  // Turns a received picture into what the vendor runtime would deliver for
+  // this receiver's colour format (FourCC, 16-pixel stride); false when it
+  // cannot (the frame is dropped).
+  bool Deliverable(Message& message);
   bool WriteMessage(const void* head, std::size_t head_size, const std::string& text);
 
   const std::string name_;
   const std::string url_;
   const std::int32_t bandwidth_;
+  const std::int32_t color_format_;
   const std::shared_ptr<BufferPool> pool_;
   int wake_fd_ = -1;
   std::atomic<bool> stop_{false};
@@ -85,8 +91,15 @@ class Receiver {
   std::map<const void*, std::unique_ptr<Item>> held_;  // captured, not yet freed
 };
 
-// The PTZ command document of the loopback runtime:
-// <ptz_command name="NAME" key="value" .../> with values printed "%.9g".
-std::string PtzXml(const char* name, std::initializer_list<std::pair<const char*, double>> values);
+// A PTZ command as the sender sees it through NDIlib_send_capture, in the
+// vendor runtime's words: <ntk_ptz_ELEMENT key="value" .../>, attributes in
+// the given order; numbers are printed "%f" (presets as integers).
+struct PtzValue {
+  const char* key;
+  std::string text;
+};
+PtzValue PtzNumber(const char* key, double value);
+PtzValue PtzInteger(const char* key, int value);
+std::string PtzXml(const char* element, std::initializer_list<PtzValue> values);
 
 }  // namespace ndilb

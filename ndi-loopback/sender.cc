@@ -43,12 +43,11 @@ std::int64_t NowTimestamp() {
 }
 
 bool AnnouncesPtz(const std::string& xml) {
-  const std::size_t at = xml.find("<ptz_capabilities");
+  const std::size_t at = xml.find("<ndi_capabilities");
   if (at == std::string::npos) return false;
   const std::size_t end = xml.find('>', at);
   const std::string element = xml.substr(at, end == std::string::npos ? std::string::npos : end - at);
-  return element.find("supported=\"true\"") != std::string::npos ||
-         element.find("supported='true'") != std::string::npos;
+  return element.find("ntk_ptz=\"true\"") != std::string::npos || element.find("ntk_ptz='true'") != std::string::npos;
 }
 
 std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
@@ -175,32 +174,43 @@ bool Sender::Handle(Conn& conn, Message& m) {
       conn.on_preview = m.on_preview;
     }
     bool ptz = false;
+    for (const std::string& xml : metadata) ptz = ptz || AnnouncesPtz(xml);
     {
+      // As with the vendor runtime, the receiver learns PTZ support (Ready,
+      // a status change) before it captures the connection metadata.
       std::lock_guard<std::mutex> lock(conn.write_mutex);
-      for (const std::string& xml : metadata) {
-        ptz = ptz || AnnouncesPtz(xml);
-        EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, NowTimestamp(), static_cast<std::uint32_t>(xml.size()));
-        iovec iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
-        if (conn.dead || !WriteAll(conn.fd, iov, 2)) return false;
-      }
       EncodedHead ready = EncodeReady(ptz);
       iovec iov[1] = {Iov(ready.bytes, ready.size)};
       if (conn.dead || !WriteAll(conn.fd, iov, 1)) return false;
+      for (const std::string& xml : metadata) {
+        if (AnnouncesPtz(xml)) continue;
+        EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, 0, static_cast<std::uint32_t>(xml.size()));
+        iovec parts[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+        if (conn.dead || !WriteAll(conn.fd, parts, 2)) return false;
+      }
+      if (!WriteTallyEcho(conn, m.on_program, m.on_preview)) return false;
     }
     std::lock_guard<std::mutex> lock(mutex_);
     conn.active = true;
     ++active_count_;
     UpdateTallyLocked();
+    ++tally_version_;  // reported again on every connection change
     cv_.notify_all();
     return true;
   }
   switch (m.type) {
     case MessageType::Tally: {
-      std::lock_guard<std::mutex> lock(mutex_);
-      conn.on_program = m.on_program;
-      conn.on_preview = m.on_preview;
-      UpdateTallyLocked();
-      return true;
+      bool changed = false;
+      {
+        std::lock_guard<std::mutex> lock(mutex_);
+        changed = conn.on_program != m.on_program || conn.on_preview != m.on_preview;
+        conn.on_program = m.on_program;
+        conn.on_preview = m.on_preview;
+        UpdateTallyLocked();
+      }
+      if (!changed) return true;
+      std::lock_guard<std::mutex> lock(conn.write_mutex);
+      return WriteTallyEcho(conn, m.on_program, m.on_preview);
     }
     case MessageType::Metadata: {
       std::lock_guard<std::mutex> lock(mutex_);
@@ -216,6 +226,15 @@ bool Sender::Handle(Conn& conn, Message& m) {
       pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a receiver that said hello twice", name_.c_str());
       return false;
   }
+}
+
+bool Sender::WriteTallyEcho(Conn& conn, bool on_program, bool on_preview) {
+  // Called with conn.write_mutex held.
+  const std::string xml = std::string("<ndi_tally_echo on_program=\"") + (on_program ? "true" : "false") +
+                          "\" on_preview=\"" + (on_preview ? "true" : "false") + "\"/>";
+  EncodedHead head = EncodeMetadata(MessageType::Metadata, 0, static_cast<std::uint32_t>(xml.size()));
+  iovec iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+  return !conn.dead && WriteAll(conn.fd, iov, 2);
 }
 
 void Sender::UpdateTallyLocked() {
@@ -243,7 +262,10 @@ void Sender::Drop(const std::shared_ptr<Conn>& conn) {
   for (auto it = conns_.begin(); it != conns_.end(); ++it) {
     if (*it != conn) continue;
     conns_.erase(it);
-    if (conn->active) --active_count_;
+    if (conn->active) {
+      --active_count_;
+      ++tally_version_;  // reported again on every connection change
+    }
     conn->active = false;
     UpdateTallyLocked();
     cv_.notify_all();
@@ -316,26 +338,33 @@ void Sender::SendVideo(const ndi_video_frame_v2& frame) {
   if (text.size() > (1u << 20)) return;
 
   const auto conns = ActiveConns();
-  HalfPicture half;
-  bool half_done = false, half_ok = false;
+  // "lowest": the vendor runtime's proxy size, made once per frame when a
+  // receiver asks for it (a picture that fits goes as it is).
+  int proxy_width = 0, proxy_height = 0;
+  ProxySize(frame.xres, frame.yres, &proxy_width, &proxy_height);
+  const bool proxy_same = proxy_width == frame.xres && proxy_height == frame.yres;
+  ScaledPicture proxy;
+  bool proxy_done = false, proxy_ok = false;
   for (const auto& c : conns) {
-    if (c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly) {
+    const bool full = c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly;
+    if (full || (c->bandwidth == kNdiBandwidthLowest && proxy_same)) {
       EncodedHead head = EncodeVideo(info, static_cast<std::uint32_t>(text.size()), bytes);
       iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(frame.data, bytes)};
       WriteTo(*c, iov, 3);
     } else if (c->bandwidth == kNdiBandwidthLowest) {
-      if (!half_done) {
-        half_done = true;
-        half_ok = HalvePicture(frame.FourCC, frame.xres, frame.yres, stride, frame.data, &half);
+      if (!proxy_done) {
+        proxy_done = true;
+        proxy_ok = ScalePicture(frame.FourCC, frame.xres, frame.yres, stride, frame.data, proxy_width, proxy_height,
+                                &proxy);
       }
-      if (!half_ok) continue;
+      if (!proxy_ok) continue;
       VideoInfo small = info;
-      small.xres = half.xres;
-      small.yres = half.yres;
-      small.line_stride = half.stride;
-      EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), half.bytes.size());
+      small.xres = proxy.xres;
+      small.yres = proxy.yres;
+      small.line_stride = proxy.stride;
+      EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), proxy.bytes.size());
       iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()),
-                      Iov(half.bytes.data(), half.bytes.size())};
+                      Iov(proxy.bytes.data(), proxy.bytes.size())};
       WriteTo(*c, iov, 3);
     }
     // audio only and metadata only: no video

@@ -77,6 +77,10 @@ class Sender {
   bool WriteTo(Conn& conn, iovec* iov, int count);
   std::vector<std::shared_ptr<Conn>> ActiveConns();
   void UpdateTallyLocked();
+  // The vendor runtime's answer to a receiver's tally, sent to that receiver
+  // on connecting and whenever its tally changes:
+  // <ndi_tally_echo on_program="true|false" on_preview="true|false"/>.
+  bool WriteTallyEcho(Conn& conn, bool on_program, bool on_preview);
   void PaceVideo(const ndi_video_frame_v2& frame);
 
   std::string name_;
@@ -97,14 +101,19 @@ class Sender {
   std::vector<std::string> conn_metadata_;
   int active_count_ = 0;
   ndi_tally tally_{false, false};
-  std::uint64_t tally_version_ = 0;
+  // A tally is reported (NDIlib_send_get_tally returns true) at the first
+  // look, on every change and, as the vendor runtime does, on every
+  // connection change even when the value stays.
+  std::uint64_t tally_version_ = 1;
   std::uint64_t tally_reported_ = 0;
   std::deque<std::pair<std::string, std::int64_t>> inbox_;
   std::map<const char*, Held> held_;
 };
 
-// The element a sender adds to its connection metadata to say that it
-// accepts PTZ commands: <ptz_capabilities supported="true"/>.
+// The connection metadata by which a sender says that it accepts PTZ
+// commands: an <ndi_capabilities> element with ntk_ptz="true". As with the
+// vendor runtime, that element is the runtime's own: receivers learn PTZ
+// support from it (a status change) and never capture it as metadata.
 bool AnnouncesPtz(const std::string& xml);
 
 // Sender's clock for frame stamps: CLOCK_REALTIME in 100 ns units.

@@ -20,8 +20,9 @@
 //   2 Tally        R->S  u8 on_program, u8 on_preview, u16 0                   (4)
 //   3 Metadata     both  i64 timecode (8); text = the XML; no payload
 //   4 ConnMetadata S->R  as Metadata: one of the sender's connection metadata
-//   5 Ready        S->R  u8 ptz_supported, u8 0, u16 0 (4): every connection
-//                        metadata has been sent; the connection is up
+//   5 Ready        S->R  u8 ptz_supported, u8 0, u16 0 (4): the connection is
+//                        up; the connection metadata follows (as with the
+//                        vendor runtime, PTZ support is known before it)
 //   6 Video        S->R  i32 xres, i32 yres, u32 fourcc, i32 frame_rate_N,
 //                        i32 frame_rate_D, f32 aspect, i32 frame_format,
 //                        i32 line_stride, i64 timecode, i64 timestamp      (48)

@@ -116,16 +116,17 @@ std::set<std::string> UrlsOf(const std::string& full_name) {
   return urls;
 }
 
-// One metadata text from a receiver: a PTZ command or plain metadata.
+// One metadata text from a receiver: a PTZ command (an <ntk_ptz_NAME .../>
+// element, reported as command NAME with its attributes, numbers as numbers)
+// or plain metadata.
 void ReportMetadata(const std::string& xml) {
+  static constexpr char kPtzPrefix[] = "ntk_ptz_";
   tinyxml2::XMLDocument doc;
   if (doc.Parse(xml.c_str(), xml.size()) == tinyxml2::XML_SUCCESS && doc.RootElement() != nullptr &&
-      std::strcmp(doc.RootElement()->Name(), "ptz_command") == 0) {
+      std::strncmp(doc.RootElement()->Name(), kPtzPrefix, sizeof kPtzPrefix - 1) == 0) {
     const tinyxml2::XMLElement* root = doc.RootElement();
-    const char* command = root->Attribute("name");
     nlohmann::json values = nlohmann::json::object();
     for (const tinyxml2::XMLAttribute* a = root->FirstAttribute(); a != nullptr; a = a->Next()) {
-      if (std::strcmp(a->Name(), "name") == 0) continue;
       double v = 0;
       if (a->QueryDoubleValue(&v) == tinyxml2::XML_SUCCESS) {
         values[a->Name()] = v;
@@ -133,7 +134,7 @@ void ReportMetadata(const std::string& xml) {
         values[a->Name()] = a->Value();
       }
     }
-    Emit({{"event", "ptz"}, {"command", command != nullptr ? command : ""}, {"values", values}, {"xml", xml}});
+    Emit({{"event", "ptz"}, {"command", root->Name() + sizeof kPtzPrefix - 1}, {"values", values}, {"xml", xml}});
     return;
   }
   Emit({{"event", "metadata"}, {"xml", xml}});
@@ -196,10 +197,10 @@ std::vector<Geometry> ParseSizes(const std::string& text, std::uint32_t fourcc) 
 // The picture of one geometry: its planes, its memory and, for the bars
 // pattern, its bars.
 struct Picture {
-  Picture(const Geometry& g, bool with_bars)
+  Picture(const Geometry& g, bool with_bars, bool blocks)
       : geometry(g), planes(ndits::PictureLayout(g.fourcc, g.width, g.height)) {
     bytes.resize(ndits::PictureSize(planes));
-    if (with_bars) bars.emplace(g.fourcc, g.width, g.height);
+    if (with_bars) bars.emplace(g.fourcc, g.width, g.height, blocks);
   }
   Geometry geometry;
   std::vector<ndits::Plane> planes;
@@ -229,6 +230,8 @@ int Run(const Options& o) {
     }
   }
   const bool ramp = o.pattern == "ramp";
+  const bool blocks = o.pattern == "blocks";
+  const bool ramp_sound = ramp || blocks;
   int audio_samples = o.audio_samples;
   if (audio_samples <= 0) {
     audio_samples = rate_n > 0 ? static_cast<int>(static_cast<std::int64_t>(o.audio_rate) * rate_d / rate_n) : 1600;
@@ -263,7 +266,7 @@ int Run(const Options& o) {
     doc.Print(&printer);
     add_connection_metadata(printer.CStr());
   }
-  if (o.ptz) add_connection_metadata("<ptz_capabilities supported=\"true\"/>");
+  if (o.ptz) add_connection_metadata("<ndi_capabilities ntk_ptz=\"true\"/>");
 
   Emit({{"event", "ready"}, {"name", full_name}, {"url", FindOwnUrl(full_name, before)}});
 
@@ -293,7 +296,7 @@ int Run(const Options& o) {
           float* out = audio.data() + static_cast<std::size_t>(c) * (channel_stride / 4);
           for (int s = 0; s < audio_samples; ++s) {
             const std::int64_t t = samples_sent + s;
-            out[s] = ramp ? ndits::AudioRampSample(t, c)
+            out[s] = ramp_sound ? ndits::AudioRampSample(t, c)
                           : 0.25f * static_cast<float>(std::sin(2.0 * M_PI * 1000.0 * static_cast<double>(t) / o.audio_rate));
           }
         }
@@ -312,7 +315,7 @@ int Run(const Options& o) {
     const Geometry& geometry = sizes[static_cast<std::size_t>(turn)];
     if (!picture || !(picture->geometry == geometry)) {
       picture.reset();  // a 2160p picture is 16 MB: never two at once
-      picture = std::make_unique<Picture>(geometry, !ramp);
+      picture = std::make_unique<Picture>(geometry, !ramp, blocks);
       Emit({{"event", "size"}, {"width", geometry.width}, {"height", geometry.height}, {"frame", n}});
     }
     if (ramp) {
@@ -357,7 +360,7 @@ int main(int argc, char** argv) {
   app.add_option("--fps", o.fps, "frame rate N or N/D; 0 = as fast as possible");
   app.add_option("--format", o.format, "picture format")
       ->check(CLI::IsMember({"uyvy", "uyva", "nv12", "i420", "yv12", "bgra", "bgrx", "rgba", "rgbx"}));
-  app.add_option("--pattern", o.pattern, "test pattern")->check(CLI::IsMember({"bars", "ramp"}));
+  app.add_option("--pattern", o.pattern, "test pattern")->check(CLI::IsMember({"bars", "ramp", "blocks"}));
   app.add_option("--audio-rate", o.audio_rate, "audio sample rate")->check(CLI::Range(1, 384000));
   app.add_option("--audio-channels", o.audio_channels, "audio channels")->check(CLI::Range(1, 1024));
   app.add_option("--audio-samples", o.audio_samples, "samples per audio frame")

@@ -126,40 +126,64 @@ std::string CheckRamp(std::uint32_t fourcc, int width, int height, int stride, c
 }
 
 namespace {
-struct Colour {
-  std::uint8_t y, u, v, r, g, b;
-};
-// 75% bars, then the marker.
-constexpr Colour kColours[9] = {
+// 75% bars, then black and the marker's white.
+constexpr BarColour kColours[9] = {
     {180, 128, 128, 191, 191, 191}, {168, 44, 136, 191, 191, 0}, {145, 147, 44, 0, 191, 191},
     {133, 63, 52, 0, 191, 0},       {63, 193, 204, 191, 0, 191}, {51, 109, 212, 191, 0, 0},
     {28, 212, 120, 0, 0, 191},      {16, 128, 128, 0, 0, 0},     {235, 128, 128, 255, 255, 255},
 };
+constexpr int kBlack = 7;
+constexpr int kWhite = 8;
 }  // namespace
 
-Bars::Bars(std::uint32_t fourcc, int width, int height)
-    : fourcc_(fourcc), width_(width), height_(height), planes_(PictureLayout(fourcc, width, height)) {
+const BarColour& BarColourOf(int index) { return kColours[index < 0 || index > kWhite ? kBlack : index]; }
+
+std::uint64_t BlockCode(std::uint32_t n) {
+  const std::uint32_t sum = (n & 0xFF) + ((n >> 8) & 0xFF) + ((n >> 16) & 0xFF) + (n >> 24);
+  return static_cast<std::uint64_t>(n) | static_cast<std::uint64_t>((sum & 0xFF) ^ 0x5A) << 32;
+}
+
+std::int64_t BlockNumber(std::uint64_t code) {
+  const auto n = static_cast<std::uint32_t>(code & 0xFFFFFFFFu);
+  return BlockCode(n) == code ? static_cast<std::int64_t>(n) : -1;
+}
+
+Bars::Bars(std::uint32_t fourcc, int width, int height, bool blocks)
+    : fourcc_(fourcc), width_(width), height_(height), blocks_(blocks), planes_(PictureLayout(fourcc, width, height)) {
   base_.assign(PictureSize(planes_), 0);
   if (base_.empty()) return;
-  for (int i = 0; i < 8; ++i) {
-    const int x0 = (width_ * i / 8) & ~1;
-    const int x1 = i == 7 ? width_ : (width_ * (i + 1) / 8) & ~1;
-    Rect(base_.data(), x0, 0, x1 - x0, height_, i);
+  const int rows = blocks_ ? BlockBarRows(height_) : height_;
+  for (int i = 0; i < kBarCount; ++i) {
+    const int x0 = BarLeft(width_, i);
+    const int x1 = i == kBarCount - 1 ? width_ : BarLeft(width_, i + 1);
+    Rect(base_.data(), x0, 0, x1 - x0, rows, i);
   }
+  if (blocks_) Rect(base_.data(), 0, rows, width_, height_ - rows, kBlack);
 }
 
 void Bars::Fill(std::int64_t n, std::uint8_t* picture) const {
   if (base_.empty()) return;
   std::memcpy(picture, base_.data(), base_.size());
+  if (blocks_) {
+    const std::uint64_t code = BlockCode(static_cast<std::uint32_t>(n));
+    const int top = BlockBarRows(height_);
+    for (int i = 0; i < kBlockCells; ++i) {
+      if ((code >> i & 1) == 0) continue;
+      const int x0 = CellLeft(width_, i);
+      const int x1 = i == kBlockCells - 1 ? width_ : CellLeft(width_, i + 1);
+      Rect(picture, x0, top, x1 - x0, height_ - top, kWhite);
+    }
+    return;
+  }
   const int size = std::max(2, (height_ / 8) & ~1);
   const int span = std::max(1, width_ - size);
   const int x = static_cast<int>((n * 8) % span) & ~1;
   const int y = ((height_ - size) / 2) & ~1;
-  Rect(picture, x, std::max(0, y), std::min(size, width_), std::min(size, height_), 8);
+  Rect(picture, x, std::max(0, y), std::min(size, width_), std::min(size, height_), kWhite);
 }
 
 void Bars::Rect(std::uint8_t* picture, int x0, int y0, int w, int h, int colour) const {
-  const Colour& k = kColours[colour];
+  const BarColour& k = kColours[colour];
   const Plane& p0 = planes_[0];
   for (int y = y0; y < y0 + h; ++y) {
     std::uint8_t* row = picture + p0.offset + static_cast<std::size_t>(y) * p0.stride;

@@ -9,6 +9,12 @@
 // Audio ramp: sample s (per channel, counted from the start) of channel c is
 // ((s + 7*c) % 1024) / 1024.0f.
 // Pattern "bars": eight colour bars with a moving white marker; a 1 kHz tone.
+// Pattern "blocks" (survives lossy compression and the "lowest" proxy): the
+// eight bars over the top three quarters of the picture; in the bottom
+// quarter, on black, frame n as kBlockCells white or black cells side by side
+// across the whole width: cell i is white when bit i of BlockCode(n) is set.
+// Every position is a fraction of the picture's size, so a scaled copy reads
+// the same. Its sound is the audio ramp.
 #include <cstdint>
 #include <string>
 #include <vector>
@@ -46,16 +52,38 @@ std::string CheckRamp(std::uint32_t fourcc, int width, int height, int stride, c
 // The frame number in the first 8 bytes of a ramp picture.
 std::int64_t RampFrameNumber(const std::uint8_t* picture);
 
-// Bars: a picture cached per format and size, and the marker moved per frame.
+// The colours of the bars (75 %, BT.709 limited range), then black and white.
+struct BarColour {
+  std::uint8_t y, u, v, r, g, b;
+};
+inline constexpr int kBarCount = 8;
+const BarColour& BarColourOf(int index);  // 0..7 the bars, 7 black, 8 white
+
+// "blocks": 32 bits of the frame number, then 8 check bits (the four bytes
+// of the number added up, exclusive-or 0x5A).
+inline constexpr int kBlockCells = 40;
+std::uint64_t BlockCode(std::uint32_t n);
+// The number of a code whose check bits hold; -1 otherwise.
+std::int64_t BlockNumber(std::uint64_t code);
+// Where the parts of a "blocks" picture of this size lie: the bars fill rows
+// [0, BlockBarRows), the cells rows [BlockBarRows, height); cell i (and bar i)
+// spans columns [CellLeft(i), CellLeft(i + 1)).
+inline int BlockBarRows(int height) { return (height * 3 / 4) & ~1; }
+inline int CellLeft(int width, int i) { return (width * i / kBlockCells) & ~1; }
+inline int BarLeft(int width, int i) { return (width * i / kBarCount) & ~1; }
+
+// Bars (and blocks): a picture cached per format and size; per frame the
+// marker moves (bars) or the number's cells are drawn (blocks).
 class Bars {
  public:
-  Bars(std::uint32_t fourcc, int width, int height);
+  Bars(std::uint32_t fourcc, int width, int height, bool blocks = false);
   void Fill(std::int64_t n, std::uint8_t* picture) const;
 
  private:
   void Rect(std::uint8_t* picture, int x0, int y0, int w, int h, int color) const;
   std::uint32_t fourcc_;
   int width_, height_;
+  bool blocks_;
   std::vector<Plane> planes_;
   std::vector<std::uint8_t> base_;
 };

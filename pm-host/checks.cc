@@ -10,6 +10,7 @@
 
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/picture.h"
+#include "pm-host/record.h"
 #include "pm/task/formats.h"
 #include "taskndisource/ndi_abi.h"
 
@@ -140,7 +141,7 @@ std::string CheckRampPicture(const VideoFrame& frame, std::int64_t* frameNumber)
   return ndits::CheckRamp(fourcc, frame.width, frame.height, static_cast<int>(frame.stride), frame.data, frameNumber);
 }
 
-std::string CheckRampSound(const AudioFrame& frame, std::int64_t* firstSample) {
+std::string CheckRampSound(const AudioFrame& frame, std::int64_t* firstSample, float tolerance) {
   if (frame.code != pm::kCodeFl32) return "not 'fl32' sound";
   if (frame.channels <= 0 || frame.samples <= 0) return "empty sound";
   const auto* samples = reinterpret_cast<const float*>(frame.data);
@@ -151,13 +152,100 @@ std::string CheckRampSound(const AudioFrame& frame, std::int64_t* firstSample) {
     for (int c = 0; c < frame.channels; ++c) {
       const float expected = ndits::AudioRampSample(s0 + k, c);
       const float got = samples[static_cast<std::size_t>(k) * frame.channels + c];
-      if (got != expected) {
+      if (!(std::fabs(got - expected) <= tolerance)) {
         return "sample " + std::to_string(k) + " channel " + std::to_string(c) + " is " + std::to_string(got) +
                " instead of " + std::to_string(expected);
       }
     }
   }
   return {};
+}
+
+namespace {
+
+// The average colour of a rectangle, in the picture's own terms: Y, U, V for
+// '2vuy' and 'NV12'; R, G, B for 'rgba' (held as B, G, R, A).
+struct Average {
+  double c[3] = {0, 0, 0};
+};
+
+Average AverageOf(const VideoFrame& f, int x0, int y0, int x1, int y1) {
+  Average a;
+  long count = 0;
+  const int step = std::max(1, std::min(x1 - x0, y1 - y0) / 8);
+  for (int y = y0; y < y1; y += step) {
+    const std::uint8_t* row = f.data + static_cast<std::size_t>(y) * f.stride;
+    for (int x = x0; x < x1; x += step) {
+      int v[3];
+      if (f.code == pm::kCode2vuy) {
+        const std::uint8_t* pair = row + 4 * (x / 2);
+        v[0] = row[2 * x + 1], v[1] = pair[0], v[2] = pair[2];
+      } else if (f.code == pm::kCodeNV12) {
+        const std::uint8_t* chroma = f.data + static_cast<std::size_t>(f.height) * f.stride +
+                                     static_cast<std::size_t>(y / 2) * f.stride + 2 * (x / 2);
+        v[0] = row[x], v[1] = chroma[0], v[2] = chroma[1];
+      } else {
+        v[0] = row[4 * x + 2], v[1] = row[4 * x + 1], v[2] = row[4 * x];
+      }
+      for (int k = 0; k < 3; ++k) a.c[k] += v[k];
+      ++count;
+    }
+  }
+  for (double& c : a.c) c /= static_cast<double>(std::max(1L, count));
+  return a;
+}
+
+}  // namespace
+
+BlocksReading ReadBlocks(const VideoFrame& frame, int tolerance) {
+  BlocksReading r;
+  const bool yuv = frame.code == pm::kCode2vuy || frame.code == pm::kCodeNV12;
+  if (!yuv && frame.code != pm::kCodeRgba) {
+    r.problem = "picture code " + CodeText(frame.code) + " is not one blocks are read from";
+    return r;
+  }
+  if (tolerance < 0) tolerance = yuv ? 16 : 32;
+  const int w = frame.width, h = frame.height;
+  const std::uint64_t rows = frame.code == pm::kCodeNV12 ? static_cast<std::uint64_t>(h) * 3 / 2 : h;
+  const std::uint64_t rowBytes = static_cast<std::uint64_t>(w) * (frame.code == pm::kCode2vuy ? 2 : frame.code == pm::kCodeNV12 ? 1 : 4);
+  if (w < 2 * ndits::kBlockCells || h < 16) {
+    r.problem = "a " + std::to_string(w) + "x" + std::to_string(h) + " picture is too small for blocks";
+    return r;
+  }
+  if (frame.data == nullptr || frame.stride < rowBytes || frame.bytes < rows * frame.stride) {
+    r.problem = "the picture is shorter than its size and stride";
+    return r;
+  }
+  // Each bar, in the middle half of its width and of the bars' height.
+  const int barRows = ndits::BlockBarRows(h);
+  for (int i = 0; i < ndits::kBarCount; ++i) {
+    const int left = ndits::BarLeft(w, i), right = i + 1 == ndits::kBarCount ? w : ndits::BarLeft(w, i + 1);
+    const Average a = AverageOf(frame, left + (right - left) / 4, barRows / 4, right - (right - left) / 4, barRows * 3 / 4);
+    const ndits::BarColour& want = ndits::BarColourOf(i);
+    const int expected[3] = {yuv ? want.y : want.r, yuv ? want.u : want.g, yuv ? want.v : want.b};
+    for (int k = 0; k < 3; ++k) {
+      if (std::fabs(a.c[k] - expected[k]) > tolerance) {
+        char text[160];
+        std::snprintf(text, sizeof text, "bar %d channel %d averages %.1f instead of %d", i, k, a.c[k], expected[k]);
+        r.problem = text;
+        break;
+      }
+    }
+    if (!r.problem.empty()) break;
+  }
+  // Each cell, in the middle half of its width and of the cells' height.
+  const double threshold = yuv ? (16 + 235) / 2.0 : 255 / 2.0;
+  std::uint64_t code = 0;
+  for (int i = 0; i < ndits::kBlockCells; ++i) {
+    const int left = ndits::CellLeft(w, i), right = i + 1 == ndits::kBlockCells ? w : ndits::CellLeft(w, i + 1);
+    const int top = barRows + (h - barRows) / 4, bottom = h - (h - barRows) / 4;
+    const Average a = AverageOf(frame, left + (right - left) / 4, top, std::max(left + (right - left) / 4 + 1, right - (right - left) / 4), bottom);
+    const double level = yuv ? a.c[0] : (a.c[0] + a.c[1] + a.c[2]) / 3;
+    if (level > threshold) code |= std::uint64_t{1} << i;
+  }
+  r.number = ndits::BlockNumber(code);
+  if (r.number < 0 && r.problem.empty()) r.problem = "the number's check bits do not hold";
+  return r;
 }
 
 }  // namespace pmhost

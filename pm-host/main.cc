@@ -154,6 +154,9 @@ int main(int argc, char** argv) {
   }
   demo.host = host;
   demo.interrupted = &g_interrupted;
+#ifdef PM_NDI_VENDOR_RUNTIME
+  demo.lossy = true;  // built on the vendor runtime
+#endif
   demo.progress = demo.json ? pmhost::Progress::None : progress;
   return pmhost::RunDemo(demo);
 }

@@ -129,6 +129,8 @@ class ReceiveSink : public FrameSink {
   void OnVideo(const std::string&, const VideoFrame& frame) override {
     const std::int64_t wall = WallNs();
     const std::int64_t steady = SteadyNs();
+    std::int64_t none = 0;
+    firstVideo_.compare_exchange_strong(none, steady);
     stats_.Video(frame.mediaTime, frame.code, frame.width, frame.height, frame.stride, wall, steady);
     if (!options_.snapshot.empty() && steady - lastCopy_ >= 200'000'000) {
       lastCopy_ = steady;
@@ -160,6 +162,8 @@ class ReceiveSink : public FrameSink {
     wav_.Close();
     return complete;
   }
+  // Steady time of the first picture read; 0 before it.
+  std::int64_t FirstVideoNs() const { return firstVideo_.load(); }
 
  private:
   void WriteWav(const AudioFrame& frame) {
@@ -189,6 +193,7 @@ class ReceiveSink : public FrameSink {
 
   ReceiveStats& stats_;
   const ReceiveOptions& options_;
+  std::atomic<std::int64_t> firstVideo_{0};
   // Reader thread only:
   std::int64_t lastCopy_ = INT64_MIN / 2;
   WavWriter wav_;  // closed by the owner after the readers stopped
@@ -215,6 +220,7 @@ json ReceiveResult::ToJson() const {
   out["unique_id"] = id;
   out["runner_exit"] = runnerExit;
   out["runner_cpu_seconds"] = std::round(runnerCpuSeconds * 1000) / 1000;
+  if (firstPictureSeconds >= 0) out["first_picture_seconds"] = std::round(firstPictureSeconds * 1000) / 1000;
   if (!error.empty()) out["error"] = error;
   return out;
 }
@@ -366,6 +372,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   }
 
   const json config = {{"bandwidth", "ndi_bandwidth_" + options.bandwidth}};
+  const std::int64_t startSourceNs = SteadyNs();
   if (!session.StartSource(match.id, config)) {
     result.error = "the task did not answer start_source";
     result.runnerExit = host.Stop();
@@ -381,6 +388,9 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   bool printedTerminal = false;
   for (;;) {
     StatsSnapshot now = stats.Snapshot(SteadyNs(), /*latency=*/false);
+    if (now.frames > 0 && result.runnerCpuAtFirstPicture == 0) {
+      result.runnerCpuAtFirstPicture = ProcessCpuSeconds(host.RunnerPid());
+    }
     if (!commandsSent && (now.state == 2 || now.frames > 0 || now.audioBuffers > 0 || elapsed() > 5)) {
       commandsSent = true;
       if (options.tally == "live" || options.tally == "both") session.ShotEvent(match.id, "TALLY_LIVE_ON");
@@ -418,6 +428,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   // Ctrl-C on a terminal reaches the runner too, which then ends in order.
   if (!host.RunnerRunning() && !Interrupted(options.interrupted)) result.error = "the runner ended during the run";
 
+  if (sink.FirstVideoNs() != 0) result.firstPictureSeconds = static_cast<double>(sink.FirstVideoNs() - startSourceNs) / 1e9;
   result.memoryBases = session.MemoryBases();
   result.runnerCpuSeconds = ProcessCpuSeconds(host.RunnerPid());
   session.StopSource(match.id);
@@ -463,7 +474,7 @@ int RunDemo(const DemoOptions& options) {
   ChildProcess sender;
   ChildOptions child;
   child.path = senderPath;
-  child.args = {"--name", "pm-host demo", "--pattern", "bars", "--width", "1280", "--height", "720",
+  child.args = {"--name", "pm-host demo", "--pattern", options.lossy ? "blocks" : "bars", "--width", "1280", "--height", "720",
                 "--fps", "30", "--seconds", std::to_string(static_cast<int>(options.seconds) + 60)};
   child.env = {{"NDI_LOOPBACK_DIR", registry}};
   child.captureStdout = true;
@@ -492,8 +503,9 @@ int RunDemo(const DemoOptions& options) {
   if (name.empty()) {
     std::fprintf(options.err, "pm-host demo: the sender did not start\n");
   } else {
-    std::fprintf(info, "pm-host demo: sending colour bars and a 1 kHz tone as '%s'; receiving for %.0f s\n",
-                 name.c_str(), options.seconds);
+    std::fprintf(info, "pm-host demo: sending %s as '%s'; receiving for %.0f s\n",
+                 options.lossy ? "numbered colour bars and a ramp" : "colour bars and a 1 kHz tone", name.c_str(),
+                 options.seconds);
     std::fflush(info);
     std::atomic<std::uint64_t> goodPictures{0}, badPictures{0}, goodSound{0}, badSound{0};
     std::mutex firstLock;  // guards firstProblem
@@ -514,13 +526,27 @@ int RunDemo(const DemoOptions& options) {
     receive.progress = options.progress;
     receive.out = info;
     receive.interrupted = options.interrupted;
+    std::int64_t lastNumber = -1;  // reader thread only
     receive.onVideo = [&](const VideoFrame& frame) {
-      const std::string check = CheckBars(frame);
+      std::string check;
+      if (options.lossy) {
+        // Through a lossy codec: the bars within a tolerance, and each
+        // picture's number one above the last.
+        const BlocksReading r = ReadBlocks(frame);
+        check = r.problem;
+        if (check.empty() && lastNumber >= 0 && r.number != lastNumber + 1) {
+          check = "picture " + std::to_string(r.number) + " after " + std::to_string(lastNumber);
+        }
+        lastNumber = r.number;
+      } else {
+        check = CheckBars(frame);
+      }
       ++(check.empty() ? goodPictures : badPictures);
       if (!check.empty()) problem("picture: " + check);
     };
     receive.onAudio = [&](const AudioFrame& frame) {
-      const std::string check = CheckTone(frame);
+      std::int64_t first = 0;
+      const std::string check = options.lossy ? CheckRampSound(frame, &first, 1e-4f) : CheckTone(frame);
       ++(check.empty() ? goodSound : badSound);
       if (!check.empty()) problem("sound: " + check);
     };

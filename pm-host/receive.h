@@ -69,6 +69,8 @@ struct ReceiveResult {
   std::string error;       // why it did not run
   int runnerExit = -1;
   double runnerCpuSeconds = 0;           // user + system time of pm-runner, read before stop_source
+  double firstPictureSeconds = -1;       // from sending start_source to reading the first picture; -1: none
+  double runnerCpuAtFirstPicture = 0;    // runnerCpuSeconds as it was when the first picture was read (20 ms)
   std::vector<std::string> memoryBases;  // of the source's queue (its segments' names start so)
   StatsSnapshot stats;
   nlohmann::json ToJson() const;
@@ -93,6 +95,10 @@ struct DemoOptions {
   std::FILE* err = stderr;       // failures (with json: every other line too)
   const std::atomic<bool>* interrupted = nullptr;
   bool json = false;
+  // The runtime compresses pictures (the vendor's): the sender sends the
+  // "blocks" pattern and its ramp sound, checked within tolerances, instead
+  // of bars and tone checked exactly.
+  bool lossy = false;
 };
 
 // Returns the exit status: 0 only when pictures and sound arrived intact and

@@ -170,6 +170,14 @@ void NDISource::ProcessMetadataFrame(const ndi_metadata_frame& frame) {
     if (model != modelName_) {
       pm::Log(pm::LogType::Normal, kLogTag, "NDI source model name: %s", model.c_str());
       modelName_ = model;
+      // The vendor runtime signals PTZ support (a status change) before it
+      // delivers the sender's product metadata: a suite already reported
+      // goes out again with the model it now has.
+      if (ptzReported_) {
+        if (const std::shared_ptr<Callbacks>& callbacks = GetCallbacks()) {
+          callbacks->UpdatePtzCommandSuite("NDI3", modelName_);
+        }
+      }
     }
   } else if (rootName == "skyrelay_ext" || rootName == "metadata") {
     const tinyxml2::XMLElement* child = root->FirstChildElement("buildOutDuration");
@@ -190,7 +198,8 @@ void NDISource::ProcessMetadataFrame(const ndi_metadata_frame& frame) {
 
 void NDISource::ReportPtzSupport(void* receiver) {
   const std::shared_ptr<Callbacks>& callbacks = GetCallbacks();
-  if (api_->recv_ptz_is_supported(receiver)) {
+  ptzReported_ = api_->recv_ptz_is_supported(receiver);
+  if (ptzReported_) {
     pm::Log(pm::LogType::Normal, kLogTag, "%s supports PTZ\n", UniqueId().c_str());
     if (callbacks) callbacks->UpdatePtzCommandSuite("NDI3", modelName_);
   } else if (callbacks) {

@@ -103,6 +103,7 @@ void NDISource::StartLocked() {
   producesMask_ = 0;
   timestampBase_ = INT64_MAX;
   resetPending_ = false;
+  ptzReported_ = false;
   env_.clock->ClearSignals();
   std::promise<void> done;
   loopDone_ = done.get_future();

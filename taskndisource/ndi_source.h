@@ -191,6 +191,7 @@ class NDISource : public pm::Source {
 
   // Receiver thread only (reset by Start before the thread begins).
   std::string modelName_;
+  bool ptzReported_ = false;  // the last ReportPtzSupport found PTZ supported
   std::uint32_t producesMask_ = 0;
   std::int64_t timestampBase_ = INT64_MAX;
   bool resetPending_ = false;  // a new base was taken; the host's clock is not reset yet

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "ndi-loopback/picture.h"
+#include "ndi-testsrc/pattern.h"
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/wire.h"
 #include "taskndisource/ndi_abi.h"
@@ -157,7 +158,7 @@ TEST(RegistryEntry, FullNameUpperCasesTheHost) {
   for (char c : full.substr(0, full.size() - 8)) EXPECT_FALSE(c >= 'a' && c <= 'z') << full;
 }
 
-TEST(HalvePicture, UyvyKeepsEveryOtherPixelWithItsChroma) {
+TEST(ScalePicture, UyvyKeepsEveryOtherPixelWithItsChroma) {
   // 8x2 UYVY: pixel x has Y = 10 + x; macropixel m has U = 100 + m, V = 200 + m.
   std::vector<std::uint8_t> in(16 * 2);
   for (int y = 0; y < 2; ++y) {
@@ -169,12 +170,77 @@ TEST(HalvePicture, UyvyKeepsEveryOtherPixelWithItsChroma) {
       p[3] = static_cast<std::uint8_t>(11 + 2 * m);
     }
   }
-  ndilb::HalfPicture half;
-  ASSERT_TRUE(ndilb::HalvePicture(kNdiFourCCUYVY, 8, 2, 16, in.data(), &half));
+  ndilb::ScaledPicture half;
+  ASSERT_TRUE(ndilb::ScalePicture(kNdiFourCCUYVY, 8, 2, 16, in.data(), 4, 1, &half));
   EXPECT_EQ(half.xres, 4);
   EXPECT_EQ(half.yres, 1);
   EXPECT_EQ(half.bytes, (std::vector<std::uint8_t>{100, 10, 200, 12, 102, 14, 202, 16}));
-  EXPECT_FALSE(ndilb::HalvePicture(kNdiFourCCUYVY, 2, 1, 4, in.data(), &half)) << "nothing left to halve";
+  EXPECT_FALSE(ndilb::ScalePicture(kNdiFourCCUYVY, 2, 1, 4, in.data(), 0, 1, &half)) << "nothing left";
+}
+
+// The sizes, FourCCs and strides the vendor runtime was seen to deliver.
+TEST(Delivered, AsTheVendorRuntimeDeliversThem) {
+  const int sizes[][4] = {{1920, 1080, 640, 360}, {3840, 2160, 640, 360}, {1440, 1080, 640, 480}, {720, 576, 640, 512},
+                          {1080, 1920, 360, 640}, {1000, 1000, 640, 640}, {2048, 1080, 640, 336}, {1366, 768, 640, 358},
+                          {1922, 1082, 640, 360}, {640, 360, 640, 360},   {330, 180, 330, 180},   {64, 16, 64, 16}};
+  for (const auto& s : sizes) {
+    int w = 0, h = 0;
+    ndilb::ProxySize(s[0], s[1], &w, &h);
+    EXPECT_EQ(w, s[2]) << s[0] << "x" << s[1];
+    EXPECT_EQ(h, s[3]) << s[0] << "x" << s[1];
+  }
+  // Colour formats BGRX_BGRA, UYVY_BGRA, RGBX_RGBA, UYVY_RGBA, fastest.
+  const std::uint32_t plain[] = {kNdiFourCCBGRX, kNdiFourCCUYVY, kNdiFourCCRGBX, kNdiFourCCUYVY, kNdiFourCCUYVY};
+  const std::uint32_t alpha[] = {kNdiFourCCBGRA, kNdiFourCCBGRA, kNdiFourCCRGBA, kNdiFourCCRGBA, kNdiFourCCUYVA};
+  const std::int32_t formats[] = {kNdiColorBgrxBgra, kNdiColorUyvyBgra, kNdiColorRgbxRgba, kNdiColorUyvyRgba,
+                                  kNdiColorFastest};
+  for (int i = 0; i < 5; ++i) {
+    EXPECT_EQ(ndilb::DeliveredFourCC(formats[i], false), plain[i]) << formats[i];
+    EXPECT_EQ(ndilb::DeliveredFourCC(formats[i], true), alpha[i]) << formats[i];
+  }
+  std::vector<std::uint8_t> bgra(8 * 4, 255);
+  EXPECT_FALSE(ndilb::HasAlpha(kNdiFourCCBGRA, 4, 2, 16, bgra.data())) << "opaque";
+  bgra[31] = 254;
+  EXPECT_TRUE(ndilb::HasAlpha(kNdiFourCCBGRA, 4, 2, 16, bgra.data()));
+  EXPECT_FALSE(ndilb::HasAlpha(kNdiFourCCBGRX, 4, 2, 16, bgra.data())) << "X is not alpha";
+  EXPECT_TRUE(ndilb::HasAlpha(kNdiFourCCUYVA, 4, 2, 8, bgra.data()));
+  EXPECT_EQ(ndilb::DeliveredStride(kNdiFourCCUYVY, 330), 672);
+  EXPECT_EQ(ndilb::DeliveredStride(kNdiFourCCUYVY, 1366), 2752);
+  EXPECT_EQ(ndilb::DeliveredStride(kNdiFourCCUYVY, 1920), 3840);
+  EXPECT_EQ(ndilb::DeliveredStride(kNdiFourCCBGRX, 330), 1344);
+}
+
+// The 75% bars through the conversions, against what the vendor runtime made
+// of the same bars (its YUV to RGB is not quite BT.709).
+TEST(ConvertPicture, BarsBecomeWhatTheVendorRuntimeMakesOfThem) {
+  struct Case {
+    const char* from;
+    std::uint32_t to;
+    int expected[8][3];  // per bar: B, G, R for RGB targets; U, Y, V for UYVY
+  };
+  const Case cases[] = {
+      {"uyvy", kNdiFourCCBGRX, {{190, 190, 190}, {7, 187, 190}, {187, 215, 0}, {5, 212, 0}, {185, 0, 191}, {2, 0, 191}, {182, 2, 0}, {0, 0, 0}}},
+      {"nv12", kNdiFourCCBGRX, {{190, 190, 190}, {7, 187, 190}, {187, 215, 0}, {5, 212, 0}, {185, 0, 191}, {2, 0, 191}, {182, 2, 0}, {0, 0, 0}}},
+      {"bgra", kNdiFourCCUYVY, {{127, 180, 128}, {43, 168, 135}, {146, 145, 44}, {63, 133, 51}, {192, 63, 204}, {108, 50, 211}, {211, 27, 120}, {128, 16, 128}}},
+      {"rgbx", kNdiFourCCUYVY, {{127, 180, 128}, {43, 168, 135}, {146, 145, 44}, {63, 133, 51}, {192, 63, 204}, {108, 50, 211}, {211, 27, 120}, {128, 16, 128}}},
+      {"i420", kNdiFourCCUYVY, {{128, 180, 128}, {44, 168, 136}, {147, 145, 44}, {63, 133, 52}, {193, 63, 204}, {109, 51, 212}, {212, 28, 120}, {128, 16, 128}}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.from);
+    const std::uint32_t from = ndits::FourCCFromName(c.from);
+    const auto planes = ndits::PictureLayout(from, 64, 4);
+    std::vector<std::uint8_t> in(ndits::PictureSize(planes));
+    ndits::Bars(from, 64, 4).Fill(1000, in.data());  // its marker covers rows 0 and 1
+    const int stride = ndilb::DeliveredStride(c.to, 64);
+    std::vector<std::uint8_t> out(ndilb::PictureBytes(c.to, 64, 4, stride));
+    ASSERT_TRUE(ndilb::ConvertPicture(from, 64, 4, planes[0].stride, in.data(), c.to, stride, out.data()));
+    const std::uint8_t* row = out.data() + 3 * static_cast<std::size_t>(stride);  // below the marker
+    for (int bar = 0; bar < 8; ++bar) {
+      const int x = bar * 8 + 4;
+      const std::uint8_t* px = c.to == kNdiFourCCUYVY ? row + 2 * x : row + 4 * x;
+      for (int k = 0; k < 3; ++k) EXPECT_NEAR(px[k], c.expected[bar][k], 3) << "bar " << bar << " channel " << k;
+    }
+  }
 }
 
 TEST(PictureBytes, RefusesImpossiblePictures) {

@@ -46,7 +46,12 @@ std::string Folder::ReadRunnerLog() const {
 bool Sender::Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
   pmhost::ChildOptions o;
   o.path = BuiltPrograms().testsrc;
-  o.args = {"--name", name, "--seconds", "120"};
+  o.args = {"--name", name};
+  // Two minutes unless the caller says how long.
+  if (std::find(args.begin(), args.end(), "--seconds") == args.end() &&
+      std::find(args.begin(), args.end(), "--frames") == args.end()) {
+    o.args.insert(o.args.end(), {"--seconds", "120"});
+  }
   o.args.insert(o.args.end(), args.begin(), args.end());
   o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
   o.captureStdout = true;

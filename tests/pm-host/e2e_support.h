@@ -52,7 +52,8 @@ struct Folder {
 // ndi-testsrc with its event lines (JSON objects on stdout) collected.
 class Sender {
  public:
-  // Starts `--name name --seconds 120 args...` and waits for its "ready".
+  // Starts `--name name args...` (with `--seconds 120` unless args give
+  // --seconds or --frames) and waits for its "ready".
   bool Start(const Folder& folder, const std::string& name, std::vector<std::string> args);
   std::string Name() { return Find("ready").value("name", ""); }
   // The first event of this kind for which `match` holds, or null.

@@ -222,6 +222,18 @@ TEST_F(MetadataTest, PtzSupportIsReportedWithTheModelName) {
   EXPECT_TRUE(logs.Contains("#ndisource: NDICaptureDevice~STUDIO (Cam 1) supports PTZ\n"));
 }
 
+// The vendor runtime's order: PTZ support first, the product metadata after.
+TEST_F(MetadataTest, AModelNameArrivingAfterPtzSupportIsReportedAgain) {
+  ndi.SetPtzSupported(true);
+  source->ReportPtzSupport(kReceiver);
+  Metadata(R"(<ndi_product model_name="Model Y"/>)");
+  Metadata(R"(<ndi_product model_name="Model Y"/>)");
+  ndi.SetPtzSupported(false);
+  source->ReportPtzSupport(kReceiver);
+  Metadata(R"(<ndi_product model_name="Model Z"/>)");
+  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
+}
+
 // Through the receiver loop: tally, shot events and PTZ commands reach the
 // sender only after a delivered frame, in order.
 class MetadataLoopTest : public MetadataTest {

@@ -1,0 +1,367 @@
+// The whole chain on the vendor NDI runtime: ndi-testsrc senders and the task
+// module in pm-runner both on libndi.so.5, discovery through the sandbox's
+// avahi-daemon, the host library reading shared memory. The vendor's codec is
+// lossy, so pictures carry the "blocks" pattern (bars checked within a
+// tolerance, picture numbers read from their cells) and sound the ramp.
+//
+// Runs only inside scripts/ndi-sandbox (PM_NDI_SANDBOX=1): anywhere else every
+// case is skipped with the reason, and no vendor discovery starts. The cases
+// share one 1080p camera (sent for the whole run); each receive starts its
+// own runner and ends it with the last stop_source.
+#include <gtest/gtest.h>
+
+#include <signal.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cstdlib>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <thread>
+
+#include "e2e_support.h"
+#include "pm-host/checks.h"
+#include "pm-host/receive.h"
+#include "pm/task/formats.h"
+#include "support/wait.h"
+
+namespace {
+
+using nlohmann::json;
+using namespace std::chrono_literals;
+using pmtest::Folder;
+using pmtest::Sender;
+
+bool InSandbox() {
+  const char* value = std::getenv("PM_NDI_SANDBOX");
+  return value != nullptr && std::string(value) == "1";
+}
+
+// ctest reports the run as skipped on this text (SKIP_REGULAR_EXPRESSION).
+constexpr char kSkipped[] =
+    "vendor tests skipped: not inside scripts/ndi-sandbox (PM_NDI_SANDBOX is not 1), and the vendor runtime's "
+    "discovery never runs on the machine's own network";
+
+std::vector<std::string> Blocks(int width, int height, std::vector<std::string> more = {}) {
+  std::vector<std::string> args = {"--pattern", "blocks", "--width", std::to_string(width),
+                                   "--height",  std::to_string(height), "--fps", "30"};
+  args.insert(args.end(), more.begin(), more.end());
+  return args;
+}
+
+// The camera every case may use: 1920x1080 UYVY at 30 fps with 48 kHz stereo,
+// PTZ and a model name.
+struct Camera : ::testing::Environment {
+  void SetUp() override {
+    if (!InSandbox()) return;
+    folder = std::make_unique<Folder>();
+    sender = std::make_unique<Sender>();
+    up = sender->Start(*folder, "Vendor Camera",
+                       Blocks(1920, 1080, {"--ptz", "--model", "PX-7", "--audio-rate", "48000", "--audio-channels",
+                                           "2", "--seconds", "900"}));
+  }
+  void TearDown() override {
+    sender.reset();
+    folder.reset();
+  }
+  std::unique_ptr<Folder> folder;
+  std::unique_ptr<Sender> sender;
+  bool up = false;
+};
+Camera* const g_camera = static_cast<Camera*>(::testing::AddGlobalTestEnvironment(new Camera));
+
+// What one receive run saw: pictures by number, sound, states, notifications.
+class Watch {
+  template <class F>
+  auto Locked(F f) -> decltype(f()) {
+    std::lock_guard<std::mutex> guard(lock_);
+    return f();
+  }
+
+ public:
+  void Attach(pmhost::ReceiveOptions& o) {
+    o.onVideo = [this](const pmhost::VideoFrame& frame) {
+      const pmhost::BlocksReading r = pmhost::ReadBlocks(frame);
+      std::lock_guard<std::mutex> guard(lock_);
+      numbers_.push_back(r.number);
+      if (!r.problem.empty() && problem_.empty()) problem_ = r.problem;
+      damaged_ += r.problem.empty() ? 0 : 1;
+    };
+    o.onAudio = [this](const pmhost::AudioFrame& frame) {
+      std::int64_t first = -1;
+      // The runtime carries sound with about 16 bits: 1e-4 keeps every
+      // sample apart from its neighbours' values (steps of 1/1024).
+      const std::string check = pmhost::CheckRampSound(frame, &first, 1e-4f);
+      std::lock_guard<std::mutex> guard(lock_);
+      ++(check.empty() ? soundIntact_ : soundDamaged_);
+      if (!check.empty() && problem_.empty()) problem_ = "sound: " + check;
+      if (nextSample_ >= 0 && first != nextSample_ % 1024) ++soundGaps_;
+      nextSample_ = first + frame.samples;
+    };
+    o.onNotification = [this](const std::string& command, const json& message) {
+      std::lock_guard<std::mutex> guard(lock_);
+      if (command == "pm::tsrc::update_connection_state") {
+        states_.push_back(message.value("state", 0));
+      } else {
+        notes_.push_back(json{{"command", command}, {"message", message}});
+      }
+    };
+  }
+  int Pictures() { return Locked([&] { return static_cast<int>(numbers_.size()); }); }
+  // Neighbouring pictures whose numbers do not follow each other: lost,
+  // repeated and reordered pictures all count.
+  int Irregular() {
+    return Locked([&] {
+      int n = 0;
+      for (std::size_t i = 1; i < numbers_.size(); ++i) n += numbers_[i] == numbers_[i - 1] + 1 ? 0 : 1;
+      return n;
+    });
+  }
+  int Damaged() { return Locked([&] { return damaged_; }); }
+  int SoundIntact() { return Locked([&] { return soundIntact_; }); }
+  int SoundDamagedOrGaps() { return Locked([&] { return soundDamaged_ + soundGaps_; }); }
+  std::string Problem() { return Locked([&] { return problem_; }); }
+  std::vector<int> States() { return Locked([&] { return states_; }); }
+  bool Noted(const std::string& command, const json& fields) {
+    return Locked([&] {
+      for (const json& n : notes_) {
+        if (n["command"] != command) continue;
+        bool all = true;
+        for (const auto& [key, value] : fields.items()) all = all && n["message"].value(key, json()) == value;
+        if (all) return true;
+      }
+      return false;
+    });
+  }
+
+ private:
+  std::mutex lock_;  // guards everything below
+  std::vector<std::int64_t> numbers_;
+  int damaged_ = 0, soundIntact_ = 0, soundDamaged_ = 0, soundGaps_ = 0;
+  std::int64_t nextSample_ = -1;
+  std::string problem_;
+  std::vector<int> states_;
+  std::vector<json> notes_;
+};
+
+bool Has(const std::vector<int>& states, int state) {
+  return std::find(states.begin(), states.end(), state) != states.end();
+}
+
+// States in order: `first`, later `then`.
+bool InOrder(const std::vector<int>& states, int first, int then) {
+  const auto at = std::find(states.begin(), states.end(), first);
+  return at != states.end() && std::find(at, states.end(), then) != states.end();
+}
+
+class Vendor : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!InSandbox()) GTEST_SKIP() << kSkipped;
+    ASSERT_TRUE(g_camera->up) << "the camera did not start";
+  }
+  static Folder& Place() { return *g_camera->folder; }
+  static Sender& Cam() { return *g_camera->sender; }
+  // Receives a source by its unique id (the source itself finds the sender).
+  static pmhost::ReceiveOptions From(Sender& sender, Watch& watch) {
+    pmhost::ReceiveOptions o = pmtest::ReceiveFrom(Place(), pmhost::kSourceIdPrefix + sender.Name());
+    watch.Attach(o);
+    return o;
+  }
+};
+
+TEST_F(Vendor, DiscoveryListsTwoSendersAndWithdrawsAKilledOne) {
+  Sender other;
+  ASSERT_TRUE(other.Start(Place(), "Vendor Brief", Blocks(640, 360, {"--no-audio"})));
+  std::mutex lock;  // guards seen, gone
+  std::set<std::string> seen, gone;
+  std::atomic<bool> stop{false};
+  pmhost::ListOptions list;
+  list.host = pmtest::HostOptionsFor(Place());
+  list.seconds = 120;
+  list.out = stderr;
+  list.interrupted = &stop;
+  list.onChange = [&](bool available, const std::string& id, const std::string& name) {
+    std::lock_guard<std::mutex> guard(lock);
+    (available ? seen : gone).insert(name);
+    EXPECT_EQ(id, pmhost::kSourceIdPrefix + name);
+  };
+  int status = -1;
+  std::thread listing([&] { status = pmhost::Discover(list); });
+  auto has = [&](const std::set<std::string>& set, const std::string& name) {
+    std::lock_guard<std::mutex> guard(lock);
+    return set.count(name) == 1;
+  };
+  EXPECT_TRUE(pmtest::WaitFor([&] { return has(seen, Cam().Name()) && has(seen, other.Name()); }, 20s));
+  other.Process().Signal(SIGKILL);
+  EXPECT_TRUE(pmtest::WaitFor([&] { return has(gone, other.Name()); }, 30s));
+  stop = true;
+  listing.join();
+  EXPECT_EQ(status, 0);
+  EXPECT_FALSE(has(gone, Cam().Name()));
+}
+
+TEST_F(Vendor, A1080pCameraArrivesWholeAndInOrderWithItsSound) {
+  Watch watch;
+  pmhost::ReceiveOptions o = From(Cam(), watch);
+  o.frames = 90;
+  o.seconds = 60;
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  pmtest::ExpectOrderlyEnd(result, Place());
+  EXPECT_GE(watch.Pictures(), 90);
+  EXPECT_EQ(watch.Damaged(), 0) << watch.Problem();
+  EXPECT_EQ(watch.Irregular(), 0) << "lost, repeated or reordered pictures";
+  EXPECT_EQ(pmhost::CodeText(result.stats.videoCode), "2vuy");
+  EXPECT_EQ(result.stats.width, 1920);
+  EXPECT_EQ(result.stats.height, 1080);
+  EXPECT_EQ(result.stats.stride, 3840u);
+  EXPECT_GE(watch.SoundIntact(), 60);
+  EXPECT_EQ(watch.SoundDamagedOrGaps(), 0) << watch.Problem();
+  EXPECT_EQ(result.stats.audioRate, 48000);
+  EXPECT_EQ(result.stats.audioChannels, 2);
+  const std::vector<int> states = watch.States();
+  ASSERT_FALSE(states.empty());
+  EXPECT_EQ(states.front(), 1) << ::testing::PrintToString(states);
+  EXPECT_TRUE(InOrder(states, 1, 2)) << ::testing::PrintToString(states);
+}
+
+TEST_F(Vendor, TallyMetadataShotEventsAndPtzGoBothWaysExactly) {
+  Watch watch;
+  pmhost::ReceiveOptions o = From(Cam(), watch);
+  o.seconds = 3;
+  o.tally = "preview";
+  o.shotEvents = {"Vendor shot"};
+  o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  pmtest::ExpectOrderlyEnd(result, Place());
+  auto metadata = [](const std::string& xml) {
+    return [xml](const json& e) { return e.value("xml", "") == xml; };
+  };
+  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<metadata>\n    <receiver_info name=\"Skyrelay\" vendor=\"Quillfront LLC\" "
+                                                 "protocol_version=\"1\"/>\n</metadata>\n")));
+  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<metadata>\n    <media_settings width=\"1280\" height=\"720\" "
+                                                 "framerate=\"1\"/>\n</metadata>\n")));
+  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<skyrelay_ext>\n    <event value=\"Vendor shot\" preview=\"1\" "
+                                                 "live=\"0\"/>\n</skyrelay_ext>\n")));
+  EXPECT_TRUE(Cam().WaitFor("tally", [](const json& e) { return e.value("preview", false) && !e.value("program", true); }));
+  EXPECT_TRUE(Cam().WaitFor("ptz", [](const json& e) {
+    return e.value("command", "") == "zoom" && e["values"].value("zoom", 0.0) == 0.5;
+  }));
+  EXPECT_TRUE(Cam().WaitFor("ptz", [](const json& e) {
+    return e.value("command", "") == "pan_tilt" && e["values"].value("pan", 0.0) == 0.25 &&
+           e["values"].value("tilt", 0.0) == -0.5;
+  }));
+  EXPECT_TRUE(watch.Noted("pm::tsrc::update_ptz_command_suite", {{"suite", "NDI3"}, {"model", "PX-7"}}));
+}
+
+// What a sender's pictures become, given the receiver's colour format
+// (UYVY_BGRA): pictures without alpha arrive as UYVY, with alpha as BGRA.
+struct FormatCase {
+  const char* format;
+  const char* code;  // host code
+};
+void PrintTo(const FormatCase& c, std::ostream* os) { *os << c.format; }
+
+class VendorFormats : public Vendor, public ::testing::WithParamInterface<FormatCase> {};
+
+TEST_P(VendorFormats, ArriveInTheHostCodeOfTheColourFormat) {
+  Sender sender;
+  ASSERT_TRUE(sender.Start(Place(), std::string("Vendor ") + GetParam().format,
+                           Blocks(640, 360, {"--format", GetParam().format, "--no-audio"})));
+  Watch watch;
+  pmhost::ReceiveOptions o = From(sender, watch);
+  o.frames = 30;
+  o.seconds = 60;
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  pmtest::ExpectOrderlyEnd(result, Place());
+  EXPECT_EQ(pmhost::CodeText(result.stats.videoCode), GetParam().code);
+  EXPECT_EQ(result.stats.width, 640);
+  EXPECT_EQ(result.stats.height, 360);
+  EXPECT_GE(watch.Pictures(), 30);
+  EXPECT_EQ(watch.Damaged(), 0) << watch.Problem();
+  EXPECT_EQ(watch.Irregular(), 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(Senders, VendorFormats,
+                         ::testing::Values(FormatCase{"bgra", "2vuy"}, FormatCase{"uyva", "rgba"},
+                                           FormatCase{"nv12", "2vuy"}),
+                         [](const ::testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.format); });
+
+// "lowest" brings the runtime's proxy picture (1080p becomes 640x360),
+// "audio only" no pictures.
+struct BandwidthCase {
+  const char* bandwidth;
+  int width, height;  // 0: no pictures
+};
+void PrintTo(const BandwidthCase& c, std::ostream* os) { *os << c.bandwidth; }
+
+class VendorBandwidth : public Vendor, public ::testing::WithParamInterface<BandwidthCase> {};
+
+TEST_P(VendorBandwidth, SetsWhatTheCameraSends) {
+  const BandwidthCase c = GetParam();
+  Watch watch;
+  pmhost::ReceiveOptions o = From(Cam(), watch);
+  o.bandwidth = c.bandwidth;
+  o.seconds = 3;
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  pmtest::ExpectOrderlyEnd(result, Place());
+  EXPECT_GT(watch.SoundIntact(), 20);
+  if (c.width == 0) {
+    EXPECT_EQ(result.stats.frames, 0u);
+    return;
+  }
+  EXPECT_GT(watch.Pictures(), 20);
+  EXPECT_EQ(result.stats.width, c.width);
+  EXPECT_EQ(result.stats.height, c.height);
+  EXPECT_EQ(watch.Damaged(), 0) << watch.Problem();
+}
+
+INSTANTIATE_TEST_SUITE_P(Settings, VendorBandwidth,
+                         ::testing::Values(BandwidthCase{"lowest", 640, 360}, BandwidthCase{"audio_only", 0, 0}),
+                         [](const ::testing::TestParamInfo<BandwidthCase>& info) {
+                           return std::string(info.param.bandwidth);
+                         });
+
+TEST_F(Vendor, AKilledSenderGives3AndItsReturn1Then2AndPicturesAgain) {
+  const std::vector<std::string> args = Blocks(640, 360, {"--no-audio"});
+  auto sender = std::make_unique<Sender>();
+  ASSERT_TRUE(sender->Start(Place(), "Vendor Phoenix", args));
+  Watch watch;
+  std::atomic<bool> stop{false};
+  bool restarted = false;
+  std::vector<int> afterDeath, afterReturn;
+  int before = 0;
+  pmhost::ReceiveOptions o = From(*sender, watch);
+  o.seconds = 120;
+  o.interrupted = &stop;
+  o.whileReceiving = [&](pmhost::Session&, const std::string&) {
+    auto since = [&](std::size_t mark) {
+      const std::vector<int> s = watch.States();
+      return std::vector<int>(s.begin() + static_cast<long>(std::min(mark, s.size())), s.end());
+    };
+    if (pmtest::WaitFor([&] { return watch.Pictures() > 0; }, 20s)) {
+      const std::size_t mark = watch.States().size();
+      sender->Process().Signal(SIGKILL);
+      sender->Process().Wait(10s);
+      pmtest::WaitFor([&] { return Has(since(mark), 3); }, 20s);
+      afterDeath = since(mark);
+      const std::size_t back = watch.States().size();
+      sender = std::make_unique<Sender>();
+      restarted = sender->Start(Place(), "Vendor Phoenix", args);
+      before = watch.Pictures();
+      pmtest::WaitFor([&] { return InOrder(since(back), 1, 2) && watch.Pictures() > before; }, 40s);
+      afterReturn = since(back);
+    }
+    stop = true;
+  };
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  pmtest::ExpectOrderlyEnd(result, Place());
+  EXPECT_TRUE(restarted);
+  EXPECT_TRUE(Has(afterDeath, 3)) << ::testing::PrintToString(afterDeath);
+  EXPECT_TRUE(InOrder(afterReturn, 1, 2)) << ::testing::PrintToString(afterReturn);
+  EXPECT_GT(watch.Pictures(), before);
+  EXPECT_EQ(watch.Damaged(), 0) << watch.Problem();
+}
+
+}  // namespace
