@@ -17,8 +17,8 @@
 #include <utility>
 
 #include "fuzz_support.h"
-#include "pm/runtime/dispatcher.h"
-#include "pm/runtime/frame_reader.h"
+#include "pm/ipc/dispatcher.h"
+#include "pm/ipc/frame_reader.h"
 
 namespace pm {
 struct RpcDispatcherTestAccess {

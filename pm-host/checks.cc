@@ -11,7 +11,7 @@
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/picture.h"
 #include "pm-host/record.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 #include "taskndisource/ndi_abi.h"
 
 namespace pmhost {

@@ -23,7 +23,7 @@
 #include "pm-host/wav.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 namespace pmhost {
 

@@ -20,8 +20,8 @@
 #include <cstdint>
 #include <string>
 
+#include "pm/shm/formats.h"
 #include "pm/shm/shared_memory.h"
-#include "pm/task/formats.h"
 
 namespace pmhost {
 

@@ -41,8 +41,8 @@
 #include <CLI/CLI.hpp>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/context.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
 #include "pm/task/task.h"

@@ -35,9 +35,9 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
 #include "pm/runtime/clock.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/json.h"
 
 namespace {

@@ -6,8 +6,8 @@
 #include <utility>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/log.h"
 #include "pm/shm/shared_cpu_memory_posix.h"
 #include "pm/shm/shared_gpu_memory.h"

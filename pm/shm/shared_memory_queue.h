@@ -38,8 +38,8 @@
 #include <string>
 
 #include "pm/ipc/queue_producer.h"
+#include "pm/shm/formats.h"
 #include "pm/shm/shared_memory.h"
-#include "pm/task/formats.h"
 
 namespace pm {
 

@@ -3,7 +3,7 @@
 #include <cstring>
 #include <utility>
 
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/ids.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"

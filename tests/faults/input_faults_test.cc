@@ -31,8 +31,8 @@
 #include "pm-host/queue_reader.h"
 #include "pm-host/session.h"
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "support/wait.h"
 
 namespace {

@@ -5,7 +5,7 @@
 
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/checks.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 #include "taskndisource/ndi_abi.h"
 
 namespace {

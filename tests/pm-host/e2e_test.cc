@@ -19,7 +19,7 @@
 #include "e2e_support.h"
 #include "pm-host/checks.h"
 #include "pm-host/receive.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 #include "support/wait.h"
 
 namespace {

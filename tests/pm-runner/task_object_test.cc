@@ -6,8 +6,8 @@
 #include <atomic>
 #include <memory>
 
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/task/task.h"
 
 namespace {

@@ -10,7 +10,7 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 
 namespace pmtest {
 

@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "pm/runtime/frame_reader.h"
+#include "pm/ipc/frame_reader.h"
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 
 #include <chrono>
 #include <exception>
@@ -6,8 +6,8 @@
 
 #include "pm/ip/socket.h"
 #include "pm/ipc/connection.h"
+#include "pm/ipc/frame_reader.h"
 #include "pm/runtime/clock.h"
-#include "pm/runtime/frame_reader.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/perf.h"

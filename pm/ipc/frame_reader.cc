@@ -1,4 +1,4 @@
-#include "pm/runtime/frame_reader.h"
+#include "pm/ipc/frame_reader.h"
 
 #include <algorithm>
 #include <cstring>

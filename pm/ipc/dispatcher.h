@@ -5,7 +5,7 @@
 // that reads message frames, runs handlers and matches replies to the
 // requests that are still pending.
 //
-// Messages are JSON objects sent as message frames (pm/runtime/frame_reader.h
+// Messages are JSON objects sent as message frames (pm/ipc/frame_reader.h
 // gives the wire format). Envelope keys:
 //   request / notification: "pm::unique_id" (unsigned), "pm::command"
 //     (string), "pm::request": true, plus the command's own keys;

@@ -15,9 +15,9 @@
 #include <vector>
 
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/json.h"
-#include "pm/runtime/host_socket.h"
+#include "support/host_socket.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 
