@@ -1,5 +1,5 @@
 // The runner's message path: bytes of a connection in pieces chosen by the
-// input go through pm::FrameReader (alternating Feed and the zero-copy
+// input go through pm::ipc::FrameReader (alternating Feed and the zero-copy
 // Wanted/WritePointer/Commit path), and every complete message is routed by a
 // pm::RpcDispatcher without a connection: requests reach an echo handler, a
 // handler that throws and one that leaves a non-object response; replies meet
@@ -18,7 +18,7 @@
 
 #include "fuzz_support.h"
 #include "pm/ipc/dispatcher.h"
-#include "pm/ipc/frame_reader.h"
+#include "pm/ipc/framing.h"
 
 namespace pm {
 struct RpcDispatcherTestAccess {
@@ -58,7 +58,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   dispatcher.RpcRequest("ping", second, 60000,
                         [](const nlohmann::json&) { throw std::runtime_error("callback failed"); });
 
-  pm::FrameReader reader;
+  pm::ipc::FrameReader reader;
   pmfuzz::Chunker chunker(data, size);
   const std::uint8_t* piece = nullptr;
   std::size_t length = 0;
@@ -82,11 +82,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
       Check(taken == length || reader.Oversize(), "Feed stopped short without being oversize");
     }
     while (reader.Next(&message)) {
-      Check(message.size() <= pm::FrameReader::kMaxFrameBytes, "message over the frame limit");
+      Check(message.size() <= pm::ipc::kMaxFrameBytes, "message over the frame limit");
       pm::RpcDispatcherTestAccess::Handle(dispatcher, message);
     }
   }
-  if (reader.Oversize()) Check(reader.OversizeLength() > pm::FrameReader::kMaxFrameBytes, "oversize length");
+  if (reader.Oversize()) Check(reader.OversizeLength() > pm::ipc::kMaxFrameBytes, "oversize length");
   dispatcher.Stop();
   return 0;
 }

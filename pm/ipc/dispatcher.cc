@@ -6,7 +6,7 @@
 
 #include "pm/ip/socket.h"
 #include "pm/ipc/connection.h"
-#include "pm/ipc/frame_reader.h"
+#include "pm/ipc/framing.h"
 #include "pm/runtime/clock.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
@@ -255,7 +255,7 @@ void RpcDispatcher::ExpireDue(std::int64_t now) {
 
 void RpcDispatcher::ReceiveLoop() {
   SetThreadName("pm::Rpc Receive");
-  FrameReader reader;
+  ipc::FrameReader reader;
   std::string text;
   for (;;) {
     const std::size_t wanted = reader.Wanted();
@@ -270,7 +270,7 @@ void RpcDispatcher::ReceiveLoop() {
       Log(LogType::Normal, "",
           "RpcDispatcher: frame of %u bytes exceeds %u, closing the connection\n",
           static_cast<unsigned>(reader.OversizeLength()),
-          static_cast<unsigned>(FrameReader::kMaxFrameBytes));
+          static_cast<unsigned>(ipc::kMaxFrameBytes));
       break;
     }
     while (reader.Next(&text)) HandleMessage(text);
@@ -389,7 +389,7 @@ void RpcDispatcher::HandleRequest(const Json& message) {
   if (IsScalar(commandField)) response["pm::command"] = *commandField;
   response["pm::response"] = true;
   std::string text = pmjson::Dump(response);
-  if (text.size() > FrameReader::kMaxFrameBytes) {
+  if (text.size() > ipc::kMaxFrameBytes) {
     Log(LogType::Normal, "", "RpcDispatcher: reply to '%s' is %zu bytes, too long to send\n",
         command.c_str(), text.size());
     Json error = Json::object();

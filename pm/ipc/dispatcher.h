@@ -5,7 +5,7 @@
 // that reads message frames, runs handlers and matches replies to the
 // requests that are still pending.
 //
-// Messages are JSON objects sent as message frames (pm/ipc/frame_reader.h
+// Messages are JSON objects sent as message frames (pm/ipc/framing.h
 // gives the wire format). Envelope keys:
 //   request / notification: "pm::unique_id" (unsigned), "pm::command"
 //     (string), "pm::request": true, plus the command's own keys;
@@ -109,7 +109,7 @@ class RpcDispatcher {
   // `payload` (overwriting them; they stay there), registers it as pending
   // with deadline now + timeoutMs (a negative timeout counts as 0), and sends
   // it as one frame. True when the connection accepted the frame; a text over
-  // 524,288 bytes is not sent (false). The pending entry stays either way
+  // ipc::kMaxFrameBytes is not sent (false). The pending entry stays either way
   // until a reply or the deadline removes it. A payload that is neither an
   // object nor null is not sent (false, logged).
   bool RpcRequest(std::string command, nlohmann::json& payload, std::int64_t timeoutMs,

@@ -515,8 +515,8 @@ TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTh
                             RawHost::Frame("{\"pm::command\":42,\"pm::unique_id\":\"x\"}")));
   // A frame of exactly the largest length is taken in whole.
   const std::string filler = "{\"pm::command\":\"pm::tsrc::no_such\",\"pm::unique_id\":4000000000,\"pad\":\"";
-  std::string largest = filler + std::string(pm::ipc::kMaxMessageBytes - filler.size() - 2, 'x') + "\"}";
-  ASSERT_EQ(largest.size(), pm::ipc::kMaxMessageBytes);
+  std::string largest = filler + std::string(pm::ipc::kMaxFrameBytes - filler.size() - 2, 'x') + "\"}";
+  ASSERT_EQ(largest.size(), pm::ipc::kMaxFrameBytes);
   ASSERT_TRUE(host.WriteRaw(RawHost::Frame(largest)));
   // The connection still carries requests, and the source still runs.
   const auto answer = host.Request("pm::tsrc::handle_shot_event", {{"unique_id", Id(sender)}, {"event", "X"}});
@@ -526,7 +526,7 @@ TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTh
 
   // A length over the limit: the runner drops the connection and, with no
   // other connection left, ends in order, its segments gone.
-  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxMessageBytes + 1) + "{}"));
+  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxFrameBytes + 1) + "{}"));
   EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
   EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, kExitLimit));
   EXPECT_EQ(SegmentsOf({base}), 0);

@@ -1,15 +1,27 @@
-#include "pm/ipc/frame_reader.h"
+#include "pm/ipc/framing.h"
 
 #include <algorithm>
 #include <cstring>
 #include <utility>
 
-namespace pm {
+namespace pm::ipc {
+
+std::array<std::uint8_t, kFrameHeaderBytes> FramePrefix(std::uint32_t length) {
+  return {static_cast<std::uint8_t>(length), static_cast<std::uint8_t>(length >> 8),
+          static_cast<std::uint8_t>(length >> 16), static_cast<std::uint8_t>(length >> 24)};
+}
+
+std::string EncodeFrame(std::string_view message) {
+  const auto prefix = FramePrefix(static_cast<std::uint32_t>(message.size()));
+  std::string frame(prefix.begin(), prefix.end());
+  frame.append(message);
+  return frame;
+}
 
 std::size_t FrameReader::Wanted() const {
   if (oversize_) return 0;
   if (inBody_) return body_.size() - bodyFill_;
-  return kHeaderBytes - headerFill_;
+  return kFrameHeaderBytes - headerFill_;
 }
 
 void* FrameReader::WritePointer() {
@@ -31,7 +43,7 @@ void FrameReader::Commit(std::size_t n) {
     return;
   }
   headerFill_ += n;
-  if (headerFill_ == kHeaderBytes) HeaderComplete();
+  if (headerFill_ == kFrameHeaderBytes) HeaderComplete();
 }
 
 void FrameReader::HeaderComplete() {
@@ -73,4 +85,4 @@ bool FrameReader::Next(std::string* message) {
   return true;
 }
 
-}  // namespace pm
+}  // namespace pm::ipc
