@@ -40,6 +40,7 @@
 #include "pm/ipc/server.h"
 #include "pm/runtime/clock.h"
 #include "pm/runtime/json.h"
+#include "pm/runtime/little_endian.h"
 
 namespace {
 
@@ -83,8 +84,7 @@ bool RecvExact(int fd, char* out, std::size_t n) {
 bool RecvFrame(int fd, std::string& body) {
   unsigned char header[4];
   if (!RecvExact(fd, reinterpret_cast<char*>(header), 4)) return false;
-  const std::uint32_t n = header[0] | header[1] << 8 | header[2] << 16 |
-                          static_cast<std::uint32_t>(header[3]) << 24;
+  const std::uint32_t n = pm::LoadLe32(header);
   body.resize(n);
   return RecvExact(fd, body.data(), n);
 }

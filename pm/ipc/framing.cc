@@ -4,11 +4,14 @@
 #include <cstring>
 #include <utility>
 
+#include "pm/runtime/little_endian.h"
+
 namespace pm::ipc {
 
 std::array<std::uint8_t, kFrameHeaderBytes> FramePrefix(std::uint32_t length) {
-  return {static_cast<std::uint8_t>(length), static_cast<std::uint8_t>(length >> 8),
-          static_cast<std::uint8_t>(length >> 16), static_cast<std::uint8_t>(length >> 24)};
+  std::array<std::uint8_t, kFrameHeaderBytes> prefix{};
+  StoreLe32(prefix.data(), length);
+  return prefix;
 }
 
 std::string EncodeFrame(std::string_view message) {
@@ -48,10 +51,7 @@ void FrameReader::Commit(std::size_t n) {
 
 void FrameReader::HeaderComplete() {
   headerFill_ = 0;
-  const std::uint32_t length = static_cast<std::uint32_t>(header_[0]) |
-                               static_cast<std::uint32_t>(header_[1]) << 8 |
-                               static_cast<std::uint32_t>(header_[2]) << 16 |
-                               static_cast<std::uint32_t>(header_[3]) << 24;
+  const std::uint32_t length = LoadLe32(header_);
   if (length > kMaxFrameBytes) {
     oversize_ = true;
     oversizeLength_ = length;

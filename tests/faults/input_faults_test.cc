@@ -33,6 +33,7 @@
 #include "pm/ipc/connection.h"
 #include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
+#include "pm/runtime/little_endian.h"
 #include "support/wait.h"
 
 namespace {
@@ -396,7 +397,7 @@ class RawHost {
   }
   static std::string Prefix(std::uint32_t length) {
     std::string bytes(4, '\0');
-    for (int i = 0; i < 4; ++i) bytes[static_cast<std::size_t>(i)] = static_cast<char>((length >> (8 * i)) & 0xFF);
+    pm::StoreLe32(bytes.data(), length);
     return bytes;
   }
   static std::string Frame(const std::string& text) {
@@ -409,7 +410,8 @@ class RawHost {
   bool WriteTokens(const std::vector<std::uint32_t>& tokens) {
     std::vector<std::uint8_t> bytes;
     for (std::uint32_t t : tokens) {
-      for (int i = 0; i < 4; ++i) bytes.push_back(static_cast<std::uint8_t>(t >> (8 * i)));
+      bytes.resize(bytes.size() + 4);
+      pm::StoreLe32(bytes.data() + bytes.size() - 4, t);
     }
     pm::BufferList list;
     list.emplace_back(bytes.data(), static_cast<std::uint32_t>(bytes.size()));

@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "pm/ipc/server.h"
+#include "pm/runtime/little_endian.h"
 #include "pm/runtime/thread_name.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
@@ -45,7 +46,7 @@ std::vector<std::uint8_t> ReadBytes(Connection& from, std::size_t n) {
 }
 
 std::uint32_t LittleEndian(const std::vector<std::uint8_t>& b) {
-  return b[0] | (b[1] << 8) | (b[2] << 16) | (std::uint32_t(b[3]) << 24);
+  return pm::LoadLe32(b.data());
 }
 
 // ---------------------------------------------------------------------------

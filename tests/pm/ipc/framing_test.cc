@@ -10,24 +10,17 @@
 #include <vector>
 
 #include "pm/ipc/framing.h"
+#include "pm/runtime/little_endian.h"
 
 namespace {
 
-std::string Frame(const std::string& text) {
-  const auto n = static_cast<std::uint32_t>(text.size());
-  std::string out;
-  out.push_back(static_cast<char>(n & 0xFF));
-  out.push_back(static_cast<char>((n >> 8) & 0xFF));
-  out.push_back(static_cast<char>((n >> 16) & 0xFF));
-  out.push_back(static_cast<char>((n >> 24) & 0xFF));
-  return out + text;
-}
-
 std::string Prefix(std::uint32_t n) {
   std::string out(4, '\0');
-  for (int i = 0; i < 4; ++i) out[i] = static_cast<char>((n >> (8 * i)) & 0xFF);
+  pm::StoreLe32(out.data(), n);
   return out;
 }
+
+std::string Frame(const std::string& text) { return Prefix(static_cast<std::uint32_t>(text.size())) + text; }
 
 std::vector<std::string> Drain(pm::ipc::FrameReader& reader) {
   std::vector<std::string> out;
