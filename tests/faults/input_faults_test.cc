@@ -448,7 +448,7 @@ class RawHost {
 
  private:
   void Tap() {
-    std::uint8_t wire[pmhost::kWireRecordBytes];
+    std::uint8_t wire[pm::kQueueWireRecordBytes];
     while (tapRunning_) {
       if (!queue_->ReadFromSocket(wire, sizeof wire, 250)) {
         if (!queue_->IsConnected()) break;
@@ -628,7 +628,7 @@ TEST_F(InputFaults, ASecondQueueConnectionIsRefusedAndTheFirstKeepsItsPictures) 
   for (int attempt = 0; attempt < 5; ++attempt) {
     std::unique_ptr<pm::ipc::Connection> second = pm::ipc::Connection::Open(host.Port());
     if (!second) continue;
-    std::uint8_t wire[pmhost::kWireRecordBytes];
+    std::uint8_t wire[pm::kQueueWireRecordBytes];
     EXPECT_FALSE(second->ReadFromSocket(wire, sizeof wire, 300)) << "a second reader was given a record";
     second->Close();
   }
