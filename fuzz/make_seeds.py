@@ -32,6 +32,11 @@ write("frame_dispatch_fuzzer", "replies", CHUNKS_SMALL +
       frame(json.dumps({"pm::unique_id": 1, "pm::command": "ping", "pm::response": True, "pm::error": "x"})) +
       frame(json.dumps({"pm::unique_id": 2, "pm::command": "ping", "pm::response": True})) +
       frame(json.dumps({"pm::unique_id": 99, "pm::response": True})))
+# Nesting at the limit (handled) and one level over it (skipped unparsed).
+nested = lambda depth: "[" * depth + "1" + "]" * depth
+write("frame_dispatch_fuzzer", "deep_nesting", CHUNKS_SMALL +
+      frame(req(10, "echo").rstrip("}") + ', "value": ' + nested(256) + "}") +
+      frame(req(11, "echo").rstrip("}") + ', "value": ' + nested(257) + "}"))
 write("frame_dispatch_fuzzer", "empty_and_oversize", CHUNKS_WHOLE + frame("") + frame("{}") +
       struct.pack("<I", 524289) + b"{}")
 
@@ -48,6 +53,9 @@ write("json_cfg_fuzzer", "tree", json.dumps({
     "first": {"enabled": "true", "numbers": [1, "2", 3.5, None]}}))
 write("json_cfg_fuzzer", "scalars", '[1e300, -0, 18446744073709551615, -9223372036854775808, "\\u00e9\\n", true, null, {"value": {}}]')
 write("json_cfg_fuzzer", "bad", '{"bandwidth": ')
+write("json_cfg_fuzzer", "deep_at_limit", '{"bandwidth": ' + nested(255) + "}")
+write("json_cfg_fuzzer", "deep_over_limit", '{"bandwidth": ' + '{"value": ' * 256 + "1" + "}" * 257)
+write("json_cfg_fuzzer", "deep_brackets_in_string", nested(200) .replace("1", '"[[[{{{\\"[[[["', 1))
 
 # --- metadata_fuzzer: mode, length byte, text -------------------------------
 def meta(mode, length_byte, text):

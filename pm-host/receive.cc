@@ -479,7 +479,7 @@ int RunDemo(const DemoOptions& options) {
   child.env = {{"NDI_LOOPBACK_DIR", registry}};
   child.captureStdout = true;
   child.onLine = [&](const std::string& line) {
-    const json event = json::parse(line, nullptr, false);
+    const json event = pmjson::ParseUntrusted(line);
     if (!event.is_object() || event.value("event", "") != "ready") return;
     {
       std::lock_guard<std::mutex> guard(readyLock);

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <exception>
+#include <set>
 #include <utility>
 #include <vector>
 
@@ -118,18 +119,28 @@ bool Discovery::ScanOnce(void* finder) {
       it->second->lastSeenScan = scanNumber_;
     }
   }
+  // Withdraw first, then announce: the last word about an id that is still
+  // in the table must be "available". A sender that moved to a new URL, or
+  // one of two senders sharing a name that vanished, withdraws an id that a
+  // remaining entry still carries; that id is announced again afterwards.
   const bool announce = GetCallbacks() != nullptr;
-  std::vector<std::string> gone;
+  std::set<std::string> withdrawn;
+  for (auto it = sources_.begin(); it != sources_.end();) {
+    if (it->second->lastSeenScan == scanNumber_) {
+      ++it;
+      continue;
+    }
+    const std::string uniqueId = std::string(kSourceIdPrefix) + it->second->name;
+    if (announce) GetCallbacks()->SourceUnavailable(uniqueId);
+    withdrawn.insert(uniqueId);
+    it = sources_.erase(it);
+  }
   for (const auto& [url, info] : sources_) {
     const std::string uniqueId = std::string(kSourceIdPrefix) + info->name;
-    if (info->firstSeenScan == scanNumber_) {
-      if (announce) AnnounceSource(uniqueId, info->name);
-    } else if (info->lastSeenScan != scanNumber_) {
-      if (announce) GetCallbacks()->SourceUnavailable(uniqueId);
-      gone.push_back(url);
-    }
+    // A withdrawn id is announced once again, by its first remaining entry.
+    const bool again = withdrawn.erase(uniqueId) > 0;
+    if ((info->firstSeenScan == scanNumber_ || again) && announce) AnnounceSource(uniqueId, info->name);
   }
-  for (const std::string& url : gone) sources_.erase(url);
   return true;
 }
 

@@ -7,7 +7,11 @@
 // "NDICaptureDevice~" + its NDI name; one missing from a scan is announced
 // unavailable and forgotten (and announced anew if it comes back). Senders
 // are told apart by URL, so two senders with one name are two entries with
-// the same unique id.
+// the same unique id. Within one scan every withdrawal comes before every
+// announcement, and an id withdrawn while another entry still carries it (a
+// sender that moved to a new URL, the other of two senders sharing a name)
+// is announced available again: the last word about a present id is
+// "available".
 //
 // Threads: host request threads call Start and Stop (serialised by
 // lifecycleMutex_); the scan thread alone touches the finder, the table and

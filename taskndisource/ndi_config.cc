@@ -63,6 +63,7 @@ std::string VideoStatusText(const MediaInfo& info) {
 
 std::string AudioStatusText(const MediaInfo& info) {
   if (info.audioChannels <= 0) return {};
+  if (info.audioRefused) return std::to_string(info.audioChannels) + " Channels not supported";
   std::string text;
   if (info.audioChannels == 1) {
     text = "Mono";

@@ -42,7 +42,8 @@ std::uint32_t BandwidthFromText(const std::string& text);
 std::string StatusKey(ReceiverState state);
 // "1920x1080 @ 29.97 fps", "1280x720", or empty.
 std::string VideoStatusText(const MediaInfo& info);
-// "Stereo @ 48 kHz", "Mono @ 44.1 kHz", "6 Channels @ 48 kHz", or empty.
+// "Stereo @ 48 kHz", "Mono @ 44.1 kHz", "6 Channels @ 48 kHz", or empty;
+// "200 Channels not supported" for sound that is refused.
 std::string AudioStatusText(const MediaInfo& info);
 
 }  // namespace TaskNDISource

@@ -8,10 +8,14 @@
 // than that moves the base and resets the host's clock.
 //
 // Limits of what a frame may describe: width and height travel to the host as
-// signed 16-bit values (at most 32767), the channel count as one byte (at most
-// 255); larger frames are dropped before any buffer is requested. A line
-// stride smaller than one row of the picture (or negative) would make the
-// copy read past the runtime's frame; such frames are dropped as well.
+// signed 16-bit values (at most 32767), the channel count as one byte that is
+// read as signed wherever a size is computed (at most 127); larger frames are
+// dropped before any buffer is requested. Sound of too many channels is told
+// once, when it starts (again after a change of count or after sound that was
+// taken), not with every frame, and the panel's audio line says why there is
+// no sound. A line stride smaller than one row of the picture (or negative)
+// would make the copy read past the runtime's frame; such frames are dropped
+// as well.
 
 #include <cstdint>
 #include <limits>
@@ -25,7 +29,7 @@ namespace TaskNDISource {
 namespace {
 
 constexpr std::int32_t kMaxDimension = 32767;
-constexpr std::int32_t kMaxChannels = 255;
+constexpr std::int32_t kMaxChannels = 127;
 
 struct RasterFormat {
   std::uint32_t code = 0;
@@ -169,7 +173,17 @@ bool NDISource::ProcessAudioFrame(const ndi_audio_frame_v2& frame, MediaInfo* in
     return false;
   }
   if (frame.no_channels > kMaxChannels) {
-    pm::Log(pm::LogType::Normal, kLogTag, "too many channels in NDI audio frame (%d)", frame.no_channels);
+    if (refusedChannels_ != frame.no_channels) {
+      refusedChannels_ = frame.no_channels;
+      pm::Log(pm::LogType::Normal, kLogTag,
+              "too many channels in NDI audio frame (%d): at most %d are carried, its sound is dropped",
+              frame.no_channels, kMaxChannels);
+    }
+    if (info != nullptr) {
+      info->audioSampleRate = frame.sample_rate;
+      info->audioChannels = frame.no_channels;
+      info->audioRefused = true;
+    }
     return false;
   }
 
@@ -212,9 +226,11 @@ bool NDISource::ProcessAudioFrame(const ndi_audio_frame_v2& frame, MediaInfo* in
   MarkProduced(2);
   callbacks->SendAudioBuffer(TicksFrom100ns(difference), std::move(buffer));
 
+  refusedChannels_ = 0;
   if (info != nullptr) {
     info->audioSampleRate = frame.sample_rate;
     info->audioChannels = frame.no_channels;
+    info->audioRefused = false;
   }
   return true;
 }

@@ -104,6 +104,7 @@ void NDISource::StartLocked() {
   timestampBase_ = INT64_MAX;
   resetPending_ = false;
   ptzReported_ = false;
+  refusedChannels_ = 0;
   env_.clock->ClearSignals();
   std::promise<void> done;
   loopDone_ = done.get_future();
@@ -223,6 +224,8 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
       state_ = loop.wanted;
       loop.guiDirty = true;
       loop.attempts = 0;
+      // Sound of too many channels after the connection came back is told anew.
+      if (loop.wanted == ReceiverState::Idle || loop.wanted == ReceiverState::Error) refusedChannels_ = 0;
     }
     s = state_;
     loop.lastSeen = s;

@@ -77,6 +77,7 @@ struct MediaInfo {
   std::int32_t frameRateD = 0;
   std::int32_t audioSampleRate = 0;
   std::int32_t audioChannels = 0;
+  bool audioRefused = false;  // the sound has more channels than the host's record carries
   bool operator==(const MediaInfo&) const = default;
 };
 
@@ -195,6 +196,7 @@ class NDISource : public pm::Source {
   std::uint32_t producesMask_ = 0;
   std::int64_t timestampBase_ = INT64_MAX;
   bool resetPending_ = false;  // a new base was taken; the host's clock is not reset yet
+  std::int32_t refusedChannels_ = 0;  // channel count of the sound being refused and told of; 0 while none
 };
 
 }  // namespace TaskNDISource

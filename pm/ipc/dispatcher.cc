@@ -292,7 +292,15 @@ void RpcDispatcher::FinishReceiving() {
 }
 
 void RpcDispatcher::HandleMessage(const std::string& text) {
-  const Json message = Json::parse(text, nullptr, /*allow_exceptions=*/false);
+  // A message nested too deep is refused before any value is built: copying
+  // or printing it would recurse once per level, past the end of the stack.
+  bool tooDeep = false;
+  const Json message = pmjson::ParseUntrusted(text, &tooDeep);
+  if (tooDeep) {
+    Log(LogType::Normal, "", "RpcDispatcher: message nests deeper than %zu levels, skipped: '%.*s'\n",
+        pmjson::kMaxNestingDepth, kQuoteBytes, text.c_str());
+    return;
+  }
   if (message.is_discarded()) {
     Log(LogType::Normal, "", "RpcDispatcher: message is not JSON, skipped: '%.*s'\n", kQuoteBytes,
         text.c_str());

@@ -68,9 +68,16 @@ void Producer::Stop() {
   pending_.clear();
   for (auto& [token, readers] : released) {  // ascending
     readers.clear();
-    if (releaseCallback_) releaseCallback_(token);
+    if (GiveUpLocked(token) && releaseCallback_) releaseCallback_(token);
   }
   WakeLocked();
+}
+
+bool Producer::GiveUpLocked(std::uint32_t token) {
+  auto writing = inFlight_.find(token);
+  if (writing == inFlight_.end()) return true;
+  writing->second.givenUp = true;
+  return false;
 }
 
 void Producer::Wake() {
@@ -114,6 +121,8 @@ bool Producer::Send(std::uint32_t token, const BufferList& record) {
     auto& owing = pending_[token];
     for (const auto& connection : connections_) owing.insert(connection);
     readers = connections_;
+    // Until its writes are done the token cannot be released under them.
+    ++inFlight_[token].writers;
   }
   // The writes go out after the lock is let go: a reader that does not read
   // (its socket buffer full) then blocks only this sender, never Stop, the
@@ -129,6 +138,15 @@ bool Producer::Send(std::uint32_t token, const BufferList& record) {
     // A reader whose write failed still owes the token; if it has gone, the
     // producer thread finds out on its next read and gives the token up.
     connection->Send(list);
+  }
+  // A token given up while it was being written (Stop, its last reader gone
+  // or returned) is released now, under the lock as Stop releases.
+  std::lock_guard<std::mutex> hold(lock_);
+  auto writing = inFlight_.find(token);
+  if (--writing->second.writers == 0) {
+    const bool givenUp = writing->second.givenUp;
+    inFlight_.erase(writing);
+    if (givenUp && releaseCallback_) releaseCallback_(token);
   }
   return true;
 }
@@ -147,7 +165,7 @@ bool Producer::Release(const std::shared_ptr<Connection>& reader, std::uint32_t 
   }
   if (!entry->second.empty()) return false;
   pending_.erase(entry);
-  return true;
+  return GiveUpLocked(token);
 }
 
 std::vector<std::uint32_t> Producer::DropReader(const std::shared_ptr<Connection>& reader) {
@@ -161,7 +179,7 @@ std::vector<std::uint32_t> Producer::DropReader(const std::shared_ptr<Connection
     for (auto entry = pending_.begin(); entry != pending_.end();) {  // ascending
       if (entry->second.erase(reader) > 0) ++owed;
       if (entry->second.empty()) {
-        released.push_back(entry->first);
+        if (GiveUpLocked(entry->first)) released.push_back(entry->first);
         entry = pending_.erase(entry);
       } else {
         ++entry;

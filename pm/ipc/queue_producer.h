@@ -22,15 +22,24 @@
 //   - The producer thread ("pm::Ipc Producer") reads token returns and calls
 //     the release callback outside the lock.
 //   - The release callback also runs on the calling thread with the
-//     producer's lock held: in Send when there is no reader, and in Stop. It
-//     must therefore not call back into the producer. Stop (or destroy) the
+//     producer's lock held: in Send when there is no reader or when the token
+//     was given up while Send was writing it (below), and in Stop. It must
+//     therefore not call back into the producer. Stop (or destroy) the
 //     producer before destroying what the callback uses.
+//
+// Release and write are exclusive: Send marks its token in flight (under
+// lock_) before it writes, and while it is in flight nothing releases it.
+// Stop, a reader that goes away and a last return mark an in-flight token
+// given up instead; Send, once its writes are done, takes lock_ again and
+// releases a token given up meanwhile. So a segment never goes back to its
+// pool while a reader is still being told to read it.
 //
 // Lock order: Producer::lock_, then whatever the release callback takes (the
 // shared-memory queue's lock). Records are written to the readers after
-// lock_ is let go, under each Connection's own lock, so a reader that stops
-// reading holds up only the sender that is writing to it. Nothing takes
-// these locks the other way round.
+// lock_ is let go, under each Connection's own lock (never with lock_ held),
+// so a reader that stops reading holds up only the sender that is writing to
+// it, never Stop or the token returns. Nothing takes these locks the other
+// way round.
 
 #include <atomic>
 #include <cstdint>
@@ -92,8 +101,12 @@ class Producer {
   // True when the reader's return completed the token (the caller then
   // releases it).
   bool Release(const std::shared_ptr<Connection>& reader, std::uint32_t token);
-  // Drops a reader that has gone; returns the tokens nobody owes any more.
+  // Drops a reader that has gone; returns the tokens nobody owes any more
+  // (those in flight are left to their Send).
   std::vector<std::uint32_t> DropReader(const std::shared_ptr<Connection>& reader);
+  // A token nobody owes any more: true when it may be released now, false
+  // when a Send is still writing it (that Send then releases it). lock_ held.
+  bool GiveUpLocked(std::uint32_t token);
   void WakeLocked();
   void ThreadMain(const std::weak_ptr<Semaphore>& started);
 
@@ -101,6 +114,11 @@ class Producer {
   std::mutex lock_;                  // guards every field below except running_ and loopPasses_
   std::vector<std::shared_ptr<Connection>> connections_;                         // readers, in the order added
   std::map<std::uint32_t, std::set<std::shared_ptr<Connection>>> pending_;  // token -> readers owing it
+  struct InFlight {
+    int writers = 0;       // Send calls writing the token's record
+    bool givenUp = false;  // nobody owes it any more: the last writer releases it
+  };
+  std::map<std::uint32_t, InFlight> inFlight_;  // tokens whose records are being written
   std::uint32_t recordSize_ = 0;
   std::shared_ptr<Server> wakeServer_;
   std::shared_ptr<Connection> wakeWriter_;  // other threads write the wake word here

@@ -8,9 +8,49 @@
 
 namespace pmjson {
 
+namespace {
+constexpr int kQuoteBytes = 200;  // of a refused text quoted in a log line
+}  // namespace
+
+bool NestsWithinLimit(std::string_view text) {
+  std::size_t depth = 0;
+  bool inString = false;
+  for (std::size_t i = 0; i < text.size(); ++i) {
+    const char c = text[i];
+    if (inString) {
+      if (c == '\\') {
+        ++i;  // the escaped character, a quote or a backslash included
+      } else if (c == '"') {
+        inString = false;
+      }
+    } else if (c == '"') {
+      inString = true;
+    } else if (c == '[' || c == '{') {
+      if (++depth > kMaxNestingDepth) return false;
+    } else if ((c == ']' || c == '}') && depth > 0) {
+      --depth;
+    }
+  }
+  return true;
+}
+
+Json ParseUntrusted(std::string_view text, bool* tooDeep) {
+  const bool deep = !NestsWithinLimit(text);
+  if (tooDeep != nullptr) *tooDeep = deep;
+  if (deep) return Json(Json::value_t::discarded);
+  return Json::parse(text.begin(), text.end(), nullptr, /*allow_exceptions=*/false);
+}
+
 Json Parse(const std::string& text, const char* label) {
   if (text.empty()) return nullptr;
-  Json result = Json::parse(text, nullptr, /*allow_exceptions=*/false);
+  bool tooDeep = false;
+  Json result = ParseUntrusted(text, &tooDeep);
+  if (tooDeep) {
+    // The text may be half a megabyte of brackets: its start says enough.
+    pm::Log(pm::LogType::Normal, "", "pmjson::Parse failed: %s nests deeper than %zu levels '%.*s'\n",
+            label ? label : "", kMaxNestingDepth, kQuoteBytes, text.c_str());
+    return nullptr;
+  }
   if (result.is_discarded()) {
     pm::Log(pm::LogType::Normal, "", "pmjson::Parse failed: %s '%s'\n", label ? label : "",
             text.c_str());

@@ -144,14 +144,30 @@ void TaskSource::StartDiscovery(std::shared_ptr<RpcDispatcher> dispatcher) {
     factory = discoveryFactory_;
   }
   if (!factory || !dispatcher) return;
-  // Whoever takes a discovery out of the field stops it; at most one runs.
-  if (std::shared_ptr<SourceDiscovery> running = SwapDiscovery(nullptr)) running->Stop();
   std::shared_ptr<SourceDiscovery> made = factory(std::make_shared<DiscoveryCallbacks>(std::move(dispatcher)));
-  if (!made) return;
-  made->Start();
-  // A discovery stored by a start_discovery on another connection meanwhile
-  // gives way to this one.
+  // Stored before it starts, so that the task has work all along: a last
+  // stop_source on another connection meanwhile must not end the task. The
+  // discovery it replaces (whoever takes one out of the field stops it) is
+  // stopped before this one starts, so at most one runs.
   if (std::shared_ptr<SourceDiscovery> displaced = SwapDiscovery(made)) displaced->Stop();
+  if (!made) return;
+  try {
+    made->Start();
+  } catch (...) {
+    if (TakeDiscoveryIfSame(made)) made->Stop();
+    throw;
+  }
+  // Taken out by a stop_discovery or start_discovery on another connection
+  // before it had started, it may have been stopped too early to end: stop
+  // it again, so that it is not released running.
+  if (CurrentDiscovery() != made) made->Stop();
+}
+
+bool TaskSource::TakeDiscoveryIfSame(const std::shared_ptr<SourceDiscovery>& discovery) {
+  std::lock_guard<std::mutex> guard(lock_);
+  if (discovery_ != discovery) return false;
+  discovery_ = nullptr;
+  return true;
 }
 
 void TaskSource::StopDiscovery() {

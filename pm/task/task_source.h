@@ -81,8 +81,11 @@ class TaskSource : public Task {
   std::size_t SourceCount();
   std::shared_ptr<SourceDiscovery> CurrentDiscovery();
 
-  // Stops a running discovery, then makes one with the discovery factory for
-  // `dispatcher` and starts it. Nothing without a factory or a dispatcher.
+  // Makes a discovery with the discovery factory for `dispatcher`, stores it
+  // in place of the running one (which is stopped), then starts it: stored
+  // first, so that the task never looks idle in between. A Start that throws
+  // takes it out again (if it is still the stored one) and stops it; the
+  // exception goes on. Nothing without a factory or a dispatcher.
   void StartDiscovery(std::shared_ptr<RpcDispatcher> dispatcher);
   // Stops and releases the running discovery, if any.
   void StopDiscovery();
@@ -102,6 +105,8 @@ class TaskSource : public Task {
   void EraseSourceIfSame(const std::string& uniqueId, const std::shared_ptr<Source>& source);
   // Puts `next` in `discovery_` and returns what was there.
   std::shared_ptr<SourceDiscovery> SwapDiscovery(std::shared_ptr<SourceDiscovery> next);
+  // Clears `discovery_` if it holds `discovery`; true when it did.
+  bool TakeDiscoveryIfSame(const std::shared_ptr<SourceDiscovery>& discovery);
 
   std::mutex lock_;  // guards sources_, the factories, discovery_ and attached_
   std::map<std::string, std::shared_ptr<Source>> sources_;  // guarded by lock_

@@ -6,6 +6,7 @@
 
 #include <set>
 #include <string>
+#include <utility>
 
 #include "e2e/runner_child.h"
 
@@ -184,6 +185,54 @@ TEST(TaskModule, BadInputIsAnsweredOrLoggedAndTheConnectionKeepsServing) {
   EXPECT_EQ(host.Runner().Wait(10ms), -2);
   host.Peer().Close();
   EXPECT_EQ(host.Runner().Wait(), 0);
+}
+
+// A message nested a quarter of a million levels deep (about 500 KB, under the
+// frame limit) in the field a command reads would end the runner on its
+// stack wherever the value is copied or printed. The receiving side refuses
+// it before building anything, with one line, like text that is not JSON; the
+// connection stays and the next request is answered.
+TEST(TaskModule, MessagesNestedTooDeepAreSkippedWithOneLineEachAndTheRunnerServesOn) {
+  Host host;
+  ASSERT_TRUE(host.Ready());
+  host.Ask("pm::tsrc::start_discovery");
+  host.Ask("pm::tsrc::start_source", {{"unique_id", kSource}});
+  const std::pair<const char*, const char*> commands[] = {
+      {"pm::tsrc::start_source", "config"},
+      {"pm::tsrc::stop_source", "unique_id"},
+      {"pm::tsrc::validate_gui", "gui"},
+      {"pm::tsrc::gui_to_configuration", "gui"},
+      {"pm::tsrc::configuration_to_gui", "config"},
+      {"pm::tsrc::execute_custom_action_command", "command"},
+      {"pm::tsrc::execute_ptz_command", "zoom"},
+      {"pm::tsrc::handle_shot_event", "event"},
+      {"pm::tsrc::source_hotplug_event", "unique_id"},
+      {"pm::tsrc::set_configuration", "config"},
+      {"pm::tsrc::start_discovery", "unique_id"},
+      {"pm::tsrc::stop_discovery", "unique_id"},
+      {"pm::tsrc::discovery_hotplug_event", "unique_id"},
+  };
+  constexpr std::size_t kDepth = 250000;
+  const std::string deep = std::string(kDepth, '[') + std::string(kDepth, ']');
+  for (const auto& [command, key] : commands) {
+    Json envelope = {{"pm::command", command}, {"pm::unique_id", 7}, {"pm::request", true}};
+    if (std::string(key) != "unique_id") envelope["unique_id"] = kSource;
+    std::string text = envelope.dump();
+    text.back() = ',';
+    text += "\"" + std::string(key) + "\":" + deep + "}";
+    ASSERT_LT(text.size(), 524288u);
+    ASSERT_TRUE(host.Peer().WriteFrame(text)) << command;
+  }
+  const Json reply = host.Ask("pm::tsrc::source_hotplug_event", {{"unique_id", kSource}});
+  ASSERT_TRUE(reply.is_object()) << "the runner ended with " << host.Runner().Wait(5s) << " (-1: a signal)";
+  EXPECT_EQ(reply["unique_id"], kSource);
+  EXPECT_EQ(host.Runner().Wait(10ms), -2);
+  host.Peer().Close();
+  EXPECT_EQ(host.Runner().Wait(), 0);
+  const std::string err = host.Runner().Stderr();
+  EXPECT_EQ(Occurrences(err, "RpcDispatcher: message nests deeper than 256 levels, skipped: '{\"pm::command\":"),
+            static_cast<int>(std::size(commands)))
+      << err.substr(0, 4000);
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 #include "fakes.h"
 #include "scripted_ndi.h"
 #include "support/log_capture.h"
+#include "taskndisource/ndi_config.h"
 #include "taskndisource/ndi_source.h"
 
 namespace {
@@ -211,7 +212,6 @@ TEST_F(IntakeTest, BadAudioFramesAreDroppedWithTheirLine) {
       {AudioCapture(48000, 2, -5), "#ndisource: unexpected audio sample count\n"},
       {AudioCapture(48000, 0, 16), "#ndisource: unexpected audio channel count\n"},
       {nullData, "#ndisource: null audio sample data\n"},
-      {AudioCapture(48000, 256, 4), "#ndisource: too many channels in NDI audio frame (256)\n"},
   };
   for (const Case& c : cases) {
     logs.Clear();
@@ -219,7 +219,42 @@ TEST_F(IntakeTest, BadAudioFramesAreDroppedWithTheirLine) {
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
   }
   EXPECT_TRUE(callbacks->AudioRequests().empty());
-  EXPECT_TRUE(Audio(AudioCapture(48000, 255, 4)));
+  EXPECT_TRUE(Audio(AudioCapture(48000, 127, 4)));
+}
+
+// The record's channel byte is read as signed where sizes are computed, so
+// sound of 128 channels and more is refused before a buffer is asked for. It
+// is told once when it starts, not with every frame (anew when the count
+// changes or after sound that was taken), and the panel's audio line says
+// why there is no sound.
+TEST_F(IntakeTest, SoundOfTooManyChannelsIsToldOnceAndNamedOnThePanel) {
+  struct Case {
+    int channels;
+    std::vector<std::string> lines;  // for five frames
+    std::string status;
+  };
+  const auto line = [](int channels) {
+    return "#ndisource: too many channels in NDI audio frame (" + std::to_string(channels) +
+           "): at most 127 are carried, its sound is dropped\n";
+  };
+  const Case cases[] = {
+      {127, {}, "127 Channels @ 48 kHz"},
+      {128, {line(128)}, "128 Channels not supported"},
+      {255, {line(255)}, "255 Channels not supported"},
+      {256, {line(256)}, "256 Channels not supported"},
+      {2, {}, "Stereo @ 48 kHz"},
+      {256, {line(256)}, "256 Channels not supported"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.channels);
+    logs.Clear();
+    const std::size_t requested = callbacks->AudioRequests().size();
+    MediaInfo info;
+    for (int frame = 0; frame < 5; ++frame) EXPECT_EQ(Audio(AudioCapture(48000, c.channels, 4), &info), c.lines.empty());
+    EXPECT_EQ(callbacks->AudioRequests().size() - requested, c.lines.empty() ? 5u : 0u);
+    EXPECT_EQ(logs.Lines(), c.lines);
+    EXPECT_EQ(TaskNDISource::AudioStatusText(info), c.status);
+  }
 }
 
 TEST_F(IntakeTest, AudioBufferSmallerThanTheFrameIsNotWrittenPast) {

@@ -4,10 +4,12 @@
 #include "pm/ipc/queue_producer.h"
 
 #include <dirent.h>
+#include <sys/socket.h>
 
 #include <array>
 #include <condition_variable>
 #include <fstream>
+#include <functional>
 #include <thread>
 
 #include "pm/ipc/server.h"
@@ -224,6 +226,62 @@ TEST_F(ProducerTokens, ConcurrentSendersAndReturnsReleaseEachTokenOnce) {
   EXPECT_EQ(producer.PendingCount(), 0u);
 }
 
+// Release and write are exclusive: a token given up while Send is still
+// writing its record (Stop, or its only reader gone) is released by that
+// Send once the write has ended, never under it. The reader does not read, so
+// its socket buffers fill and the write blocks until the test reads.
+TEST_F(ProducerTokens, TokenGivenUpWhileItsRecordIsBeingWrittenIsReleasedAfterTheWrite) {
+  constexpr std::uint32_t kBig = 4 << 20;  // many times what the socket buffers below hold
+  const std::vector<std::uint8_t> big(kBig, 0x5A);
+  struct Case {
+    const char* name;
+    std::function<void(Reader&)> giveUp;
+  };
+  const Case cases[] = {
+      {"stop", [&](Reader&) { producer.Stop(); }},
+      {"reader gone",
+       [&](Reader& reader) {
+         ::shutdown(reader.host->GetSocket().GetHandle(), SHUT_WR);  // its end of stream; it can still read
+         ASSERT_TRUE(pmtest::WaitFor([&] { return producer.ReaderCount() == 0; }));
+         // The pass that dropped the reader is over once the next one begins.
+         const std::uint64_t passes = producer.LoopPasses();
+         producer.Wake();
+         ASSERT_TRUE(pmtest::WaitFor([&] { return producer.LoopPasses() > passes; }));
+       }},
+  };
+  std::uint32_t token = 500;
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    ASSERT_TRUE(producer.Start(kBig, releases.Callback()));
+    const std::size_t before = releases.Tokens().size();
+    auto reader = Add();
+    // Small enough to hold a fraction of the record, large enough not to
+    // make the reading crawl.
+    const int bytes = 65536;
+    ::setsockopt(reader->task->GetSocket().GetHandle(), SOL_SOCKET, SO_SNDBUF, &bytes, sizeof bytes);
+    ::setsockopt(reader->host->GetSocket().GetHandle(), SOL_SOCKET, SO_RCVBUF, &bytes, sizeof bytes);
+    std::thread sender([&] { EXPECT_TRUE(producer.Send(token, {{big.data(), kBig}})); });
+    // Whatever fails below, the write is cut short and the sender joined.
+    struct Ender {
+      Reader& reader;
+      std::thread& sender;
+      ~Ender() {
+        if (!sender.joinable()) return;
+        reader.task->Close();
+        sender.join();
+      }
+    } ender{*reader, sender};
+    ASSERT_TRUE(pmtest::WaitFor([&] { return producer.PendingCount() == 1; }));
+    c.giveUp(*reader);
+    EXPECT_EQ(releases.Tokens().size(), before) << "released while its record was being written";
+    reader->ReadRecord(kBig + 4);
+    sender.join();
+    ASSERT_EQ(releases.Tokens().size(), before + 1);
+    EXPECT_EQ(releases.Tokens().back(), token);
+    ++token;
+  }
+}
+
 // ---------------------------------------------------------------------------
 
 using ProducerReaders = Fixture;
@@ -323,11 +381,12 @@ TEST_F(ProducerReaders, ReaderThatStopsReadingHoldsUpOnlyItsSender) {
   // calls go on, and Stop releases what is pending.
   EXPECT_FALSE(producer.AddConnection(stuck->task));
   producer.Stop();
-  EXPECT_FALSE(releases.Tokens().empty());
   EXPECT_LT(sent.load(), 64);
-  // Closing the reader's connection ends the blocked write.
+  // Closing the reader's connection ends the blocked write; its token, given
+  // up by Stop, is released once the write has ended.
   stuck->task->Close();
   sender.join();
+  EXPECT_FALSE(releases.Tokens().empty());
 }
 
 // ---------------------------------------------------------------------------

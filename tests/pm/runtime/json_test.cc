@@ -35,6 +35,54 @@ TEST(Parse, GarbageOfAnyKindNeverThrows) {
   EXPECT_EQ(capture.Lines().size(), 4u);
 }
 
+// Nesting beyond the limit is refused before a value is built (copying or
+// dumping one would recurse once per level); brackets inside strings, behind
+// escaped quotes or after escaped backslashes, do not count.
+TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
+  constexpr std::size_t kLimit = pmjson::kMaxNestingDepth;
+  const auto arrays = [](std::size_t depth, const std::string& inner) {
+    return std::string(depth, '[') + inner + std::string(depth, ']');
+  };
+  const auto objects = [](std::size_t depth) {
+    std::string text;
+    for (std::size_t i = 0; i < depth; ++i) text += "{\"k\":";
+    return text + "1" + std::string(depth, '}');
+  };
+  const std::string brackets(2 * kLimit, '[');
+  struct Case {
+    const char* label;
+    std::string text;
+    bool parses;
+  };
+  const Case cases[] = {
+      {"arrays_at_limit", arrays(kLimit, "1"), true},
+      {"arrays_over", arrays(kLimit + 1, "1"), false},
+      {"objects_at_limit", objects(kLimit), true},
+      {"objects_over", objects(kLimit + 1), false},
+      {"mixed_over", "{\"a\":" + arrays(kLimit, "{}") + "}", false},
+      {"brackets_in_string", arrays(kLimit, "\"" + brackets + "\""), true},
+      {"escaped_quote", arrays(kLimit, "\"\\\"" + brackets + "\""), true},
+      {"escaped_backslash_at_limit", arrays(kLimit - 1, "\"\\\\\",[1]"), true},
+      {"escaped_backslash_over", arrays(kLimit, "\"\\\\\",[1]"), false},
+      {"quarter_million", arrays(250000, "1"), false},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.label);
+    pmtest::LogCapture capture;
+    const Json value = pmjson::Parse(c.text, c.label);
+    EXPECT_EQ(value.is_null(), !c.parses);
+    if (c.parses) {
+      EXPECT_TRUE(capture.Lines().empty());
+      EXPECT_EQ(pmjson::Dump(Json(value)).size(), c.text.size());  // copied and printed whole
+    } else {
+      ASSERT_EQ(capture.Lines().size(), 1u);
+      EXPECT_EQ(capture.Lines()[0].rfind(std::string("pmjson::Parse failed: ") + c.label + " nests deeper than 256 levels '" +
+                                         c.text.substr(0, 20), 0), 0u) << capture.Lines()[0].substr(0, 100);
+      EXPECT_LT(capture.Lines()[0].size(), 400u);
+    }
+  }
+}
+
 TEST(Parse, ValidTextKeepsKeysInByteOrder) {
   const Json j = pmjson::Parse("{\"b\":1,\"a\":[true,null],\"B\":2.5}", "x");
   EXPECT_EQ(pmjson::Dump(j), "{\"B\":2.5,\"a\":[true,null],\"b\":1}");

@@ -50,6 +50,7 @@ class Journal {
 struct Script {
   bool throwOnConfiguration = false;
   bool throwOnStart = false;  // after recording the start
+  bool throwOnDiscoveryStart = false;
   std::string guiAnswer = "{\"answer\":1}";
 };
 
@@ -93,9 +94,14 @@ class ScriptedSource : public pm::Source {
 
 class ScriptedDiscovery : public pm::SourceDiscovery {
  public:
-  ScriptedDiscovery(std::shared_ptr<Callbacks> callbacks, int serial, Journal* journal)
-      : SourceDiscovery(std::move(callbacks)), tag_("discovery#" + std::to_string(serial)), journal_(journal) {}
-  void Start() override { journal_->Add("start " + tag_); }
+  // `onStart` runs inside Start, after the start is recorded; it may block or throw.
+  ScriptedDiscovery(std::shared_ptr<Callbacks> callbacks, int serial, Journal* journal, std::function<void()> onStart)
+      : SourceDiscovery(std::move(callbacks)), tag_("discovery#" + std::to_string(serial)), journal_(journal),
+        onStart_(std::move(onStart)) {}
+  void Start() override {
+    journal_->Add("start " + tag_);
+    onStart_();
+  }
   void Stop() override { journal_->Add("stop " + tag_); }
   void DiscoveryHotplugEvent() override { journal_->Add("hotplug " + tag_); }
   const std::string& Tag() const { return tag_; }
@@ -103,6 +109,7 @@ class ScriptedDiscovery : public pm::SourceDiscovery {
  private:
   std::string tag_;
   Journal* journal_;
+  std::function<void()> onStart_;
 };
 
 // A task with scripted factories, one dispatcher attached as the runner
@@ -116,7 +123,11 @@ class TaskSourceTest : public ::testing::Test {
                                               CurrentScript());
     });
     task_->SetDiscoveryFactory([this](std::shared_ptr<pm::SourceDiscovery::Callbacks> callbacks) {
-      return std::make_shared<ScriptedDiscovery>(std::move(callbacks), ++discoverySerial_, &journal_);
+      return std::make_shared<ScriptedDiscovery>(std::move(callbacks), ++discoverySerial_, &journal_, [this] {
+        discoveryStarting_ = true;
+        pmtest::WaitFor([this] { return discoveryMayStart_.load(); }, 60s);
+        if (CurrentScript().throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
+      });
     });
     std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.Port());
     ASSERT_TRUE(connection);
@@ -128,8 +139,22 @@ class TaskSourceTest : public ::testing::Test {
     dispatcher_->Start();
   }
   void TearDown() override {
+    discoveryMayStart_ = true;
     task_.reset();
     dispatcher_.reset();
+  }
+
+  // Attaches one more connection as the runner attaches it; returns the
+  // host's end.
+  pmtest::HostPeer AttachAnother() {
+    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(anotherListener_.Port());
+    pmtest::HostPeer peer = anotherListener_.Accept();
+    EXPECT_TRUE(connection && peer.Valid());
+    auto dispatcher = std::make_shared<pm::RpcDispatcher>(std::move(connection));
+    task_->AddDispatcher(dispatcher);
+    task_->AttachDispatcher(dispatcher);
+    dispatcher->Start();
+    return peer;
   }
 
   // Sends a command and returns its reply, skipping the task's own requests
@@ -171,7 +196,10 @@ class TaskSourceTest : public ::testing::Test {
   Script script_;
   std::atomic<int> sourceSerial_{0};
   std::atomic<int> discoverySerial_{0};
+  std::atomic<bool> discoveryStarting_{false};  // a discovery's Start was entered
+  std::atomic<bool> discoveryMayStart_{true};   // false holds every discovery's Start
   std::uint64_t requestId_ = 0;
+  pmtest::HostListener anotherListener_;
 };
 
 using Lines = std::vector<std::string>;
@@ -356,16 +384,34 @@ TEST_F(TaskSourceTest, PerSourceCommandsForUnknownIdsOnlyEcho) {
   EXPECT_EQ(task_->SourceCount(), 1u);
 }
 
+// The discovery is stored before its Start runs: a last stop_source on
+// another connection meanwhile finds work and leaves the task and both
+// connections running. A Start that throws takes its discovery out again,
+// stopped.
+TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut) {
+  pmtest::HostPeer other = AttachAnother();
+  StartSource("a");
+  discoveryMayStart_ = false;
+  ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::start_discovery"}, {"pm::unique_id", 900},
+                               {"pm::request", true}}));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return discoveryStarting_.load(); }));
+  EXPECT_TRUE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}));
+  discoveryMayStart_ = true;
+  EXPECT_FALSE(Ask("pm::tsrc::discovery_hotplug_event").is_discarded());
+  EXPECT_TRUE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}));
+  EXPECT_EQ(task_->DispatcherCount(), 2u);
+  EXPECT_EQ(journal_.Lines(),
+            (Lines{"config a#1 ", "start a#1", "start discovery#1", "stop a#1", "hotplug discovery#1"}));
+
+  EditScript([](Script& script) { script.throwOnDiscoveryStart = true; });
+  journal_.Clear();
+  EXPECT_TRUE(Ask("pm::tsrc::start_discovery").contains("pm::error"));
+  EXPECT_EQ(journal_.Lines(), (Lines{"stop discovery#1", "start discovery#2", "stop discovery#2"}));
+  EXPECT_FALSE(task_->CurrentDiscovery());
+}
+
 TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopTheRest) {
-  pmtest::HostListener listener;
-  std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener.Port());
-  ASSERT_TRUE(connection);
-  pmtest::HostPeer second = listener.Accept();
-  ASSERT_TRUE(second.Valid());
-  auto dispatcher = std::make_shared<pm::RpcDispatcher>(std::move(connection));
-  task_->AddDispatcher(dispatcher);
-  task_->AttachDispatcher(dispatcher);
-  dispatcher->Start();
+  pmtest::HostPeer second = AttachAnother();
 
   constexpr int kRounds = 15;
   const auto drive = [](pmtest::HostPeer& peer) {
