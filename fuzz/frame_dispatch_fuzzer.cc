@@ -19,6 +19,7 @@
 #include "fuzz_support.h"
 #include "pm/ipc/dispatcher.h"
 #include "pm/ipc/framing.h"
+#include "support/manual_clock.h"
 
 namespace pm {
 struct RpcDispatcherTestAccess {
@@ -38,10 +39,9 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  // Stop's grace period is for replies still being written; there are none.
-  pm::DispatcherTiming timing = pm::DispatcherTiming::Steady();
-  timing.sleep = [](std::int64_t) {};
-  pm::RpcDispatcher dispatcher(nullptr, std::move(timing));
+  // Stop's grace period is for replies still being written; there are none,
+  // and on the tests' manual clock it takes no time.
+  pm::RpcDispatcher dispatcher(nullptr, std::make_shared<pmtest::ManualClock>());
   dispatcher.RegisterHandler("echo", [](const nlohmann::json& request, nlohmann::json& response) {
     response["echo"] = request;
   });

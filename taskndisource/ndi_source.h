@@ -39,7 +39,7 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/task/source.h"
-#include "taskndisource/loop_clock.h"
+#include "taskndisource/loop_environment.h"
 #include "taskndisource/ndi_api.h"
 
 namespace tinyxml2 {

@@ -70,11 +70,11 @@ class SourceAudioBuffer final : public AudioBuffer {
 }  // namespace
 
 SourceCallbacks::SourceCallbacks(std::shared_ptr<RpcDispatcher> dispatcher, std::string sourceId,
-                                 MediaClock::NowFn now)
+                                 std::shared_ptr<Clock> clock)
     : producer_(std::make_shared<SharedMemoryQueueProducer>()),
       dispatcher_(std::move(dispatcher)),
       sourceId_(std::move(sourceId)),
-      clock_(std::move(now)) {}
+      clock_(std::move(clock)) {}
 
 SourceCallbacks::~SourceCallbacks() = default;
 
