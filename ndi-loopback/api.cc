@@ -13,7 +13,7 @@
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/sender.h"
 #include "pm/runtime/log.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 #define NDILB_EXPORT extern "C" __attribute__((visibility("default")))
 

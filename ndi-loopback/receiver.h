@@ -21,7 +21,7 @@
 #include <thread>
 
 #include "ndi-loopback/wire.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndilb {
 

@@ -23,7 +23,7 @@
 #include <vector>
 
 #include "ndi-loopback/wire.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndilb {
 

@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "pm/runtime/little_endian.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndits {
 

@@ -12,7 +12,7 @@
 #include "pm-host/picture.h"
 #include "pm-host/record.h"
 #include "pm/shm/formats.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace pmhost {
 

@@ -24,7 +24,7 @@
 
 #include "ndi-testsrc/pattern.h"
 #include "pm/runtime/little_endian.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 extern char** environ;
 

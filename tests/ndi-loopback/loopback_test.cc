@@ -23,7 +23,7 @@
 #include "ndi-loopback/wire.h"
 #include "ndi-testsrc/pattern.h"
 #include "support/wait.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 

@@ -6,7 +6,7 @@
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/checks.h"
 #include "pm/shm/formats.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 
