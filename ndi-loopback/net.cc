@@ -28,8 +28,19 @@ int ListenLoopback(int* port) {
   addr.sin_family = AF_INET;
   addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
   addr.sin_port = 0;
+  // The lowest free port from NDI_LOOPBACK_FIRST_PORT on, as the vendor
+  // runtime's senders take the lowest free one from 5961 (a port that a
+  // dead sender left is taken again at once); else any port.
+  const char* first = std::getenv("NDI_LOOPBACK_FIRST_PORT");
+  const long from = first != nullptr ? std::strtol(first, nullptr, 10) : 0;
+  bool bound = false;
+  for (long p = from; !bound && p > 0 && p < from + kFirstPortTries && p <= 65535; ++p) {
+    addr.sin_port = htons(static_cast<std::uint16_t>(p));
+    bound = ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+  }
+  if (!bound) addr.sin_port = 0;
   socklen_t len = sizeof addr;
-  if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || ::listen(fd, 32) != 0 ||
+  if ((!bound && ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) || ::listen(fd, 32) != 0 ||
       ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot listen on 127.0.0.1: %s", pm::ErrnoText(errno).c_str());
     ::close(fd);

@@ -7,8 +7,11 @@
 
 namespace ndilb {
 
-// A listening socket on 127.0.0.1 with a port chosen by the system; -1 on
-// failure (logged).
+// A listening socket on 127.0.0.1; -1 on failure (logged). The port is the
+// lowest free one of the kFirstPortTries from $NDI_LOOPBACK_FIRST_PORT on when
+// that is set (as the vendor runtime's senders take theirs from 5961), else
+// one chosen by the system.
+inline constexpr long kFirstPortTries = 64;
 int ListenLoopback(int* port);
 // Connects to "HOST:PORT" within `timeout_ms`; -1 when it cannot.
 int ConnectTo(const std::string& url, int timeout_ms);

@@ -81,22 +81,25 @@ Receiver::~Receiver() {
   if (wake_fd_ >= 0) ::close(wake_fd_);
 }
 
-std::string Receiver::ResolveUrl() const {
-  // The name wins: a sender that comes back may listen on a new port.
-  if (!name_.empty()) {
-    for (const RegistryEntry& e : ListRegistry()) {
-      if (e.name == name_) return e.url;
-    }
-    return {};
+std::string Receiver::ListedUrl() const {
+  if (name_.empty()) return {};
+  for (const RegistryEntry& e : ListRegistry()) {
+    if (e.name == name_) return e.url;
   }
-  return url_;
+  return {};
 }
 
 void Receiver::Run() {
   pm::SetThreadName("ndi-lb receiver");
   while (!stop_) {
-    const std::string url = ResolveUrl();
-    const int fd = url.empty() ? -1 : ConnectTo(url, kConnectTimeoutMs);
+    // As with the vendor runtime: the URL first, whoever listens there; when
+    // nothing answers, the URL listed for the name (a sender that came back
+    // may listen on a new port).
+    int fd = url_.empty() ? -1 : ConnectTo(url_, kConnectTimeoutMs);
+    if (fd < 0) {
+      const std::string listed = ListedUrl();
+      if (!listed.empty() && listed != url_) fd = ConnectTo(listed, kConnectTimeoutMs);
+    }
     if (fd >= 0) {
       Serve(fd);
       connected_ = false;

@@ -7,10 +7,13 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cctype>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
+#include <map>
 
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
@@ -19,7 +22,19 @@ namespace ndilb {
 namespace {
 
 constexpr const char* kSuffix = ".ndi";
+constexpr const char* kGoneSuffix = ".gone";
 constexpr std::size_t kMaxEntryBytes = 4096;
+
+std::int64_t RealtimeNs() {
+  timespec ts{};
+  ::clock_gettime(CLOCK_REALTIME, &ts);
+  return std::int64_t{ts.tv_sec} * 1'000'000'000 + ts.tv_nsec;
+}
+
+bool EndsWith(const std::string& s, const char* suffix) {
+  const std::size_t n = std::strlen(suffix);
+  return s.size() > n && s.compare(s.size() - n, n, suffix) == 0;
+}
 
 bool ReadSmallFile(const std::string& path, std::string* out) {
   const int fd = pm::RetryEintr([&] { return ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW); });
@@ -63,21 +78,30 @@ std::string RegistryDir() {
   return dir;
 }
 
-std::string WriteRegistryEntry(const RegistryEntry& entry) {
-  const std::string dir = RegistryDir();
-  const std::size_t colon = entry.url.rfind(':');
-  const std::string port = colon == std::string::npos ? "0" : entry.url.substr(colon + 1);
-  const std::string base = std::to_string(entry.pid) + "-" + port;
-  const std::string path = dir + "/" + base + kSuffix;
-  const std::string temp = dir + "/." + base + ".tmp";
-  const std::string text = "ndi-loopback 1\nname=" + Clean(entry.name) + "\nurl=" + Clean(entry.url) +
-                           "\npid=" + std::to_string(entry.pid) + "\n";
+namespace {
+
+std::string EntryText(const RegistryEntry& e) {
+  std::string text = "ndi-loopback 1\nname=" + Clean(e.name) + "\nurl=" + Clean(e.url) + "\npid=" + std::to_string(e.pid) +
+                     "\nsince=" + std::to_string(e.since) + "\n";
+  if (e.gone != 0) text += "gone=" + std::to_string(e.gone) + "\n";
+  return text;
+}
+
+// Writes `text` to `path` through a temporary file of this writer's own, so
+// that readers and other writers never see half an entry; false (logged
+// unless quiet) on failure.
+bool Publish(const std::string& dir, const std::string& path, const std::string& text, bool quiet = false) {
+  static std::atomic<unsigned> serial{0};
+  const std::string temp =
+      dir + "/." + std::to_string(::getpid()) + "-" + std::to_string(serial.fetch_add(1)) + ".tmp";
   const int fd = pm::RetryEintr(
       [&] { return ::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600); });
   if (fd < 0) {
-    pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot write registry entry %s: %s", temp.c_str(),
-            pm::ErrnoText(errno).c_str());
-    return {};
+    if (!quiet) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot write registry entry %s: %s", temp.c_str(),
+              pm::ErrnoText(errno).c_str());
+    }
+    return false;
   }
   std::size_t done = 0;
   bool ok = true;
@@ -91,17 +115,60 @@ std::string WriteRegistryEntry(const RegistryEntry& entry) {
   }
   ::close(fd);
   if (!ok || ::rename(temp.c_str(), path.c_str()) != 0) {
-    pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot publish registry entry %s: %s", path.c_str(),
-            pm::ErrnoText(errno).c_str());
+    if (!quiet) {
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot publish registry entry %s: %s", path.c_str(),
+              pm::ErrnoText(errno).c_str());
+    }
     ::unlink(temp.c_str());
-    return {};
+    return false;
   }
-  return path;
+  return true;
 }
 
-void RemoveRegistryEntry(const std::string& path) {
-  if (!path.empty()) ::unlink(path.c_str());
+// Turns the entry `e` read from "<base>.ndi" into "<base>.gone", gone at
+// e.gone; false when the ".gone" entry cannot be written.
+bool Retire(const std::string& dir, const std::string& base, const RegistryEntry& e, bool quiet) {
+  if (!Publish(dir, dir + "/" + base + kGoneSuffix, EntryText(e), quiet)) return false;
+  ::unlink((dir + "/" + base + kSuffix).c_str());
+  return true;
 }
+
+}  // namespace
+
+std::string WriteRegistryEntry(const RegistryEntry& entry) {
+  const std::string dir = RegistryDir();
+  const std::size_t colon = entry.url.rfind(':');
+  const std::string port = colon == std::string::npos ? "0" : entry.url.substr(colon + 1);
+  const std::string path = dir + "/" + std::to_string(entry.pid) + "-" + port + kSuffix;
+  RegistryEntry stamped = entry;
+  stamped.since = RealtimeNs();
+  stamped.gone = 0;
+  return Publish(dir, path, EntryText(stamped)) ? path : std::string();
+}
+
+void RetireRegistryEntry(const std::string& path) {
+  if (path.empty() || !EndsWith(path, kSuffix)) return;
+  const std::size_t slash = path.rfind('/');
+  const std::string dir = slash == std::string::npos ? "." : path.substr(0, slash);
+  const std::string file = slash == std::string::npos ? path : path.substr(slash + 1);
+  std::string text;
+  RegistryEntry e;
+  if (!ReadSmallFile(path, &text) || !ParseRegistryEntry(text, &e)) {
+    ::unlink(path.c_str());
+    return;
+  }
+  e.gone = RealtimeNs();
+  if (!Retire(dir, file.substr(0, file.size() - std::strlen(kSuffix)), e, false)) ::unlink(path.c_str());
+}
+
+namespace {
+
+// 1 to `most` decimal digits.
+bool Digits(const std::string& s, std::size_t most) {
+  return !s.empty() && s.size() <= most && std::all_of(s.begin(), s.end(), [](char c) { return c >= '0' && c <= '9'; });
+}
+
+}  // namespace
 
 bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
   RegistryEntry e;
@@ -125,12 +192,15 @@ bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
       have_url = !e.url.empty();
     } else if (line.rfind("pid=", 0) == 0) {
       const std::string digits = line.substr(4);
-      if (digits.empty() || digits.size() > 9 ||
-          !std::all_of(digits.begin(), digits.end(), [](char c) { return c >= '0' && c <= '9'; })) {
-        return false;
-      }
+      if (!Digits(digits, 9)) return false;
       e.pid = std::atoi(digits.c_str());
       have_pid = e.pid > 0;
+    } else if (line.rfind("since=", 0) == 0 || line.rfind("gone=", 0) == 0) {
+      const bool since = line[0] == 's';
+      const std::string digits = line.substr(since ? 6 : 5);
+      // A time in ns fits a signed 64-bit value.
+      if (!Digits(digits, 19) || (digits.size() == 19 && digits > "9223372036854775807")) return false;
+      (since ? e.since : e.gone) = std::strtoll(digits.c_str(), nullptr, 10);
     }
   }
   if (!have_name || !have_url || !have_pid) return false;
@@ -153,26 +223,45 @@ bool ProcessAlive(int pid) {
 }
 
 std::vector<RegistryEntry> ListRegistry() {
-  std::vector<RegistryEntry> entries;
   const std::string dir = RegistryDir();
+  const std::int64_t now = RealtimeNs();
+  std::map<std::string, RegistryEntry> byName;  // per name, the entry made first
   DIR* d = ::opendir(dir.c_str());
-  if (d == nullptr) return entries;
+  if (d == nullptr) return {};
   while (dirent* ent = ::readdir(d)) {
     const std::string file = ent->d_name;
-    if (file.size() <= std::strlen(kSuffix) || file[0] == '.' ||
-        file.compare(file.size() - std::strlen(kSuffix), std::string::npos, kSuffix) != 0) {
-      continue;
-    }
+    const bool present = EndsWith(file, kSuffix);
+    if (file[0] == '.' || (!present && !EndsWith(file, kGoneSuffix))) continue;
     std::string text;
     RegistryEntry e;
     if (!ReadSmallFile(dir + "/" + file, &text) || !ParseRegistryEntry(text, &e)) continue;
-    if (!ProcessAlive(e.pid)) continue;
-    entries.push_back(std::move(e));
+    if (present && e.gone != 0) continue;   // not one of ours
+    if (!present && e.gone == 0) continue;
+    if (present && !ProcessAlive(e.pid)) {
+      // Found gone just now. Where that cannot be written down (a folder
+      // this process may not write), it is not listed at all: each look
+      // would find it gone "just now" again.
+      e.gone = now;
+      if (!Retire(dir, file.substr(0, file.size() - std::strlen(kSuffix)), e, true)) continue;
+    }
+    if (e.gone != 0) {
+      // A time ahead of ours (a clock set back, another machine's folder)
+      // is not listed either.
+      const std::int64_t goneMs = (now - e.gone) / 1'000'000;
+      if (goneMs < 0 || goneMs >= kListedAfterGoneMs) {
+        if (goneMs >= kKeptAfterGoneMs || goneMs <= -kKeptAfterGoneMs) ::unlink((dir + "/" + file).c_str());
+        continue;
+      }
+    }
+    auto [it, added] = byName.emplace(e.name, e);
+    if (!added && (e.since < it->second.since || (e.since == it->second.since && e.url < it->second.url))) {
+      it->second = std::move(e);
+    }
   }
   ::closedir(d);
-  std::sort(entries.begin(), entries.end(), [](const RegistryEntry& a, const RegistryEntry& b) {
-    return a.name != b.name ? a.name < b.name : a.url < b.url;
-  });
+  std::vector<RegistryEntry> entries;
+  entries.reserve(byName.size());
+  for (auto& [name, e] : byName) entries.push_back(std::move(e));
   return entries;
 }
 

@@ -73,7 +73,7 @@ std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
 }
 
 Sender::~Sender() {
-  RemoveRegistryEntry(registry_path_);
+  RetireRegistryEntry(registry_path_);
   stop_ = true;
   if (wake_fd_ >= 0) Wake(wake_fd_);
   if (thread_.joinable()) thread_.join();

@@ -271,6 +271,15 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
   EXPECT_TRUE(framesAgain);
 }
 
+// The loopback runtime keeps a sender that went listed for a second, as the
+// vendor runtime does; senders here take ports as the vendor's do (the lowest
+// free one), so the dead sender's port goes to the next sender at once.
+TEST(EndToEnd, ASourceLedToAnotherSendersPortByAStaleListingComesToItsOwnSender) {
+  Folder folder;
+  folder.firstPort = 20000 + static_cast<int>(::getpid() % 10000);
+  pmtest::ExpectASourceLedToAnotherSendersPortToComeToItsOwn(folder);
+}
+
 // A host sink that only counts.
 struct CountingSink : pmhost::FrameSink {
   void OnVideo(const std::string&, const pmhost::VideoFrame&) override { ++videos; }
