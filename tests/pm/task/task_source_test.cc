@@ -112,6 +112,20 @@ class ScriptedDiscovery : public pm::SourceDiscovery {
   std::function<void()> onStart_;
 };
 
+// Sends a command on `peer` and returns its reply (discarded when none
+// comes), skipping other frames.
+Json AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
+  body["pm::command"] = command;
+  body["pm::unique_id"] = id;
+  body["pm::request"] = true;
+  if (!peer.WriteJson(body)) return Json::value_t::discarded;
+  for (;;) {
+    const Json frame = peer.ReadJson(5s);
+    if (frame.is_discarded()) return frame;
+    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
+  }
+}
+
 // A task with scripted factories, one dispatcher attached as the runner
 // attaches it, and the host's end of that connection.
 class TaskSourceTest : public ::testing::Test {
@@ -159,18 +173,7 @@ class TaskSourceTest : public ::testing::Test {
 
   // Sends a command and returns its reply, skipping the task's own requests
   // (a started source announces its buffer queue).
-  Json Ask(const std::string& command, Json body = Json::object()) {
-    const std::uint64_t id = ++requestId_;
-    body["pm::command"] = command;
-    body["pm::unique_id"] = id;
-    body["pm::request"] = true;
-    EXPECT_TRUE(host_.WriteJson(body));
-    for (;;) {
-      const Json frame = host_.ReadJson(5s);
-      if (frame.is_discarded()) return frame;
-      if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
-    }
-  }
+  Json Ask(const std::string& command, Json body = Json::object()) { return AskOn(host_, ++requestId_, command, body); }
   void StartSource(const std::string& id, const Json* config = nullptr) {
     Json body = {{"unique_id", id}};
     if (config) body["config"] = *config;
@@ -203,19 +206,6 @@ class TaskSourceTest : public ::testing::Test {
 };
 
 using Lines = std::vector<std::string>;
-
-// Sends a command on `peer` and waits for its reply, skipping other frames.
-bool AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
-  body["pm::command"] = command;
-  body["pm::unique_id"] = id;
-  body["pm::request"] = true;
-  if (!peer.WriteJson(body)) return false;
-  for (;;) {
-    const Json frame = peer.ReadJson(5s);
-    if (frame.is_discarded()) return false;
-    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return true;
-  }
-}
 
 // Every object started and not the survivor was stopped, and the survivor was not.
 void ExpectOnlySurvivorRunning(const Lines& lines, const std::string& prefix, const std::string& survivor) {
@@ -284,24 +274,26 @@ TEST_F(TaskSourceTest, SecondStartForARunningIdStopsTheOldSourceBeforeTheNewStar
   EXPECT_EQ(journal_.Lines(), (Lines{"hotplug a#2"}));
 }
 
-TEST_F(TaskSourceTest, StartThatThrowsStopsTheSourceAndLogsTheRequest) {
-  EditScript([](Script& script) { script.throwOnStart = true; });
-  pmtest::LogCapture log;
-  StartSource("a");
-  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 ", "start a#1", "stop a#1"}));
-  EXPECT_EQ(task_->SourceCount(), 0u);
-  // The whole request, indented by 4.
-  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
-  EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
-}
-
-TEST_F(TaskSourceTest, ConfigurationThatThrowsLeavesNothingAndStartsNothing) {
-  EditScript([](Script& script) { script.throwOnConfiguration = true; });
-  pmtest::LogCapture log;
-  StartSource("a");
-  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 "}));
-  EXPECT_EQ(task_->SourceCount(), 0u);
-  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception"), 1);
+// A start or configuration that throws leaves no source behind (a started
+// one is stopped) and logs the whole request, indented by 4.
+TEST_F(TaskSourceTest, FailedStartOrConfigurationLeavesNothingAndLogsTheRequest) {
+  struct Case {
+    bool throwOnConfiguration;
+    Lines journal;
+  } cases[] = {{false, {"config a#1 ", "start a#1", "stop a#1"}}, {true, {"config a#2 "}}};
+  for (const Case& c : cases) {
+    EditScript([&](Script& script) {
+      script.throwOnStart = true;
+      script.throwOnConfiguration = c.throwOnConfiguration;
+    });
+    journal_.Clear();
+    pmtest::LogCapture log;
+    StartSource("a");
+    EXPECT_EQ(journal_.Lines(), c.journal);
+    EXPECT_EQ(task_->SourceCount(), 0u);
+    EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
+    EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
+  }
 }
 
 TEST_F(TaskSourceTest, StartWithANumericOrMissingIdIsLoggedAndChangesNothing) {
@@ -395,10 +387,10 @@ TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut)
   ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::start_discovery"}, {"pm::unique_id", 900},
                                {"pm::request", true}}));
   ASSERT_TRUE(pmtest::WaitFor([&] { return discoveryStarting_.load(); }));
-  EXPECT_TRUE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}));
+  EXPECT_FALSE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}).is_discarded());
   discoveryMayStart_ = true;
   EXPECT_FALSE(Ask("pm::tsrc::discovery_hotplug_event").is_discarded());
-  EXPECT_TRUE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}));
+  EXPECT_FALSE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}).is_discarded());
   EXPECT_EQ(task_->DispatcherCount(), 2u);
   EXPECT_EQ(journal_.Lines(),
             (Lines{"config a#1 ", "start a#1", "start discovery#1", "stop a#1", "hotplug discovery#1"}));
@@ -416,8 +408,8 @@ TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopThe
   constexpr int kRounds = 15;
   const auto drive = [](pmtest::HostPeer& peer) {
     for (int i = 0; i < kRounds; ++i) {
-      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()));
-      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}));
+      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()).is_discarded());
+      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}).is_discarded());
     }
   };
   std::thread other([&] { drive(second); });

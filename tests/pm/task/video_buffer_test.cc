@@ -265,48 +265,44 @@ TEST(VideoBufferConvertFrame, PlanarRefusalsStopBeforeWritingPastAnyPlane) {
   }
 }
 
-TEST(VideoBufferConvertFrame, BGRXGetsOpaqueAlphaTopDownAndBottomUp) {
-  const int w = 7, h = 5;  // 7 pixels: one 4-pixel vector step and a tail
-  for (bool bottomUp : {false, true}) {
-    SCOPED_TRACE(bottomUp ? "bottom-up" : "top-down");
-    const int stride = 4 * w + 4;
-    Bytes pixels(static_cast<std::size_t>(stride) * h);
-    for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i);
-    pm::VideoPlanes src;
-    src.planeCount = 1;
-    // Bottom-up: the first picture row is the last one in memory.
-    src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                            : pm::Plane{pixels.data.get(), h, stride};
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w);
-    buffer.ConvertFrame(pm::kCodeBGRX, src);
-    for (int r = 0; r < h; ++r) {
-      const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-      for (int c = 0; c < 4 * w; ++c)
-        ASSERT_EQ(buffer.Row(0, r)[c], c % 4 == 3 ? 0xFF : in[c]) << r << " " << c;
-    }
-  }
+// BGRX copies 4 bytes a pixel, BGR0 widens 3 to 4; both set the fourth byte
+// to 0xFF and write nothing past the row, top-down and bottom-up (the first
+// picture row last in memory). 7 pixels: one 4-pixel vector step and a tail.
+struct Packed {
+  std::uint32_t code;
+  int inBytes;    // per pixel
+  int padding;    // source bytes after a row
+  int dstExtra;   // destination bytes after a row
+};
+constexpr Packed kPacked[] = {{pm::kCodeBGRX, 4, 4, 0}, {pm::kCodeBGR0, 3, 0, 8}};
+
+pm::VideoPlanes PackedSource(Bytes& pixels, int h, int stride, bool bottomUp) {
+  pm::VideoPlanes src;
+  src.planeCount = 1;
+  src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
+                          : pm::Plane{pixels.data.get(), h, stride};
+  return src;
 }
 
-TEST(VideoBufferConvertFrame, BGR0WidensThreeBytesToFour) {
-  const int w = 5, h = 3;
-  for (bool bottomUp : {false, true}) {
-    SCOPED_TRACE(bottomUp ? "bottom-up" : "top-down");
-    const int stride = 3 * w;  // no padding: the tightest source
-    Bytes pixels(static_cast<std::size_t>(stride) * h);
-    for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i + 9);
-    pm::VideoPlanes src;
-    src.planeCount = 1;
-    src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                            : pm::Plane{pixels.data.get(), h, stride};
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + 8);
-    buffer.ConvertFrame(pm::kCodeBGR0, src);
-    for (int r = 0; r < h; ++r) {
-      const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-      for (int p = 0; p < w; ++p) {
-        for (int k = 0; k < 3; ++k) ASSERT_EQ(buffer.Row(0, r)[4 * p + k], in[3 * p + k]);
-        ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
+  const int w = 7, h = 5;
+  for (const Packed& k : kPacked) {
+    for (bool bottomUp : {false, true}) {
+      SCOPED_TRACE(testing::Message() << k.code << (bottomUp ? " bottom-up" : " top-down"));
+      const int stride = k.inBytes * w + k.padding;
+      Bytes pixels(static_cast<std::size_t>(stride) * h);
+      for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i + 9);
+      const pm::VideoPlanes src = PackedSource(pixels, h, stride, bottomUp);
+      MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
+      buffer.ConvertFrame(k.code, src);
+      for (int r = 0; r < h; ++r) {
+        const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
+        for (int p = 0; p < w; ++p) {
+          for (int b = 0; b < 3; ++b) ASSERT_EQ(buffer.Row(0, r)[4 * p + b], in[k.inBytes * p + b]) << r << " " << p;
+          ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+        }
+        for (int c = 4 * w; c < 4 * w + k.dstExtra; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
       }
-      for (int c = 4 * w; c < 4 * w + 8; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
     }
   }
 }
@@ -314,32 +310,31 @@ TEST(VideoBufferConvertFrame, BGR0WidensThreeBytesToFour) {
 TEST(VideoBufferConvertFrame, PackedRefusalsWriteNothing) {
   const int w = 6, h = 3;
   Bytes pixels(static_cast<std::size_t>(4 * w) * h);
-  auto refused = [&](std::uint32_t code, pm::VideoPlanes src, std::int32_t dstStride) {
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), dstStride);
-    buffer.ConvertFrame(code, src);
-    return buffer.AllUntouched() && buffer.maps == 1 && buffer.unmaps == 1;
+  struct Case {
+    std::uint32_t code;
+    int planeCount, rows, stride;
+    bool noData;
+    int dstStride;
+  } cases[] = {
+      {pm::kCodeBGRX, 2, h, 4 * w, false, 4 * w},
+      {pm::kCodeBGRX, 1, h + 1, 4 * w, false, 4 * w},
+      {pm::kCodeBGRX, 1, h, 4 * w - 1, false, 4 * w},
+      {pm::kCodeBGRX, 1, h, -(4 * w - 1), false, 4 * w},
+      {pm::kCodeBGRX, 1, h, 4 * w, false, 4 * w - 4},  // destination too narrow
+      {pm::kCodeBGR0, 1, h, 3 * w - 1, false, 4 * w},
+      {pm::kCodeBGR0, 1, h, 4 * w, true, 4 * w},
   };
-  pm::VideoPlanes good;
-  good.planeCount = 1;
-  good.plane[0] = {pixels.data.get(), h, 4 * w};
-  pm::VideoPlanes p = good;
-  p.planeCount = 2;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p = good;
-  p.plane[0].rows = h + 1;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p = good;
-  p.plane[0].stride = 4 * w - 1;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p.plane[0].stride = -(4 * w - 1);
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  EXPECT_TRUE(refused(pm::kCodeBGRX, good, 4 * w - 4));  // destination too narrow
-  p = good;
-  p.plane[0].stride = 3 * w - 1;
-  EXPECT_TRUE(refused(pm::kCodeBGR0, p, 4 * w));
-  p = good;
-  p.plane[0].data = nullptr;
-  EXPECT_TRUE(refused(pm::kCodeBGR0, p, 4 * w));
+  for (const Case& c : cases) {
+    SCOPED_TRACE(testing::Message() << c.code << " rows " << c.rows << " stride " << c.stride << " to " << c.dstStride);
+    pm::VideoPlanes src;
+    src.planeCount = c.planeCount;
+    src.plane[0] = {c.noData ? nullptr : pixels.data.get(), c.rows, c.stride};
+    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), c.dstStride);
+    buffer.ConvertFrame(c.code, src);
+    EXPECT_TRUE(buffer.AllUntouched());
+    EXPECT_EQ(buffer.maps, 1);
+    EXPECT_EQ(buffer.unmaps, 1);
+  }
 }
 
 TEST(VideoBufferConvertFrame, UnlistedPairsMapNothing) {
