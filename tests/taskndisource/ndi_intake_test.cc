@@ -54,8 +54,8 @@ TEST_F(IntakeTest, UyvyFrameIsRequestedAs2vuyAndCopiedRowByRow) {
   auto frame = VideoCapture(kNdiFourCCUYVY, 64, 8, 160);
   MediaInfo info;
   ASSERT_TRUE(Video(frame, &info));
-  ASSERT_EQ(callbacks->VideoRequests().size(), 1u);
-  const Requested r = Read(callbacks->VideoRequests()[0]);
+  ASSERT_EQ(callbacks->Seen().videoRequests.size(), 1u);
+  const Requested r = Read(callbacks->Seen().videoRequests[0]);
   EXPECT_EQ(r.code, 0x32767579u);
   EXPECT_EQ(r.width, 64);
   EXPECT_EQ(r.height, 8);
@@ -63,7 +63,7 @@ TEST_F(IntakeTest, UyvyFrameIsRequestedAs2vuyAndCopiedRowByRow) {
   EXPECT_EQ(r.field, 0);
   EXPECT_EQ(r.scan, 'P');
   EXPECT_EQ(r.extras, 0);
-  const auto sent = callbacks->VideoSent();
+  const auto sent = callbacks->Seen().videoSent;
   ASSERT_EQ(sent.size(), 1u);
   EXPECT_EQ(sent[0]->copiedStride, 160);
   for (int row = 0; row < 8; ++row) {
@@ -81,15 +81,15 @@ TEST_F(IntakeTest, EachAcceptedFourCCMapsToItsHostCode) {
   for (const Case& c : {Case{kNdiFourCCUYVA, pm::kCode2vuy, 32}, Case{kNdiFourCCNV12, pm::kCodeNV12, 16},
                         Case{kNdiFourCCBGRA, pm::kCodeRgba, 64}}) {
     ASSERT_TRUE(Video(VideoCapture(c.fourcc, 16, 4, c.stride, 0, /*progressive=*/false)));
-    EXPECT_EQ(Read(callbacks->VideoRequests().back()).code, c.code);
-    EXPECT_EQ(Read(callbacks->VideoRequests().back()).scan, 'U');
+    EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).code, c.code);
+    EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).scan, 'U');
   }
 }
 
 TEST_F(IntakeTest, Nv12CopiesLumaAndChromaWithTheFrameStride) {
   auto frame = VideoCapture(kNdiFourCCNV12, 16, 4, 24);
   ASSERT_TRUE(Video(frame));
-  const auto sent = callbacks->VideoSent();
+  const auto sent = callbacks->Seen().videoSent;
   ASSERT_EQ(sent.size(), 1u);
   for (int row = 0; row < 6; ++row) {  // 4 luma rows, 2 chroma rows
     ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 16, frame->bytes.data() + row * 24, 16)) << row;
@@ -140,8 +140,8 @@ TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
     EXPECT_FALSE(Video(c.frame)) << c.line;
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
   }
-  EXPECT_TRUE(callbacks->VideoRequests().empty());
-  EXPECT_TRUE(callbacks->Calls().empty());
+  EXPECT_TRUE(callbacks->Seen().videoRequests.empty());
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
   // The source still takes good frames.
   EXPECT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
 }
@@ -149,7 +149,7 @@ TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
 TEST_F(IntakeTest, LargestDescribableFrameIsTaken) {
   auto frame = VideoCapture(kNdiFourCCNV12, 32767, 1, 32767);
   ASSERT_TRUE(Video(frame));
-  EXPECT_EQ(Read(callbacks->VideoRequests().back()).width, 32767);
+  EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).width, 32767);
 }
 
 TEST_F(IntakeTest, VideoWellRanDryLosesOnlyThatFrame) {
@@ -167,7 +167,7 @@ TEST_F(IntakeTest, BufferOfAnotherFormatIsNotCopiedInto) {
   bigger.height = 1080;
   callbacks->OverrideVideoFormat(bigger);
   EXPECT_FALSE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
-  EXPECT_TRUE(callbacks->VideoSent().empty());
+  EXPECT_TRUE(callbacks->Seen().videoSent.empty());
 }
 
 TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
@@ -183,13 +183,13 @@ TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
 TEST_F(IntakeTest, StereoAudioIsInterleavedIntoTheHostBuffer) {
   MediaInfo info;
   ASSERT_TRUE(Audio(AudioCapture(48000, 2, 1600), &info));
-  const auto requests = callbacks->AudioRequests();
+  const auto requests = callbacks->Seen().audioRequests;
   ASSERT_EQ(requests.size(), 1u);
   EXPECT_EQ(requests[0].first.code, 0x666C3332u);
   EXPECT_EQ(requests[0].first.sampleRate, 48000u);
   EXPECT_EQ(requests[0].first.channels, 2);
   EXPECT_EQ(requests[0].second, 1600);
-  const auto samples = callbacks->AudioSent().at(0)->Samples();
+  const auto samples = callbacks->Seen().audioSent.at(0)->Samples();
   ASSERT_EQ(samples.size(), 3200u);
   EXPECT_EQ(samples[0], 0.0f);     // channel 0, sample 0
   EXPECT_EQ(samples[1], 1000.0f);  // channel 1, sample 0
@@ -218,7 +218,7 @@ TEST_F(IntakeTest, BadAudioFramesAreDroppedWithTheirLine) {
     EXPECT_FALSE(Audio(c.frame)) << c.line;
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
   }
-  EXPECT_TRUE(callbacks->AudioRequests().empty());
+  EXPECT_TRUE(callbacks->Seen().audioRequests.empty());
   EXPECT_TRUE(Audio(AudioCapture(48000, 127, 4)));
 }
 
@@ -248,10 +248,10 @@ TEST_F(IntakeTest, SoundOfTooManyChannelsIsToldOnceAndNamedOnThePanel) {
   for (const Case& c : cases) {
     SCOPED_TRACE(c.channels);
     logs.Clear();
-    const std::size_t requested = callbacks->AudioRequests().size();
+    const std::size_t requested = callbacks->Seen().audioRequests.size();
     MediaInfo info;
     for (int frame = 0; frame < 5; ++frame) EXPECT_EQ(Audio(AudioCapture(48000, c.channels, 4), &info), c.lines.empty());
-    EXPECT_EQ(callbacks->AudioRequests().size() - requested, c.lines.empty() ? 5u : 0u);
+    EXPECT_EQ(callbacks->Seen().audioRequests.size() - requested, c.lines.empty() ? 5u : 0u);
     EXPECT_EQ(logs.Lines(), c.lines);
     EXPECT_EQ(TaskNDISource::AudioStatusText(info), c.status);
   }
@@ -261,7 +261,7 @@ TEST_F(IntakeTest, AudioBufferSmallerThanTheFrameIsNotWrittenPast) {
   callbacks->OverrideAudioBytes(2 * 16 * 4 - 1);
   EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
   EXPECT_TRUE(logs.Contains("#ndisource: audio buffer too small for the NDI audio frame\n"));
-  EXPECT_TRUE(callbacks->AudioSent().empty());
+  EXPECT_TRUE(callbacks->Seen().audioSent.empty());
   callbacks->SetDry(false, true);
   EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
   EXPECT_TRUE(logs.Contains("#ndisource: audio well ran dry\n"));
@@ -276,7 +276,7 @@ TEST_F(IntakeTest, TimestampsCountFromTheOldestFrameAcrossAudioAndVideo) {
   // Audio older than every video frame: new base for both, host clock reset.
   ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 40'000'000)));
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 40'000'001)));
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{
                                     "video request", "reset", "production 1", "video 0",
                                     "video request", "video 705600000",
                                     "audio request", "production 3", "audio 352800000",
@@ -291,7 +291,7 @@ TEST_F(IntakeTest, NewBaseOfADroppedFrameResetsTheHostWithTheNextDeliveredFrame)
   EXPECT_FALSE(Video(VideoCapture(kNdiFourCCI420, 16, 4, 16, 10'000'000)));  // takes the base, no reset yet
   EXPECT_EQ(callbacks->Count("reset"), 1);
   ASSERT_TRUE(Audio(AudioCapture(48000, 1, 16, 20'000'000)));
-  const auto calls = callbacks->Calls();
+  const auto calls = callbacks->Seen().calls;
   EXPECT_EQ(std::vector<std::string>(calls.end() - 4, calls.end()),
             (std::vector<std::string>{"audio request", "reset", "production 3", "audio 705600000"}));
 }
@@ -322,7 +322,7 @@ TEST(TicksFrom100ns, ConvertsExactlyAndSaturatesInsteadOfOverflowing) {
 TEST_F(IntakeTest, TimestampsFarApartDoNotOverflow) {
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::min() + 1)));
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::max())));
-  EXPECT_EQ(callbacks->Calls().back(), "video " + std::to_string(std::numeric_limits<std::int64_t>::max()));
+  EXPECT_EQ(callbacks->Seen().calls.back(), "video " + std::to_string(std::numeric_limits<std::int64_t>::max()));
 }
 
 }  // namespace

@@ -30,10 +30,10 @@ class MetadataTest : public ::testing::Test {
 
   std::vector<std::string> Ptz(std::vector<nlohmann::json> commands) {
     std::deque<nlohmann::json> queue(commands.begin(), commands.end());
-    const std::size_t before = ndi.PtzCalls().size();
+    const std::size_t before = ndi.Seen().ptzCalls.size();
     source->RunPtzCommands(kReceiver, queue);
     EXPECT_TRUE(queue.empty());
-    const auto calls = ndi.PtzCalls();
+    const auto calls = ndi.Seen().ptzCalls;
     return std::vector<std::string>(calls.begin() + static_cast<std::ptrdiff_t>(before), calls.end());
   }
 
@@ -48,12 +48,12 @@ TEST_F(MetadataTest, ShotEventIsPrintedIndentedWithItsTerminatingZeroCounted) {
   std::deque<ShotEvent> queue{ShotEvent{"X", 1, 0}, ShotEvent{"a\"b<&>", 0, 1}};
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  const auto sent = ndi.MetadataSent();
+  const auto sent = ndi.Seen().metadataSent;
   ASSERT_EQ(sent.size(), 2u);
   EXPECT_EQ(sent[0], "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[1],
             "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(ndi.MetadataLengths()[0], static_cast<int>(sent[0].size()) + 1);
+  EXPECT_EQ(ndi.Seen().metadataLengths[0], static_cast<int>(sent[0].size()) + 1);
 }
 
 TEST_F(MetadataTest, UnsentShotEventStaysFirstForTheNextPass) {
@@ -62,13 +62,13 @@ TEST_F(MetadataTest, UnsentShotEventStaysFirstForTheNextPass) {
   source->SendShotEvents(kReceiver, queue);
   ASSERT_EQ(queue.size(), 2u);
   EXPECT_EQ(queue.front().name, "one");
-  EXPECT_EQ(ndi.MetadataLengths().size(), 1u);  // stopped at the first failure
+  EXPECT_EQ(ndi.Seen().metadataLengths.size(), 1u);  // stopped at the first failure
   ndi.SetMetadataResult(true);
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  ASSERT_EQ(ndi.MetadataSent().size(), 2u);
-  EXPECT_NE(ndi.MetadataSent()[0].find("\"one\""), std::string::npos);
-  EXPECT_NE(ndi.MetadataSent()[1].find("\"two\""), std::string::npos);
+  ASSERT_EQ(ndi.Seen().metadataSent.size(), 2u);
+  EXPECT_NE(ndi.Seen().metadataSent[0].find("\"one\""), std::string::npos);
+  EXPECT_NE(ndi.Seen().metadataSent[1].find("\"two\""), std::string::npos);
 }
 
 TEST_F(MetadataTest, EveryPtzCommandReachesItsCallWithItsParameters) {
@@ -150,7 +150,7 @@ TEST_F(MetadataTest, BuildOutDurationIsReportedInTicks) {
   Metadata("<other><buildOutDuration>0.5</buildOutDuration></other>");
   Metadata("<metadata><buildOutDuration>soon</buildOutDuration></metadata>");
   Metadata("<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>");
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"buildout 352800000", "buildout 1411200000"}));
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"buildout 352800000", "buildout 1411200000"}));
   EXPECT_TRUE(logs.Lines().empty());
 }
 
@@ -158,7 +158,7 @@ TEST_F(MetadataTest, BuildOutDurationWithoutATickCountIsDropped) {
   Metadata("<metadata><buildOutDuration>1e300</buildOutDuration></metadata>");
   Metadata("<metadata><buildOutDuration>nan</buildOutDuration></metadata>");
   Metadata("<metadata><buildOutDuration>-inf</buildOutDuration></metadata>");
-  EXPECT_TRUE(callbacks->Calls().empty());
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
   EXPECT_EQ(logs.Count("#ndisource: invalid buildOutDuration in NDI metadata frame\n"), 3);
 }
 
@@ -191,7 +191,7 @@ TEST_F(MetadataTest, BadMetadataFramesAreDroppedWithTheirLine) {
                               "#ndisource: failed to parse metadata frame\n",
                               "#ndisource: failed to parse metadata frame\n",
                           }));
-  EXPECT_TRUE(callbacks->Calls().empty());
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
 }
 
 TEST_F(MetadataTest, MetadataIsReadOnlyWithinItsLength) {
@@ -208,7 +208,7 @@ TEST_F(MetadataTest, MetadataIsReadOnlyWithinItsLength) {
   withZero += "garbage that is not XML";
   ndi_metadata_frame early{static_cast<int>(withZero.size()), 0, withZero.data()};
   source->ProcessMetadataFrame(early);
-  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"buildout 705600000"});
+  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"buildout 705600000"});
   EXPECT_EQ(source->ModelName(), "A");
 }
 
@@ -218,7 +218,7 @@ TEST_F(MetadataTest, PtzSupportIsReportedWithTheModelName) {
   source->ReportPtzSupport(kReceiver);
   ndi.SetPtzSupported(false);
   source->ReportPtzSupport(kReceiver);
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"ptz NDI3/Model X", "ptz /"}));
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/Model X", "ptz /"}));
   EXPECT_TRUE(logs.Contains("#ndisource: NDICaptureDevice~STUDIO (Cam 1) supports PTZ\n"));
 }
 
@@ -231,7 +231,7 @@ TEST_F(MetadataTest, AModelNameArrivingAfterPtzSupportIsReportedAgain) {
   ndi.SetPtzSupported(false);
   source->ReportPtzSupport(kReceiver);
   Metadata(R"(<ndi_product model_name="Model Z"/>)");
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
 }
 
 // Through the receiver loop: tally, shot events and PTZ commands reach the
@@ -249,15 +249,15 @@ class MetadataLoopTest : public MetadataTest {
 TEST_F(MetadataLoopTest, TallyChangesBetweenTwoPassesAreSentAsOne) {
   StartReceiving();
   ndi.BlockCapture(true);
-  const int captures = ndi.Captures();
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Captures() > captures; }));
-  const std::size_t before = ndi.Tallies().size();
+  const int captures = ndi.Seen().captures;
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures; }));
+  const std::size_t before = ndi.Seen().tallies.size();
   source->HandleShotEvent("TALLY_LIVE_ON");
   source->HandleShotEvent("TALLY_PREVIEW_ON");
   ndi.BlockCapture(false);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Tallies().size() > before; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Captures() > captures + 2; }));
-  const auto tallies = ndi.Tallies();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().tallies.size() > before; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures + 2; }));
+  const auto tallies = ndi.Seen().tallies;
   ASSERT_EQ(tallies.size(), before + 1);
   EXPECT_TRUE(tallies.back().on_program);
   EXPECT_TRUE(tallies.back().on_preview);
@@ -273,40 +273,40 @@ TEST_F(MetadataLoopTest, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
   // The loop may take the events in more than one batch; each batch goes
   // out after a delivered frame.
   for (int i = 0; i < 3; ++i) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.MetadataSent().size() >= 5; }));
-  const auto sent = ndi.MetadataSent();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().metadataSent.size() >= 5; }));
+  const auto sent = ndi.Seen().metadataSent;
   ASSERT_EQ(sent.size(), 5u);
   EXPECT_EQ(sent[2], "<skyrelay_ext>\n    <event value=\" TALLY_LIVE_ON\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[3], "<skyrelay_ext>\n    <event value=\"TALLY_LIVE_ON \" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[4], "<skyrelay_ext>\n    <event value=\"Cut\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Tallies().empty() && ndi.Tallies().back().on_preview; }));
-  EXPECT_FALSE(ndi.Tallies().back().on_program);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; }));
+  EXPECT_FALSE(ndi.Seen().tallies.back().on_program);
 }
 
 TEST_F(MetadataLoopTest, QueuedEventsBeforeStartAreDropped) {
   source->HandleShotEvent("Cut");
   StartReceiving();
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.CapturesQueued() == 0 && ndi.Captures() > 3; }));
-  EXPECT_EQ(ndi.MetadataSent().size(), 2u);  // only the receiver's own documents
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().queued == 0 && ndi.Seen().captures > 3; }));
+  EXPECT_EQ(ndi.Seen().metadataSent.size(), 2u);  // only the receiver's own documents
 }
 
 TEST_F(MetadataLoopTest, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.1}});
   StartReceiving();
   ndi.SetConnections(0);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->States() == std::vector<std::int32_t>{1, 2, 3}; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Seen().states == std::vector<std::int32_t>{1, 2, 3}; }));
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.5}});
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
-  EXPECT_TRUE(ndi.PtzCalls().empty());
+  EXPECT_TRUE(ndi.Seen().ptzCalls.empty());
   ndi.SetConnections(1);
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
   env.clock->AdvanceMs(5000);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.PtzCalls().empty(); }));
-  EXPECT_EQ(ndi.PtzCalls(), std::vector<std::string>{"zoom(0.5)"});
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().ptzCalls.empty(); }));
+  EXPECT_EQ(ndi.Seen().ptzCalls, std::vector<std::string>{"zoom(0.5)"});
   source->Stop();
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.9}});
-  EXPECT_EQ(ndi.PtzCalls().size(), 1u);
+  EXPECT_EQ(ndi.Seen().ptzCalls.size(), 1u);
 }
 
 TEST_F(MetadataLoopTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
@@ -316,11 +316,11 @@ TEST_F(MetadataLoopTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
   ndi.Push(nditest::TypeOnly(kNdiFrameError));
   StartReceiving();  // the metadata frame counts as delivered
   ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Count("ptz NDI3/Cam") == 1; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.CapturesQueued() == 0; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().queued == 0; }));
   source->Stop();
-  EXPECT_EQ(ndi.MetadataFrees(), 1);
-  EXPECT_EQ(ndi.VideoFrees(), 1);
-  EXPECT_TRUE(ndi.FreesMatched());
+  EXPECT_EQ(ndi.Seen().frees[2], 1);
+  EXPECT_EQ(ndi.Seen().frees[0], 1);
+  EXPECT_TRUE(ndi.Seen().freesMatched);
 }
 
 }  // namespace

@@ -189,28 +189,19 @@ std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
 
 void ScriptedNdi::SetSources(std::vector<Entry> entries) { LOCKED; entries_ = std::move(entries); }
 void ScriptedNdi::FailFinderCreate(bool fail) { LOCKED; failFinder_ = fail; }
-int ScriptedNdi::FindersCreated() { LOCKED; return findersCreated_; }
-int ScriptedNdi::FindersDestroyed() { LOCKED; return findersDestroyed_; }
-int ScriptedNdi::MaxLiveFinders() { LOCKED; return maxLiveFinders_; }
-int ScriptedNdi::ListCalls() { LOCKED; return listCalls_; }
 void ScriptedNdi::FailReceiverCreate(bool fail) { LOCKED; failReceiver_ = fail; }
-std::vector<ReceiverCreated> ScriptedNdi::ReceiversCreated() { LOCKED; return receivers_; }
-int ScriptedNdi::ReceiversDestroyed() { LOCKED; return receiversDestroyed_; }
 void ScriptedNdi::SetConnections(int count) { LOCKED; connections_ = count; }
-int ScriptedNdi::ConnectionQueries() { LOCKED; return connectionQueries_; }
 void ScriptedNdi::SetTallyResult(bool ok) { LOCKED; tallyOk_ = ok; }
-std::vector<ndi_tally> ScriptedNdi::Tallies() { LOCKED; return tallies_; }
 void ScriptedNdi::SetMetadataResult(bool ok) { LOCKED; metadataOk_ = ok; }
-std::vector<std::string> ScriptedNdi::MetadataSent() { LOCKED; return metadataSent_; }
-std::vector<int> ScriptedNdi::MetadataLengths() { LOCKED; return metadataLengths_; }
 void ScriptedNdi::SetPtzSupported(bool supported) { LOCKED; ptzSupported_ = supported; }
-std::vector<std::string> ScriptedNdi::PtzCalls() { LOCKED; return ptzCalls_; }
-int ScriptedNdi::Captures() { LOCKED; return captures_; }
-int ScriptedNdi::CapturesQueued() { LOCKED; return static_cast<int>(queue_.size()); }
-int ScriptedNdi::VideoFrees() { LOCKED; return frees_[0]; }
-int ScriptedNdi::AudioFrees() { LOCKED; return frees_[1]; }
-int ScriptedNdi::MetadataFrees() { LOCKED; return frees_[2]; }
-bool ScriptedNdi::FreesMatched() { LOCKED; return freesMatched_ && handedOut_.empty(); }
+
+Observed ScriptedNdi::Seen() {
+  LOCKED;
+  Observed seen = seen_;
+  seen.queued = static_cast<int>(queue_.size());
+  seen.freesMatched = seen_.freesMatched && handedOut_.empty();
+  return seen;
+}
 
 void ScriptedNdi::Push(std::shared_ptr<nditest::Capture> capture) {
   LOCKED;
@@ -227,16 +218,16 @@ void ScriptedNdi::BlockCapture(bool block) {
 void* ScriptedNdi::FindCreate(const ndi_find_create* settings) {
   LOCKED;
   if (failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
-  ++findersCreated_;
-  maxLiveFinders_ = std::max(maxLiveFinders_, findersCreated_ - findersDestroyed_);
+  ++seen_.findersCreated;
+  seen_.maxLiveFinders = std::max(seen_.maxLiveFinders, seen_.findersCreated - seen_.findersDestroyed);
   return &handleSpace_[++handles_ % 64];
 }
 
-void ScriptedNdi::FindDestroy(void*) { LOCKED; ++findersDestroyed_; }
+void ScriptedNdi::FindDestroy(void*) { LOCKED; ++seen_.findersDestroyed; }
 
 const ndi_source* ScriptedNdi::FindList(void*, std::uint32_t* count) {
   LOCKED;
-  ++listCalls_;
+  ++seen_.listCalls;
   list_.clear();
   for (const Entry& entry : entries_) {
     list_.push_back(ndi_source{entry.name ? entry.name->c_str() : nullptr, entry.url ? entry.url->c_str() : nullptr});
@@ -254,22 +245,22 @@ void* ScriptedNdi::RecvCreate(const ndi_recv_create* settings) {
   created.colorFormat = settings->color_format;
   created.bandwidth = settings->bandwidth;
   created.allowFields = settings->allow_video_fields;
-  receivers_.push_back(created);
+  seen_.receivers.push_back(created);
   return &handleSpace_[++handles_ % 64];
 }
 
-void ScriptedNdi::RecvDestroy(void*) { LOCKED; ++receiversDestroyed_; }
+void ScriptedNdi::RecvDestroy(void*) { LOCKED; ++seen_.receiversDestroyed; }
 
 int ScriptedNdi::Connections(void*) {
   LOCKED;
-  ++connectionQueries_;
+  ++seen_.connectionQueries;
   return connections_;
 }
 
 std::int32_t ScriptedNdi::Capture(void*, ndi_video_frame_v2* video, ndi_audio_frame_v2* audio,
                                   ndi_metadata_frame* metadata, std::uint32_t) {
   std::unique_lock<std::mutex> lock(mutex_);
-  ++captures_;
+  ++seen_.captures;
   changed_.notify_all();
   changed_.wait(lock, [this] { return !block_; });
   if (queue_.empty()) changed_.wait_for(lock, std::chrono::milliseconds(1), [this] { return !queue_.empty(); });
@@ -297,21 +288,21 @@ std::int32_t ScriptedNdi::Capture(void*, ndi_video_frame_v2* video, ndi_audio_fr
 
 void ScriptedNdi::Free(int kind, const void* data) {
   LOCKED;
-  ++frees_[kind];
-  if (handedOut_.erase(data) != 1) freesMatched_ = false;
+  ++seen_.frees[kind];
+  if (handedOut_.erase(data) != 1) seen_.freesMatched = false;
 }
 
 bool ScriptedNdi::SetTally(const ndi_tally* tally) {
   LOCKED;
-  tallies_.push_back(*tally);
+  seen_.tallies.push_back(*tally);
   return tallyOk_;
 }
 
 bool ScriptedNdi::SendMetadata(const ndi_metadata_frame* frame) {
   LOCKED;
-  metadataLengths_.push_back(frame->length);
+  seen_.metadataLengths.push_back(frame->length);
   if (!metadataOk_) return false;
-  metadataSent_.emplace_back(frame->data, frame->length > 0 ? static_cast<std::size_t>(frame->length) - 1 : 0);
+  seen_.metadataSent.emplace_back(frame->data, frame->length > 0 ? static_cast<std::size_t>(frame->length) - 1 : 0);
   return true;
 }
 
@@ -319,7 +310,7 @@ bool ScriptedNdi::PtzSupported() { LOCKED; return ptzSupported_; }
 
 bool ScriptedNdi::Ptz(const std::string& call) {
   LOCKED;
-  ptzCalls_.push_back(call);
+  seen_.ptzCalls.push_back(call);
   return true;
 }
 
