@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <functional>
 #include <limits>
 
 #include "fakes.h"
@@ -97,43 +98,29 @@ TEST_F(IntakeTest, Nv12CopiesLumaAndChromaWithTheFrameStride) {
 }
 
 TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
+  // A good 16x4 UYVY frame at stride 32, spoilt one way.
+  const auto spoilt = [](const std::function<void(ndi_video_frame_v2&)>& spoil) {
+    auto capture = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+    spoil(capture->video);
+    return capture;
+  };
   struct Case {
     std::shared_ptr<nditest::Capture> frame;
     const char* line;
   };
-  auto nullData = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  nullData->video.data = nullptr;
-  auto zeroStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  zeroStride->video.line_stride_in_bytes = 0;
-  auto negativeStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  negativeStride->video.line_stride_in_bytes = -32;
-  auto shortStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 31);     // a row is 32 bytes
-  auto shortNv12 = VideoCapture(kNdiFourCCNV12, 16, 4, 15);       // a row is 16 bytes
-  auto shortBgra = VideoCapture(kNdiFourCCBGRA, 16, 4, 63);       // a row is 64 bytes
-  auto zeroWidth = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  zeroWidth->video.xres = 0;
-  auto negativeHeight = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  negativeHeight->video.yres = -4;
-  auto wide = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  wide->video.xres = 32768;
-  auto tall = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  tall->video.yres = 40000;
-  auto i420 = VideoCapture(kNdiFourCCI420, 16, 4, 16);
-  auto unknown = VideoCapture(0x12345678, 16, 4, 32);
-
   const Case cases[] = {
-      {nullData, "#ndisource: null data in NDI video frame\n"},
-      {zeroStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {negativeStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortNv12, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortBgra, "#ndisource: invalid stride in NDI video frame\n"},
-      {zeroWidth, "#ndisource: invalid resolution in NDI video frame\n"},
-      {negativeHeight, "#ndisource: invalid resolution in NDI video frame\n"},
-      {wide, "#ndisource: NDI video frame too large (32768x4)\n"},
-      {tall, "#ndisource: NDI video frame too large (16x40000)\n"},
-      {i420, "#ndisource: unexpected raster format\n"},
-      {unknown, "#ndisource: unexpected raster format\n"},
+      {spoilt([](auto& v) { v.data = nullptr; }), "#ndisource: null data in NDI video frame\n"},
+      {spoilt([](auto& v) { v.line_stride_in_bytes = 0; }), "#ndisource: invalid stride in NDI video frame\n"},
+      {spoilt([](auto& v) { v.line_stride_in_bytes = -32; }), "#ndisource: invalid stride in NDI video frame\n"},
+      {VideoCapture(kNdiFourCCUYVY, 16, 4, 31), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 32
+      {VideoCapture(kNdiFourCCNV12, 16, 4, 15), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 16
+      {VideoCapture(kNdiFourCCBGRA, 16, 4, 63), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 64
+      {spoilt([](auto& v) { v.xres = 0; }), "#ndisource: invalid resolution in NDI video frame\n"},
+      {spoilt([](auto& v) { v.yres = -4; }), "#ndisource: invalid resolution in NDI video frame\n"},
+      {spoilt([](auto& v) { v.xres = 32768; }), "#ndisource: NDI video frame too large (32768x4)\n"},
+      {spoilt([](auto& v) { v.yres = 40000; }), "#ndisource: NDI video frame too large (16x40000)\n"},
+      {VideoCapture(kNdiFourCCI420, 16, 4, 16), "#ndisource: unexpected raster format\n"},
+      {VideoCapture(0x12345678, 16, 4, 32), "#ndisource: unexpected raster format\n"},
   };
   for (const Case& c : cases) {
     logs.Clear();

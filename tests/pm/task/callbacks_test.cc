@@ -1,16 +1,10 @@
 // The host's side of a source and of discovery: every notification's exact
 // JSON, the buffer queue's announcement, buffer requests and their limits,
-// holds of sent and unsent buffers, and a host process reading the frames.
+// holds of sent and unsent buffers.
 #include <gtest/gtest.h>
-
-#include <sys/mman.h>
-#include <sys/wait.h>
-#include <fcntl.h>
-#include <unistd.h>
 
 #include <cstring>
 
-#include "pm/shm/shared_memory.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "pm/task/callbacks.h"
 #include "support/host_link.h"
@@ -47,11 +41,8 @@ struct Fixture {
   std::unique_ptr<pmtest::QueueReader> OpenQueue() {
     callbacks->OpenBufferQueue(link.Dispatcher(), "NDICaptureDevice~HOST (Cam 1)");
     json start = Next("NDICaptureDevice~HOST (Cam 1)::start_queue");
-    auto reader = std::make_unique<pmtest::QueueReader>(start["port"].get<int>());
-    memoryBase = start["memoryBase"].get<std::string>();
-    return reader;
+    return std::make_unique<pmtest::QueueReader>(start["port"].get<int>());
   }
-  std::string memoryBase;
 };
 
 // A source's callbacks with the buffer queue open and a host reader on it.
@@ -124,11 +115,6 @@ TEST(DiscoveryNotifications, AnnounceAndWithdrawSources) {
   auto gone = link.ReadCommand("pm::tsrc::source_unavailable");
   ASSERT_TRUE(gone);
   EXPECT_EQ(Payload(*gone), json({{"unique_id", "NDICaptureDevice~A (b)"}}));
-}
-
-TEST_F(QueueTest, BufferQueue_IsAnnouncedWithAPortAndAShortIdMemoryBase) {
-  EXPECT_TRUE(reader->Connected());
-  EXPECT_EQ(memoryBase.size(), 22u);
 }
 
 TEST_F(QueueTest, AudioRequests_AreSizedFromChannelsSampleCodeAndCount) {
@@ -239,40 +225,6 @@ TEST_F(QueueTest, AudioSends_FeedTheMediaClock) {
     callbacks->SendAudioBuffer(callbacks->AudioTime(48000), buffer);
   }
   EXPECT_EQ(callbacks->AudioTime(48000), 705600000);
-}
-
-TEST_F(QueueTest, HostProcess_MapsTheSegmentByNameAndReadsTheFrame) {
-  auto buffer = callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 4);
-  ASSERT_TRUE(buffer);
-  buffer->Fill([](void* data, std::int64_t bytes) {
-    auto* samples = static_cast<float*>(data);
-    for (std::int64_t i = 0; i < bytes / 4; ++i) samples[i] = 0.5f + static_cast<float>(i);
-  });
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Producer()->HostConnected(); }));
-  callbacks->SendAudioBuffer(0, buffer);
-  std::uint32_t token = 0;
-  std::uint8_t record[60];
-  ASSERT_TRUE(reader->ReadRecord(&token, record));
-  const std::string name = "/" + memoryBase + std::to_string(token);
-
-  const pid_t child = ::fork();
-  if (child == 0) {
-    // The host: open the segment by name, check the 8 samples.
-    const int fd = ::shm_open(name.c_str(), O_RDWR, 0);
-    if (fd < 0) ::_exit(2);
-    void* map = ::mmap(nullptr, 4096, PROT_READ, MAP_SHARED, fd, 0);
-    if (map == MAP_FAILED) ::_exit(3);
-    const auto* samples = static_cast<const float*>(map);
-    for (int i = 0; i < 8; ++i) {
-      if (samples[i] != 0.5f + static_cast<float>(i)) ::_exit(4);
-    }
-    ::_exit(0);
-  }
-  int status = 0;
-  ASSERT_EQ(::waitpid(child, &status, 0), child);
-  EXPECT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 0);
-  reader->ReturnToken(token);
 }
 
 }  // namespace

@@ -85,74 +85,57 @@ Bytes SourcePicture(const pm::VideoFormat& format, std::int32_t stride) {
 
 // ---------------------------------------------------------------- CopyFrame
 
-TEST(VideoBufferCopyFrame, DifferentStridesCopyEveryNV12RowButNotThePadding) {
-  const pm::VideoFormat f = Format(pm::kCodeNV12, 1920, 1080);
-  const Bytes source = SourcePicture(f, 2048);
-  MemoryVideoBuffer buffer(f, 1936);
-  buffer.CopyFrame(source.data.get(), 2048);
-  EXPECT_EQ(buffer.maps, 1);
-  EXPECT_EQ(buffer.unmaps, 1);
-  // 1080 luma rows and 540 chroma rows of 1920 bytes; the 16 padding bytes of
-  // each destination row are left alone.
-  for (int plane = 0; plane < 2; ++plane) {
-    const int rows = plane == 0 ? 1080 : 540;
-    for (int r = 0; r < rows; ++r) {
-      const std::uint8_t* row = buffer.Row(plane, r);
-      for (int c = 0; c < 1920; ++c) ASSERT_EQ(row[c], Pattern(plane, r, c)) << plane << " " << r << " " << c;
-      for (int c = 1920; c < 1936; ++c) ASSERT_EQ(row[c], kUntouched) << plane << " " << r;
+// Every row of every plane is copied for its row bytes and the destination's
+// padding is left alone; with equal strides a plane goes as one block, padding
+// and all; a source stride of 0 means the default stride.
+TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
+  struct Case {
+    std::uint32_t code;
+    int width, height, sourceStride, stride, rowBytes, copiedBytes;
+  } cases[] = {
+      {pm::kCodeNV12, 1920, 1080, 2048, 1936, 1920, 1920},
+      {pm::kCode2vuy, 5, 7, 16, 16, 10, 16},
+      {pm::kCodeRgba, 3, 4, 0, 16, 12, 12},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.code);
+    const pm::VideoFormat f = Format(c.code, c.width, c.height);
+    const Bytes source = SourcePicture(f, c.sourceStride == 0 ? c.rowBytes : c.sourceStride);
+    MemoryVideoBuffer buffer(f, c.stride);
+    buffer.CopyFrame(source.data.get(), c.sourceStride);
+    EXPECT_EQ(buffer.maps, 1);
+    EXPECT_EQ(buffer.unmaps, 1);
+    const pm::VideoPlanes planes = pm::LayoutPlanes(f, source.data.get(), c.stride);
+    for (int plane = 0; plane < planes.planeCount; ++plane) {
+      for (int r = 0; r < planes.plane[plane].rows; ++r) {
+        const std::uint8_t* row = buffer.Row(plane, r);
+        for (int k = 0; k < c.stride; ++k) {
+          ASSERT_EQ(row[k], k < c.copiedBytes ? Pattern(plane, r, k) : kUntouched) << plane << " " << r << " " << k;
+        }
+      }
     }
-  }
-}
-
-TEST(VideoBufferCopyFrame, EqualStridesCopyTheWholePlaneAsOneBlock) {
-  // 2vuy 5 pixels: rows of 10 bytes in a stride of 16. With equal strides the
-  // padding comes along, which a row-by-row copy would leave untouched.
-  const pm::VideoFormat f = Format(pm::kCode2vuy, 5, 7);
-  const Bytes source = SourcePicture(f, 16);
-  MemoryVideoBuffer buffer(f, 16);
-  buffer.CopyFrame(source.data.get(), 16);
-  for (int r = 0; r < 7; ++r)
-    for (int c = 0; c < 16; ++c) ASSERT_EQ(buffer.Row(0, r)[c], Pattern(0, r, c));
-}
-
-TEST(VideoBufferCopyFrame, SourceStrideZeroMeansTheDefaultStride) {
-  const pm::VideoFormat f = Format(pm::kCodeRgba, 3, 4);
-  const Bytes source = SourcePicture(f, 12);
-  MemoryVideoBuffer buffer(f, 16);
-  buffer.CopyFrame(source.data.get(), 0);
-  for (int r = 0; r < 4; ++r) {
-    for (int c = 0; c < 12; ++c) ASSERT_EQ(buffer.Row(0, r)[c], Pattern(0, r, c));
-    for (int c = 12; c < 16; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
   }
 }
 
 TEST(VideoBufferCopyFrame, UnusableSourcesWriteNothingAndStillUnmap) {
   const pm::VideoFormat f = Format(pm::kCode2vuy, 8, 4);
-  {  // a stride smaller than a row would read past the source
-    const Bytes source(8 * 4);
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.CopyFrame(source.data.get(), 8);
+  struct Case {
+    const char* what;
+    int sourceStride, stride;
+    bool noSource, mapless;
+  } cases[] = {
+      {"a source stride smaller than a row would read past the source", 8, 16, false, false},
+      {"no source at all", 16, 16, true, false},
+      {"a destination stride smaller than a row would write past the segment", 32, 8, false, false},
+      {"a buffer that cannot be mapped", 16, 16, false, true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.what);
+    const Bytes source = SourcePicture(f, c.sourceStride);
+    MemoryVideoBuffer buffer(f, c.stride);
+    buffer.mapless = c.mapless;
+    buffer.CopyFrame(c.noSource ? nullptr : source.data.get(), c.sourceStride);
     EXPECT_TRUE(buffer.AllUntouched());
-    EXPECT_EQ(buffer.unmaps, buffer.maps);
-  }
-  {  // no source at all
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.CopyFrame(nullptr, 16);
-    EXPECT_TRUE(buffer.AllUntouched());
-    EXPECT_EQ(buffer.maps, 1);
-    EXPECT_EQ(buffer.unmaps, 1);
-  }
-  {  // a destination stride smaller than a row would write past the segment
-    const Bytes source = SourcePicture(f, 32);
-    MemoryVideoBuffer buffer(f, 8);
-    buffer.CopyFrame(source.data.get(), 32);
-    EXPECT_TRUE(buffer.AllUntouched());
-  }
-  {  // a buffer that cannot be mapped
-    const Bytes source = SourcePicture(f, 16);
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.mapless = true;
-    buffer.CopyFrame(source.data.get(), 16);
     EXPECT_EQ(buffer.maps, 1);
     EXPECT_EQ(buffer.unmaps, 1);
   }
