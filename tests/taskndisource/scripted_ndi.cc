@@ -19,53 +19,22 @@ ScriptedNdi& Current() {
   return *current;
 }
 
-std::string Number(float value) {
+std::string Text(float value) {
   char text[32];
   std::snprintf(text, sizeof text, "%g", static_cast<double>(value));
   return text;
 }
+std::string Text(int value) { return std::to_string(value); }
 
-bool IsSupportedCpu() { return true; }
-bool Initialize() { return true; }
-const char* Version() { return "scripted"; }
-void Destroy() {}
-void* FindCreate(const ndi_find_create* s) { return Current().FindCreate(s); }
-void FindDestroy(void* f) { Current().FindDestroy(f); }
-const ndi_source* FindList(void* f, std::uint32_t* count) { return Current().FindList(f, count); }
-void* RecvCreate(const ndi_recv_create* s) { return Current().RecvCreate(s); }
-void RecvDestroy(void* r) { Current().RecvDestroy(r); }
-int Connections(void* r) { return Current().Connections(r); }
-std::int32_t CaptureFn(void* r, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
-                       std::uint32_t timeoutMs) {
-  return Current().Capture(r, v, a, m, timeoutMs);
+// Records "name(a,b)" as a PTZ call.
+template <typename... Args>
+bool PtzCall(const char* name, Args... args) {
+  std::string call = std::string(name) + "(";
+  [[maybe_unused]] const char* separator = "";
+  ((call += separator + Text(args), separator = ","), ...);
+  return Current().Ptz(call + ")");
 }
-void FreeVideo(void*, const ndi_video_frame_v2* v) { Current().Free(0, v->data); }
-void FreeAudio(void*, const ndi_audio_frame_v2* a) { Current().Free(1, a->data); }
-void FreeMetadata(void*, const ndi_metadata_frame* m) { Current().Free(2, m->data); }
-bool SetTally(void*, const ndi_tally* t) { return Current().SetTally(t); }
-bool SendMetadata(void*, const ndi_metadata_frame* m) { return Current().SendMetadata(m); }
-bool PtzSupported(void*) { return Current().PtzSupported(); }
-bool RecallPreset(void*, int preset, float speed) {
-  return Current().Ptz("recall_preset(" + std::to_string(preset) + "," + Number(speed) + ")");
-}
-bool StorePreset(void*, int preset) { return Current().Ptz("store_preset(" + std::to_string(preset) + ")"); }
-bool PanTilt(void*, float p, float t) { return Current().Ptz("pan_tilt(" + Number(p) + "," + Number(t) + ")"); }
-bool PanTiltSpeed(void*, float p, float t) {
-  return Current().Ptz("pan_tilt_speed(" + Number(p) + "," + Number(t) + ")");
-}
-bool Zoom(void*, float z) { return Current().Ptz("zoom(" + Number(z) + ")"); }
-bool Focus(void*, float f) { return Current().Ptz("focus(" + Number(f) + ")"); }
-bool FocusSpeed(void*, float f) { return Current().Ptz("focus_speed(" + Number(f) + ")"); }
-bool AutoFocus(void*) { return Current().Ptz("auto_focus()"); }
-bool ExposureAuto(void*) { return Current().Ptz("exposure_auto()"); }
-bool ExposureManual(void*, float l) { return Current().Ptz("exposure_manual(" + Number(l) + ")"); }
-bool WbAuto(void*) { return Current().Ptz("white_balance_auto()"); }
-bool WbIndoor(void*) { return Current().Ptz("white_balance_indoor()"); }
-bool WbOutdoor(void*) { return Current().Ptz("white_balance_outdoor()"); }
-bool WbOneshot(void*) { return Current().Ptz("white_balance_oneshot()"); }
-bool WbManual(void*, float r, float b) {
-  return Current().Ptz("white_balance_manual(" + Number(r) + "," + Number(b) + ")");
-}
+
 void Interleave(const ndi_audio_frame_v2* src, ndi_audio_frame_interleaved_32f* dst) {
   for (int s = 0; s < src->no_samples; ++s) {
     for (int c = 0; c < src->no_channels; ++c) {
@@ -149,38 +118,39 @@ ScriptedNdi::~ScriptedNdi() { g_current.store(nullptr); }
 
 std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   auto api = std::make_shared<TaskNDISource::NdiApi>();
-  api->is_supported_CPU = IsSupportedCpu;
-  api->initialize = Initialize;
-  api->version = Version;
-  api->destroy = Destroy;
-  api->find_create_v2 = nditest::FindCreate;
-  api->find_get_current_sources = nditest::FindList;
-  api->find_destroy = nditest::FindDestroy;
-  api->recv_create_v2 = nditest::RecvCreate;
-  api->recv_destroy = nditest::RecvDestroy;
-  api->recv_get_no_connections = nditest::Connections;
-  api->recv_capture_v2 = CaptureFn;
-  api->recv_free_video_v2 = FreeVideo;
-  api->recv_free_audio_v2 = FreeAudio;
-  api->recv_free_metadata = FreeMetadata;
-  api->recv_set_tally = nditest::SetTally;
-  api->recv_send_metadata = nditest::SendMetadata;
-  api->recv_ptz_is_supported = nditest::PtzSupported;
-  api->recv_ptz_recall_preset = RecallPreset;
-  api->recv_ptz_store_preset = StorePreset;
-  api->recv_ptz_pan_tilt = PanTilt;
-  api->recv_ptz_pan_tilt_speed = PanTiltSpeed;
-  api->recv_ptz_zoom = Zoom;
-  api->recv_ptz_focus = Focus;
-  api->recv_ptz_focus_speed = FocusSpeed;
-  api->recv_ptz_auto_focus = AutoFocus;
-  api->recv_ptz_exposure_auto = ExposureAuto;
-  api->recv_ptz_exposure_manual = ExposureManual;
-  api->recv_ptz_white_balance_auto = WbAuto;
-  api->recv_ptz_white_balance_indoor = WbIndoor;
-  api->recv_ptz_white_balance_outdoor = WbOutdoor;
-  api->recv_ptz_white_balance_oneshot = WbOneshot;
-  api->recv_ptz_white_balance_manual = WbManual;
+  api->is_supported_CPU = [] { return true; };
+  api->initialize = [] { return true; };
+  api->version = [] { return "scripted"; };
+  api->destroy = [] {};
+  api->find_create_v2 = [](const ndi_find_create* s) { return Current().FindCreate(s); };
+  api->find_get_current_sources = [](void* f, std::uint32_t* count) { return Current().FindList(f, count); };
+  api->find_destroy = [](void* f) { Current().FindDestroy(f); };
+  api->recv_create_v2 = [](const ndi_recv_create* s) { return Current().RecvCreate(s); };
+  api->recv_destroy = [](void* r) { Current().RecvDestroy(r); };
+  api->recv_get_no_connections = [](void* r) { return Current().Connections(r); };
+  api->recv_capture_v2 = [](void* r, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
+                            std::uint32_t timeoutMs) { return Current().Capture(r, v, a, m, timeoutMs); };
+  api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Current().Free(0, v->data); };
+  api->recv_free_audio_v2 = [](void*, const ndi_audio_frame_v2* a) { Current().Free(1, a->data); };
+  api->recv_free_metadata = [](void*, const ndi_metadata_frame* m) { Current().Free(2, m->data); };
+  api->recv_set_tally = [](void*, const ndi_tally* t) { return Current().SetTally(t); };
+  api->recv_send_metadata = [](void*, const ndi_metadata_frame* m) { return Current().SendMetadata(m); };
+  api->recv_ptz_is_supported = [](void*) { return Current().PtzSupported(); };
+  api->recv_ptz_recall_preset = [](void*, int preset, float speed) { return PtzCall("recall_preset", preset, speed); };
+  api->recv_ptz_store_preset = [](void*, int preset) { return PtzCall("store_preset", preset); };
+  api->recv_ptz_pan_tilt = [](void*, float p, float t) { return PtzCall("pan_tilt", p, t); };
+  api->recv_ptz_pan_tilt_speed = [](void*, float p, float t) { return PtzCall("pan_tilt_speed", p, t); };
+  api->recv_ptz_zoom = [](void*, float z) { return PtzCall("zoom", z); };
+  api->recv_ptz_focus = [](void*, float f) { return PtzCall("focus", f); };
+  api->recv_ptz_focus_speed = [](void*, float f) { return PtzCall("focus_speed", f); };
+  api->recv_ptz_auto_focus = [](void*) { return PtzCall("auto_focus"); };
+  api->recv_ptz_exposure_auto = [](void*) { return PtzCall("exposure_auto"); };
+  api->recv_ptz_exposure_manual = [](void*, float l) { return PtzCall("exposure_manual", l); };
+  api->recv_ptz_white_balance_auto = [](void*) { return PtzCall("white_balance_auto"); };
+  api->recv_ptz_white_balance_indoor = [](void*) { return PtzCall("white_balance_indoor"); };
+  api->recv_ptz_white_balance_outdoor = [](void*) { return PtzCall("white_balance_outdoor"); };
+  api->recv_ptz_white_balance_oneshot = [](void*) { return PtzCall("white_balance_oneshot"); };
+  api->recv_ptz_white_balance_manual = [](void*, float r, float b) { return PtzCall("white_balance_manual", r, b); };
   api->util_audio_to_interleaved_32f_v2 = Interleave;
   return api;
 }

@@ -69,24 +69,20 @@ class ScriptedSource : public pm::Source {
     if (script_.throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
   }
   const std::string& Tag() const { return tag_; }
-  std::string ValidateGui(std::string text) override {
-    journal_->Add("validate " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
-  std::string GuiToConfiguration(std::string text) override {
-    journal_->Add("to_config " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
-  std::string ConfigurationToGui(std::string text) override {
-    journal_->Add("to_gui " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
+  std::string ValidateGui(std::string text) override { return Answer("validate ", text); }
+  std::string GuiToConfiguration(std::string text) override { return Answer("to_config ", text); }
+  std::string ConfigurationToGui(std::string text) override { return Answer("to_gui ", text); }
   void ExecuteCustomActionCommand(std::string command) override { journal_->Add("action " + tag_ + " " + command); }
   void ExecutePtzCommand(const Json& request) override { journal_->Add("ptz " + tag_ + " " + request.value("zoom", "")); }
   void HandleShotEvent(std::string event) override { journal_->Add("shot " + tag_ + " " + event); }
   void SourceHotplugEvent() override { journal_->Add("hotplug " + tag_); }
 
  private:
+  std::string Answer(const char* call, const std::string& text) {
+    journal_->Add(call + tag_ + " " + text);
+    return script_.guiAnswer;
+  }
+
   std::string tag_;
   Journal* journal_;
   Script script_;
@@ -221,20 +217,16 @@ void ExpectOnlySurvivorRunning(const Lines& lines, const std::string& prefix, co
 }
 
 TEST_F(TaskSourceTest, EmptyConfigurationsGiveEmptyTextAndOthersStayExact) {
-  const Json cases[] = {Json::object(), Json::array(), Json(), Json::parse(R"({"a":1})"), Json::parse(R"([1,"x"])"),
-                        Json("text"), Json(0), Json(false)};
+  const std::pair<Json, const char*> cases[] = {
+      {Json::object(), ""}, {Json::array(), ""}, {Json(), ""}, {Json::parse(R"({"a":1})"), R"({"a":1})"},
+      {Json::parse(R"([1,"x"])"), R"([1,"x"])"}, {Json("text"), R"("text")"}, {Json(0), "0"}, {Json(false), "false"}};
   StartSource("absent");
-  for (std::size_t i = 0; i < std::size(cases); ++i) StartSource("s" + std::to_string(i), &cases[i]);
-  const Lines lines = journal_.Lines();
-  EXPECT_EQ(lines[0], "config absent#1 ");
-  EXPECT_EQ(lines[2], "config s0#2 ");
-  EXPECT_EQ(lines[4], "config s1#3 ");
-  EXPECT_EQ(lines[6], "config s2#4 ");
-  EXPECT_EQ(lines[8], R"(config s3#5 {"a":1})");
-  EXPECT_EQ(lines[10], R"(config s4#6 [1,"x"])");
-  EXPECT_EQ(lines[12], R"(config s5#7 "text")");
-  EXPECT_EQ(lines[14], "config s6#8 0");
-  EXPECT_EQ(lines[16], "config s7#9 false");
+  EXPECT_EQ(journal_.Lines()[0], "config absent#1 ");
+  for (std::size_t i = 0; i < std::size(cases); ++i) {
+    const std::string id = "s" + std::to_string(i);
+    StartSource(id, &cases[i].first);
+    EXPECT_EQ(journal_.Lines()[2 * i + 2], "config " + id + "#" + std::to_string(i + 2) + " " + cases[i].second);
+  }
   EXPECT_EQ(task_->SourceCount(), 9u);
 }
 
