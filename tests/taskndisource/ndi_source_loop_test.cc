@@ -34,6 +34,11 @@ class LoopTest : public ::testing::Test {
   void Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5), std::function<void()> onExit = nullptr) {
     source = std::make_shared<NDISource>(callbacks, kId, ndi.Api(), env.Make(stopTimeout, std::move(onExit)));
   }
+  // Makes the source and starts its loop.
+  void Run() {
+    Make();
+    source->Start();
+  }
 
   // Waits (real time) until `done` holds.
   static void Until(const std::function<bool()>& done) { ASSERT_TRUE(pmtest::WaitFor(done)); }
@@ -54,8 +59,7 @@ class LoopTest : public ::testing::Test {
 };
 
 TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
-  Make();
-  source->Start();
+  Run();
   for (int attempt = 1; attempt <= 130; ++attempt) {
     ASSERT_EQ(env.clock->AwaitWait(attempt), 250) << attempt;
     ASSERT_EQ(logs.Count("#ndisource: waiting for source to be found\n"), attempt);
@@ -74,8 +78,7 @@ TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
 
 TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
   ndi.SetSources({Entry{kName, ""}});
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
   EXPECT_TRUE(logs.Contains("#ndisource: source has no url\n"));
   EXPECT_EQ(source->State(), ReceiverState::Error);
@@ -97,8 +100,7 @@ TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
 TEST_F(LoopTest, FirstOfTwoSendersWithOneNameIsUsed) {
   ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{std::nullopt, "10.0.0.2:1"}, Entry{kName, kUrl},
                   Entry{kName, "10.0.0.3:1"}});
-  Make();
-  source->Start();
+  Run();
   Until([&] { return !ndi.Seen().receivers.empty(); });
   const auto created = ndi.Seen().receivers.at(0);
   EXPECT_EQ(created.name, kName);
@@ -110,8 +112,7 @@ TEST_F(LoopTest, FirstOfTwoSendersWithOneNameIsUsed) {
 
 TEST_F(LoopTest, FailingFinderOrReceiverGoesToError) {
   ndi.FailFinderCreate(true);
-  Make();
-  source->Start();
+  Run();
   UntilState(ReceiverState::Error);
   EXPECT_TRUE(logs.Contains("#ndisource: failed to create NDI finder\n"));
   source->Stop();
@@ -155,8 +156,7 @@ TEST_F(LoopTest, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) 
 TEST_F(LoopTest, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetTallyResult(false);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 250);
   ndi.SetTallyResult(true);
   ndi.SetMetadataResult(false);
@@ -172,8 +172,7 @@ TEST_F(LoopTest, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
 TEST_F(LoopTest, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
   EXPECT_EQ(ndi.Seen().captures, 120);
   EXPECT_EQ(source->State(), ReceiverState::Idle);
@@ -196,8 +195,7 @@ TEST_F(LoopTest, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
 }
 
 TEST_F(LoopTest, SenderSlowToAppearSendsTheLoopToIdleOnceItsReceiverExists) {
-  Make();
-  source->Start();
+  Run();
   ndi.SetConnections(0);
   for (int attempt = 1; attempt <= 120; ++attempt) {
     ASSERT_EQ(env.clock->AwaitWait(attempt), 250);
@@ -211,8 +209,7 @@ TEST_F(LoopTest, SenderSlowToAppearSendsTheLoopToIdleOnceItsReceiverExists) {
 TEST_F(LoopTest, LostConnectionWhileReceivingGoesIdle) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  Make();
-  source->Start();
+  Run();
   UntilStates({1, 2});
   ndi.SetConnections(0);
   UntilStates({1, 2, 3});
@@ -241,8 +238,7 @@ TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
   const ListedCase& c = GetParam();
   ndi.SetSources({Entry{kName, kUrl}});
   if (c.receiving) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  Make();
-  source->Start();
+  Run();
   if (c.receiving) UntilStates({1, 2});
   Until([&] { return ndi.Seen().captures >= 3; });
   ndi.SetSources(c.listed);
@@ -278,8 +274,7 @@ INSTANTIATE_TEST_SUITE_P(
 TEST_F(LoopTest, StopEndsAWaitingLoopAtOnceAndReleasesEverything) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);  // Idle, waiting for the next poll
   source->Stop();
   EXPECT_EQ(*env.exits, 0);
@@ -328,8 +323,7 @@ TEST_F(LoopTest, StartedSourceRestartsOnReconnectAndConfiguration) {
 
 TEST_F(LoopTest, ConcurrentReconnectsNeverRunTwoLoops) {
   ndi.SetSources({Entry{kName, kUrl}});
-  Make();
-  source->Start();
+  Run();
   std::vector<std::thread> threads;
   for (int t = 0; t < 3; ++t) {
     threads.emplace_back([this, t] {
@@ -354,8 +348,7 @@ TEST_F(LoopTest, ConcurrentReconnectsNeverRunTwoLoops) {
 
 TEST_F(LoopTest, SourceReleasedWhileRunningStopsItsLoop) {
   ndi.SetSources({Entry{kName, kUrl}});
-  Make();
-  source->Start();
+  Run();
   Until([&] { return ndi.Seen().captures > 0; });
   source.reset();
   EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
