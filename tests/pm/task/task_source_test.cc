@@ -139,14 +139,7 @@ class TaskSourceTest : public ::testing::Test {
         if (CurrentScript().throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
       });
     });
-    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.Port());
-    ASSERT_TRUE(connection);
-    host_ = listener_.Accept();
-    ASSERT_TRUE(host_.Valid());
-    dispatcher_ = std::make_shared<pm::RpcDispatcher>(std::move(connection));
-    task_->AddDispatcher(dispatcher_);
-    task_->AttachDispatcher(dispatcher_);
-    dispatcher_->Start();
+    host_ = Attach(listener_, &dispatcher_);
   }
   void TearDown() override {
     discoveryMayStart_ = true;
@@ -154,18 +147,23 @@ class TaskSourceTest : public ::testing::Test {
     dispatcher_.reset();
   }
 
-  // Attaches one more connection as the runner attaches it; returns the
-  // host's end.
-  pmtest::HostPeer AttachAnother() {
-    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(anotherListener_.Port());
-    pmtest::HostPeer peer = anotherListener_.Accept();
-    EXPECT_TRUE(connection && peer.Valid());
+  // Attaches a connection from `listener` as the runner attaches it; returns
+  // the host's end.
+  pmtest::HostPeer Attach(pmtest::HostListener& listener, std::shared_ptr<pm::RpcDispatcher>* kept = nullptr) {
+    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener.Port());
+    pmtest::HostPeer peer = listener.Accept();
+    if (!connection || !peer.Valid()) {
+      ADD_FAILURE() << "no connection";
+      return peer;
+    }
     auto dispatcher = std::make_shared<pm::RpcDispatcher>(std::move(connection));
     task_->AddDispatcher(dispatcher);
     task_->AttachDispatcher(dispatcher);
     dispatcher->Start();
+    if (kept != nullptr) *kept = dispatcher;
     return peer;
   }
+  pmtest::HostPeer AttachAnother() { return Attach(anotherListener_); }
 
   // Sends a command and returns its reply, skipping the task's own requests
   // (a started source announces its buffer queue).
