@@ -50,50 +50,42 @@ class IntakeTest : public ::testing::Test {
   }
 };
 
-TEST_F(IntakeTest, UyvyFrameIsRequestedAs2vuyAndCopiedRowByRow) {
-  // Stride wider than a row: the padding must not end up in the buffer.
-  auto frame = VideoCapture(kNdiFourCCUYVY, 64, 8, 160);
-  MediaInfo info;
-  ASSERT_TRUE(Video(frame, &info));
-  ASSERT_EQ(callbacks->Seen().videoRequests.size(), 1u);
-  const Requested r = Read(callbacks->Seen().videoRequests[0]);
-  EXPECT_EQ(r.code, 0x32767579u);
-  EXPECT_EQ(r.width, 64);
-  EXPECT_EQ(r.height, 8);
-  EXPECT_EQ(r.byteSize, 0u);
-  EXPECT_EQ(r.field, 0);
-  EXPECT_EQ(r.scan, 'P');
-  EXPECT_EQ(r.extras, 0);
-  const auto sent = callbacks->Seen().videoSent;
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0]->copiedStride, 160);
-  for (int row = 0; row < 8; ++row) {
-    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 128, frame->bytes.data() + row * 160, 128)) << row;
-  }
-  EXPECT_EQ(info, (MediaInfo{64, 8, 30000, 1001, 0, 0}));
-}
-
-TEST_F(IntakeTest, EachAcceptedFourCCMapsToItsHostCode) {
+// Each accepted FourCC is asked for as its host code, with the scan of the
+// frame, and copied row by row (NV12's chroma rows too) from the frame's
+// stride: padding past a row never ends up in the buffer.
+TEST_F(IntakeTest, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
   struct Case {
-    std::uint32_t fourcc;
-    std::uint32_t code;
+    std::uint32_t fourcc, code;
     int stride;
+    bool progressive;
+    int rows, rowBytes;
+  } cases[] = {
+      {kNdiFourCCUYVY, 0x32767579u /* '2vuy' */, 40, true, 4, 32},
+      {kNdiFourCCUYVA, pm::kCode2vuy, 32, false, 4, 32},
+      {kNdiFourCCNV12, pm::kCodeNV12, 24, true, 6, 16},
+      {kNdiFourCCBGRA, pm::kCodeRgba, 72, false, 4, 64},
   };
-  for (const Case& c : {Case{kNdiFourCCUYVA, pm::kCode2vuy, 32}, Case{kNdiFourCCNV12, pm::kCodeNV12, 16},
-                        Case{kNdiFourCCBGRA, pm::kCodeRgba, 64}}) {
-    ASSERT_TRUE(Video(VideoCapture(c.fourcc, 16, 4, c.stride, 0, /*progressive=*/false)));
-    EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).code, c.code);
-    EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).scan, 'U');
-  }
-}
-
-TEST_F(IntakeTest, Nv12CopiesLumaAndChromaWithTheFrameStride) {
-  auto frame = VideoCapture(kNdiFourCCNV12, 16, 4, 24);
-  ASSERT_TRUE(Video(frame));
-  const auto sent = callbacks->Seen().videoSent;
-  ASSERT_EQ(sent.size(), 1u);
-  for (int row = 0; row < 6; ++row) {  // 4 luma rows, 2 chroma rows
-    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 16, frame->bytes.data() + row * 24, 16)) << row;
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.fourcc);
+    auto frame = VideoCapture(c.fourcc, 16, 4, c.stride, 0, c.progressive);
+    MediaInfo info;
+    ASSERT_TRUE(Video(frame, &info));
+    const Requested r = Read(callbacks->Seen().videoRequests.back());
+    EXPECT_EQ(r.code, c.code);
+    EXPECT_EQ(r.width, 16);
+    EXPECT_EQ(r.height, 4);
+    EXPECT_EQ(r.byteSize, 0u);
+    EXPECT_EQ(r.field, 0);
+    EXPECT_EQ(r.scan, c.progressive ? 'P' : 'U');
+    EXPECT_EQ(r.extras, 0);
+    const auto sent = callbacks->Seen().videoSent.back();
+    EXPECT_EQ(sent->copiedStride, c.stride);
+    for (int row = 0; row < c.rows; ++row) {
+      ASSERT_EQ(0, std::memcmp(sent->memory.data() + row * c.rowBytes, frame->bytes.data() + row * c.stride,
+                               static_cast<std::size_t>(c.rowBytes)))
+          << row;
+    }
+    EXPECT_EQ(info, (MediaInfo{16, 4, 30000, 1001, 0, 0}));
   }
 }
 
