@@ -42,6 +42,7 @@
 #include "pm/ipc/connection.h"
 #include "pm/runtime/ids.h"
 #include "pm/runtime/json.h"
+#include "pm/runtime/proc_stat.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "support/wait.h"
 
@@ -455,28 +456,6 @@ class Subreaper {
   bool reaped_ = false;
 };
 
-// The children of `parent` whose command name is `name`, from /proc.
-std::vector<pid_t> ChildrenNamed(pid_t parent, const std::string& name) {
-  std::vector<pid_t> found;
-  DIR* proc = ::opendir("/proc");
-  if (proc == nullptr) return found;
-  while (const dirent* entry = ::readdir(proc)) {
-    const pid_t pid = static_cast<pid_t>(std::atoi(entry->d_name));
-    if (pid <= 0) continue;
-    std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    const std::size_t open = text.find('('), close = text.rfind(')');
-    if (open == std::string::npos || close == std::string::npos) continue;
-    std::istringstream rest(text.substr(close + 1));
-    char state = 0;
-    pid_t ppid = 0;
-    rest >> state >> ppid;
-    if (ppid == parent && text.substr(open + 1, close - open - 1) == name) found.push_back(pid);
-  }
-  ::closedir(proc);
-  return found;
-}
-
 TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm) {
   const std::optional<ProcessUsage> own = OwnLevel();
   ASSERT_TRUE(own);
@@ -504,7 +483,7 @@ TEST(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm
     ASSERT_TRUE(host.Start(std::move(o)));
     std::vector<pid_t> runners;
     ASSERT_TRUE(pmtest::WaitFor([&] {
-      runners = ChildrenNamed(host.Pid(), "pm-runner");
+      runners = pm::ChildrenNamed(host.Pid(), "pm-runner");
       return runners.size() == 1;
     }, kPatience));
     const pid_t runner = runners[0];
@@ -608,10 +587,10 @@ TEST(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyW
 
       // Every sender gone, every source idle: the runner must sleep. (Time
       // must pass to measure it.)
-      const double cpuBefore = pmhost::ProcessCpuSeconds(tree.Runner());
+      const double cpuBefore = pm::ProcessCpuSeconds(tree.Runner());
       const auto start = Clock::now();
       std::this_thread::sleep_for(800ms);
-      const double cpu = pmhost::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
+      const double cpu = pm::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
       const double wall = SecondsSince(start);
       if (const auto gone = pmtest::UsageOf(tree.Runner())) highestPrivate = std::max(highestPrivate, gone->privateKiB);
       goneCpu += cpu;
