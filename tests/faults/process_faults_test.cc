@@ -187,13 +187,20 @@ int CountInText(const std::string& text, const std::string& what) {
   return count;
 }
 
-// Starts the host and discovery and waits until every sender is announced.
-void StartWithDiscovery(Tree& tree, const std::vector<std::string>& ids) {
+// Small silent pictures at `fps`.
+std::vector<std::string> Small(const char* fps) {
+  return {"--width", "64", "--height", "16", "--fps", fps, "--no-audio"};
+}
+
+// Starts `sender` as `name` in the tree's folder, then the host and
+// discovery, and waits until the sender is announced; *id is its source id.
+void StartWithDiscovery(Tree& tree, Sender& sender, const std::string& name, const std::vector<std::string>& args,
+                        std::string* id) {
+  ASSERT_TRUE(sender.Start(tree.folder, name, args));
+  *id = pmhost::kSourceIdPrefix + sender.Name();
   ASSERT_TRUE(tree.host.Start());
   ASSERT_TRUE(tree.Session().StartDiscovery());
-  for (const std::string& id : ids) {
-    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > 0; }, kPatience)) << id << " never announced";
-  }
+  ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(*id) > 0; }, kPatience)) << *id << " never announced";
 }
 
 // Starts the source until a picture arrives, then stops it: whatever the
@@ -264,10 +271,9 @@ TEST_F(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegment
   Tree tree(&sink);
   OpenAtExit opener{sink};
   Sender sender;
-  ASSERT_TRUE(sender.Start(tree.folder, "Stall", {"--width", "256", "--height", "144", "--fps", "120",
-                                                  "--pattern", "ramp", "--no-audio"}));
-  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  std::string id;
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Stall", {"--width", "256", "--height", "144", "--fps", "120",
+                                                                     "--pattern", "ramp", "--no-audio"}, &id));
   ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
   const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
   ASSERT_TRUE(level);
@@ -326,9 +332,8 @@ TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwe
   Tree tree(&sink);
   OpenAtExit opener{sink};
   Sender sender;
-  ASSERT_TRUE(sender.Start(tree.folder, "Drop", {"--width", "64", "--height", "16", "--fps", "60", "--no-audio"}));
-  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  std::string id;
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Drop", Small("60"), &id));
   ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
   const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
   ASSERT_TRUE(level);
@@ -421,7 +426,7 @@ TEST_F(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevS
   ASSERT_TRUE(reaper.Enabled());
   Folder folder;
   Sender sender;
-  ASSERT_TRUE(sender.Start(folder, "Orphan", {"--width", "64", "--height", "16", "--fps", "60", "--no-audio"}));
+  ASSERT_TRUE(sender.Start(folder, "Orphan", Small("60")));
 
   // `pm-host receive` as its own process, with its runner under it.
   std::mutex lock;  // guards lines
@@ -608,9 +613,8 @@ TEST_F(ProcessFaults, ASenderStartedAgainSoonAfterItWentIsReceivedFromItsFirstRe
   RampSink sink(/*ramp=*/false);
   Tree tree(&sink);
   auto sender = std::make_unique<Sender>();
-  ASSERT_TRUE(sender->Start(tree.folder, "Return", args));
-  const std::string id = pmhost::kSourceIdPrefix + sender->Name();
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  std::string id;
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, *sender, "Return", args, &id));
   ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
   ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0 && tree.reports.ReportedSince(id, 0, 2); }, kPatience))
       << tree.Log();
@@ -647,9 +651,8 @@ TEST_F(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemor
   Sender sender;
   // Pictures often enough that some cycles stop a source that has started
   // delivering.
-  ASSERT_TRUE(sender.Start(tree.folder, "Cycle", {"--width", "64", "--height", "16", "--fps", "120", "--no-audio"}));
-  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  std::string id;
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Cycle", Small("120"), &id));
   ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
 
   // 4 MiB over 990 cycles is under one page (4 KiB) a cycle: a leaked
@@ -705,9 +708,8 @@ TEST_F(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadO
   RampSink sink(/*ramp=*/false);
   Tree tree(&sink);
   Sender sender;
-  ASSERT_TRUE(sender.Start(tree.folder, "Scan", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
-  const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, {id}));
+  std::string id;
+  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Scan", Small("30"), &id));
   // The source keeps the runner up while discovery comes and goes.
   ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
   ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, kPatience));
