@@ -16,6 +16,7 @@
 #include <map>
 
 #include "pm/runtime/log.h"
+#include "pm/runtime/proc_stat.h"
 #include "pm/runtime/syscall.h"
 
 namespace ndilb {
@@ -212,14 +213,8 @@ bool ProcessAlive(int pid) {
   if (pid <= 0) return false;
   if (::kill(pid, 0) != 0 && errno == ESRCH) return false;
   // A killed child that its parent has not reaped yet still answers kill().
-  std::string stat;
-  if (ReadSmallFile("/proc/" + std::to_string(pid) + "/stat", &stat)) {
-    const std::size_t paren = stat.rfind(')');
-    if (paren != std::string::npos && paren + 2 < stat.size() && (stat[paren + 2] == 'Z' || stat[paren + 2] == 'X')) {
-      return false;
-    }
-  }
-  return true;
+  pm::ProcStat stat;
+  return !(pm::ReadProcStat(pid, &stat) && (stat.state == 'Z' || stat.state == 'X'));
 }
 
 std::vector<RegistryEntry> ListRegistry() {

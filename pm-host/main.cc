@@ -25,6 +25,7 @@
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/context.h"
+#include "pm/runtime/syscall.h"
 
 namespace {
 
@@ -33,16 +34,6 @@ constexpr int kExitUsage = 2;
 std::atomic<bool> g_interrupted{false};
 
 void OnInterrupt(int) { g_interrupted = true; }
-
-void WriteToStderr(const char* line) {
-  std::size_t length = std::strlen(line);
-  while (length > 0) {
-    const ssize_t n = ::write(STDERR_FILENO, line, length);
-    if (n <= 0) return;
-    line += n;
-    length -= static_cast<std::size_t>(n);
-  }
-}
 
 // The default of --runner, --module or --sender as help shows it.
 std::string DefaultPath(pmhost::Companion companion) {
@@ -124,7 +115,7 @@ int main(int argc, char** argv) {
     return app.exit(e) == 0 ? 0 : kExitUsage;
   }
 
-  pm::GetContext()->logSink = [](pm::LogType, const char* line) { WriteToStderr(line); };
+  pm::GetContext()->logSink = [](pm::LogType, const char* line) { pm::WriteToStderr(line); };
   struct sigaction action {};
   action.sa_handler = OnInterrupt;
   sigemptyset(&action.sa_mask);

@@ -23,6 +23,7 @@
 #include "pm-host/wav.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
+#include "pm/runtime/proc_stat.h"
 #include "pm/shm/formats.h"
 
 namespace pmhost {
@@ -250,25 +251,6 @@ std::string SummaryText(const ReceiveResult& r) {
   return out + text;
 }
 
-double ProcessCpuSeconds(pid_t pid) {
-  if (pid <= 0) return 0;
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  // The command name (field 2) may hold blanks and parentheses: count from
-  // the last ')'. utime and stime are fields 14 and 15.
-  const std::size_t close = text.rfind(')');
-  if (close == std::string::npos) return 0;
-  std::istringstream fields(text.substr(close + 1));
-  std::string field;
-  unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && fields >> field; ++i) {
-    if (i == 14) utime = std::strtoull(field.c_str(), nullptr, 10);
-    if (i == 15) stime = std::strtoull(field.c_str(), nullptr, 10);
-  }
-  const long ticks = ::sysconf(_SC_CLK_TCK);
-  return ticks > 0 ? static_cast<double>(utime + stime) / static_cast<double>(ticks) : 0;
-}
-
 int Discover(const ListOptions& options) {
   SourceTable table;
   std::mutex outLock;  // guards writes to options.out from the dispatcher thread
@@ -389,7 +371,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
   for (;;) {
     StatsSnapshot now = stats.Snapshot(SteadyNs(), /*latency=*/false);
     if (now.frames > 0 && result.runnerCpuAtFirstPicture == 0) {
-      result.runnerCpuAtFirstPicture = ProcessCpuSeconds(host.RunnerPid());
+      result.runnerCpuAtFirstPicture = pm::ProcessCpuSeconds(host.RunnerPid());
     }
     if (!commandsSent && (now.state == 2 || now.frames > 0 || now.audioBuffers > 0 || elapsed() > 5)) {
       commandsSent = true;
@@ -430,7 +412,7 @@ ReceiveResult Receive(const ReceiveOptions& options) {
 
   if (sink.FirstVideoNs() != 0) result.firstPictureSeconds = static_cast<double>(sink.FirstVideoNs() - startSourceNs) / 1e9;
   result.memoryBases = session.MemoryBases();
-  result.runnerCpuSeconds = ProcessCpuSeconds(host.RunnerPid());
+  result.runnerCpuSeconds = pm::ProcessCpuSeconds(host.RunnerPid());
   session.StopSource(match.id);
   // With no discovery running, the last stop_source ends the task and the
   // runner with it.

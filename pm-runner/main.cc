@@ -62,16 +62,6 @@ constexpr int kExitModuleCannotRun = 3;
 constexpr int kExitNoConnection = 4;
 constexpr auto kStopLimit = std::chrono::seconds(5);
 
-void WriteToStderr(const char* text) {
-  std::size_t length = std::strlen(text);
-  while (length > 0) {
-    const ssize_t n = pm::RetryEintr([&] { return ::write(STDERR_FILENO, text, length); });
-    if (n <= 0) return;
-    text += n;
-    length -= static_cast<std::size_t>(n);
-  }
-}
-
 void Wake(char reason) {
   const int saved = errno;
   [[maybe_unused]] ssize_t n = ::write(g_wakeWrite, &reason, 1);  // a full pipe already wakes
@@ -205,7 +195,7 @@ int main(int argc, char** argv) {
 
   // Every line of the runner and of the task goes to stderr unchanged.
   pm::Context* context = pm::GetContext();
-  context->logSink = [](pm::LogType, const char* line) { WriteToStderr(line); };
+  context->logSink = [](pm::LogType, const char* line) { pm::WriteToStderr(line); };
   if (!InstallSignalHandlers()) return kExitFailed;
 
   void* module = ::dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);

@@ -1,21 +1,17 @@
 #include "pm/runtime/context.h"
 
 #include <dlfcn.h>
-#include <unistd.h>
 
 #include <atomic>
-#include <cstring>
+
+#include "pm/runtime/syscall.h"
 
 namespace pm {
 namespace {
 
 std::atomic<Context*> g_context{nullptr};
 
-void DefaultSink(LogType, const char* line) {
-  // One write, so lines from several threads do not mix.
-  const std::size_t n = std::strlen(line);
-  [[maybe_unused]] ssize_t written = ::write(STDERR_FILENO, line, n);
-}
+void DefaultSink(LogType, const char* line) { WriteToStderr(line); }
 
 }  // namespace
 
