@@ -109,42 +109,29 @@ struct Link {
   std::shared_ptr<pm::SourceCallbacks> callbacks;
 };
 
-TEST(HostQueue, PicturesArriveAsWrittenWithTheirTimeAndGeometry) {
+TEST(HostQueue, PicturesAndSoundArriveAsWrittenWithTheirTimeAndShape) {
   Link link;
   link.SendPicture(64, 8, 5, 705'600'000);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return link.Videos() == 1; }));
-  std::lock_guard<std::mutex> guard(link.recorded.lock);
-  const pmhost::VideoFrame& f = link.recorded.videos[0];
-  EXPECT_EQ(f.code, pm::kCode2vuy);
-  EXPECT_EQ(f.width, 64);
-  EXPECT_EQ(f.height, 8);
-  EXPECT_EQ(f.stride, 128u);
-  EXPECT_EQ(f.mediaTime, 705'600'000);
-  const std::vector<std::uint8_t>& p = link.recorded.pictures[0];
-  ASSERT_EQ(p.size(), 128u * 8);
-  for (int y = 0; y < 8; ++y) {
-    for (int x = 0; x < 128; ++x) ASSERT_EQ(p[static_cast<std::size_t>(y) * 128 + x], static_cast<std::uint8_t>(5 + y * 3 + x));
-  }
-}
-
-TEST(HostQueue, SoundArrivesInterleavedAndIntact) {
-  Link link;
-  pm::AudioFormat format{pm::kCodeFl32, 48000, 2};
-  auto buffer = link.callbacks->RequestAudioBuffer(format, 480);
+  auto buffer = link.callbacks->RequestAudioBuffer(pm::AudioFormat{pm::kCodeFl32, 48000, 2}, 480);
   ASSERT_TRUE(buffer);
   buffer->Fill([](void* data, std::int64_t bytes) {
-    auto* s = static_cast<float*>(data);
-    for (std::int64_t i = 0; i < bytes / 4; ++i) s[i] = static_cast<float>(i) / 1024.0f;
+    for (std::int64_t i = 0; i < bytes / 4; ++i) static_cast<float*>(data)[i] = static_cast<float>(i) / 1024.0f;
   });
   link.callbacks->SendAudioBuffer(42, std::move(buffer));
   ASSERT_TRUE(pmtest::WaitFor([&] {
     std::lock_guard<std::mutex> guard(link.recorded.lock);
-    return link.recorded.audios.size() == 1;
+    return link.recorded.videos.size() == 1 && link.recorded.audios.size() == 1;
   }));
   std::lock_guard<std::mutex> guard(link.recorded.lock);
-  EXPECT_EQ(link.recorded.audios[0].samples, 480);
-  EXPECT_EQ(link.recorded.audios[0].channels, 2);
-  EXPECT_EQ(link.recorded.audios[0].rate, 48000);
+  const pmhost::VideoFrame& f = link.recorded.videos[0];
+  EXPECT_EQ(std::vector<int>({static_cast<int>(f.code), f.width, f.height, static_cast<int>(f.stride)}),
+            std::vector<int>({static_cast<int>(pm::kCode2vuy), 64, 8, 128}));
+  EXPECT_EQ(f.mediaTime, 705'600'000);
+  const std::vector<std::uint8_t>& p = link.recorded.pictures[0];
+  ASSERT_EQ(p.size(), 128u * 8);
+  for (std::size_t i = 0; i < p.size(); ++i) ASSERT_EQ(p[i], static_cast<std::uint8_t>(5 + i / 128 * 3 + i % 128)) << i;
+  const pmhost::AudioFrame& a = link.recorded.audios[0];
+  EXPECT_EQ(std::vector<int>({a.samples, a.channels, a.rate}), std::vector<int>({480, 2, 48000}));
   ASSERT_EQ(link.recorded.sounds[0].size(), 960u);
   for (std::size_t i = 0; i < 960; ++i) ASSERT_EQ(link.recorded.sounds[0][i], static_cast<float>(i) / 1024.0f);
 }
@@ -199,7 +186,8 @@ struct Segment {
 
 std::string Base() { return "pmhost-cache-" + std::to_string(::getpid()) + "-"; }
 
-TEST(SegmentCache, RemapsWhenTheSizeChangesAndKeepsOldHoldersValid) {
+TEST(SegmentCache, RemapsWhenTheSizeChangesKeepsOldHoldersValidAndRefusesShortSegments) {
+  pmtest::LogCapture log;
   pmhost::SegmentCache cache(Base());
   auto first = std::make_unique<Segment>("/" + Base() + "1", 4096, 0x11);
   auto a = cache.Map(1, 4096);
@@ -216,14 +204,8 @@ TEST(SegmentCache, RemapsWhenTheSizeChangesAndKeepsOldHoldersValid) {
   cache.Forget(1);
   EXPECT_EQ(cache.Count(), 0u);
   EXPECT_EQ(b->Data()[0], 0x22);
-}
-
-TEST(SegmentCache, ASegmentSmallerThanTheRecordSaysIsNotMapped) {
-  pmtest::LogCapture log;
-  pmhost::SegmentCache cache(Base());
-  Segment s("/" + Base() + "2", 4096, 0);
-  EXPECT_FALSE(cache.Map(2, 8192));
-  EXPECT_FALSE(cache.Map(3, 4096));  // no such segment
+  EXPECT_FALSE(cache.Map(1, 16384)) << "a segment smaller than the record says is not mapped";
+  EXPECT_FALSE(cache.Map(3, 4096)) << "no such segment";
   EXPECT_EQ(log.Count("SegmentMapping::Open"), 2);
 }
 
