@@ -94,12 +94,16 @@ INSTANTIATE_TEST_SUITE_P(Formats, SenderFormats,
                          [](const ::testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.format); });
 
 // The host's PTZ commands, tally and shot events reach the sender as values
-// and exact texts, through the task's command handling and the runtime.
-TEST(EndToEnd, PtzTallyAndShotEventsReachTheSender) {
+// and exact texts, through the task's command handling and the runtime; at
+// the host's audio-only bandwidth, with sound and no pictures.
+TEST(EndToEnd, PtzTallyAndShotEventsReachTheSenderAndAudioOnlyBringsNoPictures) {
   Folder folder;
   Sender sender;
-  ASSERT_TRUE(sender.Start(folder, "PTZ", {"--ptz", "--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
+  ASSERT_TRUE(sender.Start(folder, "PTZ", {"--ptz", "--width", "64", "--height", "16", "--fps", "30"}));
   pmhost::ReceiveOptions o = ReceiveFrom(folder, sender.Name());
+  o.bandwidth = "audio_only";
+  std::atomic<int> sound{0};
+  o.onAudio = [&](const pmhost::AudioFrame&) { ++sound; };
   o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
   o.tally = "preview";
   o.shotEvents = {"X"};
@@ -117,14 +121,17 @@ TEST(EndToEnd, PtzTallyAndShotEventsReachTheSender) {
        }},
   };
   auto arrived = [&](std::size_t i) { return !sender.Find(expected[i].first, expected[i].second).is_null(); };
+  // A second of sound at least: about 30 pictures would have come with it.
   const pmhost::ReceiveResult result = pmtest::ReceiveUntil(o, [&] {
     for (std::size_t i = 0; i < expected.size(); ++i) {
       if (!arrived(i)) return false;
     }
-    return true;
+    return sound > 30;
   });
   ExpectOrderlyEnd(result, folder);
   for (std::size_t i = 0; i < expected.size(); ++i) EXPECT_TRUE(arrived(i)) << "expected event " << i;
+  EXPECT_GT(result.stats.audioBuffers, 30u);
+  EXPECT_EQ(result.stats.frames, 0u);
 }
 
 // The loopback runtime keeps a sender that went listed for a second, as the
