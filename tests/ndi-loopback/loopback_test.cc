@@ -65,13 +65,13 @@ class Receiver {
   ~Receiver() { NDIlib_recv_destroy(handle_); }
   void* get() const { return handle_; }
   int Connections() const { return NDIlib_recv_get_no_connections(handle_); }
-  bool WaitConnected(std::chrono::milliseconds timeout = 5s) const {
+  bool WaitConnected(std::chrono::milliseconds timeout = pmtest::kPatience) const {
     return pmtest::WaitFor([&] { return Connections() == 1; }, timeout);
   }
   // Captures until a frame of `type` arrives (others are freed); it is kept
   // in `v`, `a` or `m` when given, freed otherwise. False on timeout.
   bool CaptureType(std::int32_t type, ndi_video_frame_v2* v = nullptr, ndi_audio_frame_v2* a = nullptr,
-                   ndi_metadata_frame* m = nullptr, std::chrono::milliseconds timeout = 5s) {
+                   ndi_metadata_frame* m = nullptr, std::chrono::milliseconds timeout = pmtest::kPatience) {
     const auto deadline = std::chrono::steady_clock::now() + timeout;
     while (std::chrono::steady_clock::now() < deadline) {
       ndi_video_frame_v2 vv{};
@@ -266,7 +266,7 @@ TEST_F(Loopback, AnInProcessSenderCountsItsReceiversCombinesTheirTallyAndSendsMe
   auto live = std::make_unique<Receiver>(ndilb::FullSourceName("Combined"));
   Receiver look(ndilb::FullSourceName("Combined"));
   ASSERT_TRUE(live->WaitConnected() && look.WaitConnected());
-  EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_send_get_no_connections(sender, 0) == 2; }, 2s));
+  EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_send_get_no_connections(sender, 0) == 2; }, pmtest::kPatience));
   ndi_tally t{};
   // Reported on every connection change (as the vendor runtime does), then
   // not again until something changes.
@@ -290,7 +290,7 @@ TEST_F(Loopback, AnInProcessSenderCountsItsReceiversCombinesTheirTallyAndSendsMe
   EXPECT_TRUE(pmtest::WaitFor([&] {
     NDIlib_send_get_tally(sender, &t, 50);
     return t.on_program && t.on_preview;
-  }, 2s));
+  }, pmtest::kPatience));
   live.reset();  // its program tally goes with it
   EXPECT_TRUE(NDIlib_send_get_tally(sender, &t, 2000));
   EXPECT_FALSE(t.on_program);
@@ -334,7 +334,7 @@ TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncementAndEveryCallReachesItAsI
     ASSERT_EQ(NDIlib_recv_capture_v2(rx.get(), nullptr, nullptr, &m, 0), kNdiFrameStatusChange);
     EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.get()));
     ASSERT_TRUE(rx.WaitConnected());
-    EXPECT_EQ(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr, ptz ? 5s : 300ms), ptz);
+    EXPECT_EQ(rx.CaptureType(kNdiFrameStatusChange, nullptr, nullptr, nullptr, ptz ? std::chrono::milliseconds(pmtest::kPatience) : 300ms), ptz);
     EXPECT_EQ(NDIlib_recv_ptz_is_supported(rx.get()), ptz);
     for (const auto& [call, xml] : calls) {
       EXPECT_TRUE(call(rx.get())) << xml;
