@@ -1,7 +1,5 @@
 #include "support/host_link.h"
 
-#include <cstring>
-
 namespace pmtest {
 
 HostLink::HostLink() {
@@ -33,13 +31,11 @@ std::optional<nlohmann::json> HostLink::ReadCommand(const std::string& command, 
 
 QueueReader::QueueReader(int port) { connection_ = pm::ipc::Connection::Open(port); }
 
+// The task writes each record as one block: the token and the record bytes
+// arrive together.
 bool QueueReader::ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs) {
-  if (!connection_) return false;
-  std::uint8_t bytes[64];
-  if (!connection_->ReadFromSocket(bytes, sizeof bytes, timeoutMs)) return false;
-  std::memcpy(token, bytes, 4);
-  std::memcpy(record, bytes + 4, 60);
-  return true;
+  return connection_ && connection_->ReadFromSocket(token, 4, timeoutMs) &&
+         connection_->ReadFromSocket(record, 60, timeoutMs);
 }
 
 bool QueueReader::ReturnToken(std::uint32_t token) {

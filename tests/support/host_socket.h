@@ -15,6 +15,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include <nlohmann/json.hpp>
 
@@ -26,12 +27,11 @@ class HostPeer {
  public:
   HostPeer() = default;
   explicit HostPeer(int fd) : fd_(fd) {}
-  HostPeer(HostPeer&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
+  HostPeer(HostPeer&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
   HostPeer& operator=(HostPeer&& other) noexcept {
     if (this != &other) {
       Close();
-      fd_ = other.fd_;
-      other.fd_ = -1;
+      fd_ = std::exchange(other.fd_, -1);
     }
     return *this;
   }
