@@ -6,8 +6,6 @@
 #include <sys/socket.h>
 
 #include <array>
-#include <filesystem>
-#include <fstream>
 #include <functional>
 #include <thread>
 
@@ -357,31 +355,6 @@ TEST_F(ProducerReaders, ReaderClosedOnOurSideIsDroppedToo) {
 }
 
 // ---------------------------------------------------------------------------
-
-using ProducerLifecycle = Fixture;
-
-int ProducerThreads() {
-  int n = 0;
-  for (const auto& entry : std::filesystem::directory_iterator("/proc/self/task")) {
-    std::string name;
-    std::getline(std::ifstream(entry.path() / "comm"), name);
-    n += name == "pm::Ipc Produce";
-  }
-  return n;
-}
-
-// One named thread per started producer; a restart or the destructor joins it.
-TEST_F(ProducerLifecycle, ThreadIsNamedAndJoined) {
-  EXPECT_EQ(ProducerThreads(), 1);
-  ASSERT_TRUE(producer.Start(60, releases.Callback()));
-  EXPECT_EQ(ProducerThreads(), 1);
-  {
-    Producer other;
-    ASSERT_TRUE(other.Start(60, [](std::uint32_t) {}));
-    EXPECT_EQ(ProducerThreads(), 2);
-  }
-  EXPECT_EQ(ProducerThreads(), 1);
-}
 
 TEST(ProducerDestroy, PendingTokensAreDroppedWithoutCallbacks) {
   auto server = Server::CreateListening();
