@@ -77,6 +77,32 @@ class DispatcherTest : public ::testing::Test {
     std::lock_guard<std::mutex> guard(repliesMutex_);
     return replies_;
   }
+  // Stop ends receiving once and closes the connection, also when a handler
+  // calls it (it must not join its own thread); a second Stop returns at
+  // once; later requests are refused and stay pending until they expire.
+  void StopEndsReceivingOnce(bool fromAHandler) {
+    std::atomic<bool> handlerReturned{false};
+    dispatcher_->RegisterHandler("stop", [&](const Json&, Json&) {
+      dispatcher_->Stop();
+      handlerReturned = true;
+    });
+    StartReceiving();
+    if (fromAHandler) {
+      ASSERT_TRUE(host_.WriteJson({{"pm::command", "stop"}, {"pm::unique_id", 1}}));
+    } else {
+      dispatcher_->Stop();
+    }
+    ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->Ended(); }));
+    EXPECT_TRUE(pmtest::WaitFor([&] { return handlerReturned.load() == fromAHandler; }));
+    dispatcher_->Stop();
+    EXPECT_EQ(clock_->Sleeps(), 1);  // the second call returned at once
+    EXPECT_EQ(endedCalls_.load(), 1);
+    EXPECT_TRUE(host_.SeesEndOfStream());
+    Json payload;
+    EXPECT_FALSE(dispatcher_->RpcRequest("late", payload, 100));
+    EXPECT_EQ(dispatcher_->PendingCount(), 1u);
+    dispatcher_.reset();  // joins the receive thread from here
+  }
   // A request as the host sends it; the reply it gets.
   Json Ask(const std::string& command, std::uint64_t id, Json body = Json::object()) {
     body["pm::command"] = command;
@@ -271,37 +297,8 @@ TEST_F(DispatcherTest, OversizeLengthClosesTheConnectionWithoutWaitingForTheBody
   EXPECT_FALSE(dispatcher_->RpcRequest("c", payload, 100));
 }
 
-// --- Stopping -------------------------------------------------------------
-
-TEST_F(DispatcherTest, StopFromAHandlerEndsWithoutJoiningItsOwnThread) {
-  std::atomic<bool> handlerReturned{false};
-  dispatcher_->RegisterHandler("stop", [&](const Json&, Json&) {
-    dispatcher_->Stop();
-    handlerReturned = true;
-  });
-  StartReceiving();
-  ASSERT_TRUE(host_.WriteJson({{"pm::command", "stop"}, {"pm::unique_id", 1}}));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->Ended(); }));
-  EXPECT_TRUE(handlerReturned.load());
-  EXPECT_TRUE(host_.SeesEndOfStream());
-  EXPECT_EQ(endedCalls_.load(), 1);
-  EXPECT_EQ(clock_->Sleeps(), 1);
-  dispatcher_.reset();  // joins the receive thread from here
-}
-
-TEST_F(DispatcherTest, StopIsIdempotentAndLaterRequestsStayPendingUnsent) {
-  StartReceiving();
-  dispatcher_->Stop();
-  dispatcher_->Stop();
-  EXPECT_EQ(clock_->Sleeps(), 1);  // the second call returned at once
-  EXPECT_TRUE(dispatcher_->Ended());
-  EXPECT_EQ(endedCalls_.load(), 1);
-  EXPECT_TRUE(host_.SeesEndOfStream());
-  Json payload;
-  EXPECT_FALSE(dispatcher_->RpcRequest("late", payload, 100));
-  EXPECT_EQ(dispatcher_->PendingCount(), 1u);
-}
-
+TEST_F(DispatcherTest, StopEndsReceivingOnce) { StopEndsReceivingOnce(false); }
+TEST_F(DispatcherTest, StopFromAHandlerEndsReceivingWithoutJoiningItsOwnThread) { StopEndsReceivingOnce(true); }
 TEST_F(DispatcherTest, HostLeavingBetweenFramesEndsReceivingOnce) { HostLeavingEndsReceivingOnce(false); }
 TEST_F(DispatcherTest, HostLeavingInsideAFrameEndsReceivingWithoutRunningItsHandler) {
   HostLeavingEndsReceivingOnce(true);
