@@ -90,7 +90,7 @@ TEST_F(SharedCpuMemoryTest, CreateMakesAPrivateEntryAndDestructionRemovesIt) {
     ASSERT_EQ(::stat(("/dev/shm/" + name).c_str(), &info), 0);
     EXPECT_EQ(info.st_mode & 0777, 0600u);
     EXPECT_EQ(info.st_size, 8192);
-    EXPECT_EQ(segment->descriptor.size, 8192u);  // it travels in every record
+    EXPECT_EQ(std::uint64_t{segment->descriptor.size}, 8192u);  // (a copy of the packed field)
     // The mapping does not keep a descriptor open.
     EXPECT_EQ(OpenDescriptors(), descriptorsBefore);
     segment->Data()[8191] = 1;  // the whole size is backed
