@@ -104,7 +104,8 @@ class HostPeer {
   // negative on an error); nullopt when it is not readable by the deadline.
   std::optional<ssize_t> ReceiveBy(std::chrono::steady_clock::time_point deadline, char* p, std::size_t n) {
     for (;;) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+      using std::chrono::steady_clock;
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
       if (left.count() < 0) return std::nullopt;
       pollfd pfd{fd_, POLLIN, 0};
       const int ready = ::poll(&pfd, 1, static_cast<int>(left.count()) + 1);

@@ -135,7 +135,8 @@ TEST_F(DispatcherTest, SuccessiveRequestsCarryIdsOneApartAndOverwriteTheEnvelope
   EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", second, 0));
   EXPECT_EQ(dispatcher_->EarliestDeadlineNs(), clock_->NowNs());  // a zero timeout is due at once
   const std::uint64_t id = first["pm::unique_id"].get<std::uint64_t>();
-  EXPECT_EQ(first, (Json{{"pm::unique_id", id}, {"pm::command", "pm::tsrc::update_gui"}, {"pm::request", true}, {"arg", 1}}));
+  EXPECT_EQ(first, (Json{{"pm::unique_id", id}, {"pm::command", "pm::tsrc::update_gui"}, {"pm::request", true},
+                         {"arg", 1}}));
   EXPECT_EQ(host_.ReadJson(), first);
   EXPECT_EQ(host_.ReadJson()["pm::unique_id"], id + 1);
   EXPECT_EQ(dispatcher_->PendingCount(), 2u);
