@@ -15,6 +15,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include <nlohmann/json.hpp>
 
@@ -26,19 +27,17 @@ class HostPeer {
  public:
   HostPeer() = default;
   explicit HostPeer(int fd) : fd_(fd) {}
-  HostPeer(HostPeer&& other) noexcept : fd_(other.fd_) { other.fd_ = -1; }
+  HostPeer(HostPeer&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
   HostPeer& operator=(HostPeer&& other) noexcept {
     if (this != &other) {
       Close();
-      fd_ = other.fd_;
-      other.fd_ = -1;
+      fd_ = std::exchange(other.fd_, -1);
     }
     return *this;
   }
   ~HostPeer() { Close(); }
 
   bool Valid() const { return fd_ >= 0; }
-  int Fd() const { return fd_; }
   void Close() {
     if (fd_ >= 0) ::close(fd_);
     fd_ = -1;
@@ -66,21 +65,11 @@ class HostPeer {
 
   // Exactly n bytes within the time limit; false on timeout or end of stream.
   bool ReadExact(void* out, std::size_t n, std::chrono::milliseconds limit) {
-    auto* p = static_cast<char*>(out);
     const auto deadline = std::chrono::steady_clock::now() + limit;
-    std::size_t at = 0;
-    while (at < n) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      if (left.count() < 0) return false;
-      pollfd pfd{fd_, POLLIN, 0};
-      const int ready = ::poll(&pfd, 1, static_cast<int>(left.count()) + 1);
-      if (ready < 0 && errno == EINTR) continue;
-      if (ready <= 0) return false;
-      const ssize_t got = ::recv(fd_, p + at, n - at, 0);
-      if (got < 0 && errno == EINTR) continue;
-      if (got <= 0) return false;
-      at += static_cast<std::size_t>(got);
+    for (std::size_t at = 0; at < n;) {
+      const auto got = ReceiveBy(deadline, static_cast<char*>(out) + at, n - at);
+      if (!got || *got <= 0) return false;
+      at += static_cast<std::size_t>(*got);
     }
     return true;
   }
@@ -98,26 +87,36 @@ class HostPeer {
     if (!text) return nlohmann::json(nlohmann::json::value_t::discarded);
     return nlohmann::json::parse(*text, nullptr, false);
   }
-  // True when the peer ends the stream (or resets it) within the limit.
+  // True when the peer ends the stream (or resets it) within the limit; data
+  // before the end is skipped.
   bool SeesEndOfStream(std::chrono::milliseconds limit = std::chrono::seconds(5)) {
-    char byte;
-    pollfd pfd{fd_, POLLIN, 0};
     const auto deadline = std::chrono::steady_clock::now() + limit;
+    char byte;
     for (;;) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      if (left.count() < 0) return false;
-      const int ready = ::poll(&pfd, 1, static_cast<int>(left.count()) + 1);
-      if (ready < 0 && errno == EINTR) continue;
-      if (ready <= 0) return false;
-      const ssize_t got = ::recv(fd_, &byte, 1, 0);
-      if (got < 0 && errno == EINTR) continue;
-      if (got <= 0) return true;
-      // Data before the end: keep reading.
+      const auto got = ReceiveBy(deadline, &byte, 1);
+      if (!got) return false;
+      if (*got <= 0) return true;
     }
   }
 
  private:
+  // What recv returns once the socket is readable (0 at the end of the stream,
+  // negative on an error); nullopt when it is not readable by the deadline.
+  std::optional<ssize_t> ReceiveBy(std::chrono::steady_clock::time_point deadline, char* p, std::size_t n) {
+    for (;;) {
+      using std::chrono::steady_clock;
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
+      if (left.count() < 0) return std::nullopt;
+      pollfd pfd{fd_, POLLIN, 0};
+      const int ready = ::poll(&pfd, 1, static_cast<int>(left.count()) + 1);
+      if (ready < 0 && errno == EINTR) continue;
+      if (ready <= 0) return std::nullopt;
+      const ssize_t got = ::recv(fd_, p, n, 0);
+      if (got < 0 && errno == EINTR) continue;
+      return got;
+    }
+  }
+
   int fd_ = -1;
 };
 
