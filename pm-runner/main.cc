@@ -250,10 +250,13 @@ int main(int argc, char** argv) {
         pm::Log(pm::LogType::Normal, "", "pm-runner: AttachDispatcher threw: %s\n", e.what());
       }
       dispatchers.push_back(dispatcher);
-      // Receiving starts once the task's handlers are registered, so that no
-      // early request finds its command missing.
-      dispatcher->Start([] { Wake('E'); });
     }
+    // Receiving starts once every connection's dispatcher is in the task with
+    // its handlers registered: no early request finds its command missing, and
+    // a task that stops itself at the first request (StopTask on that
+    // dispatcher's thread) finds every dispatcher there to stop. Started one by
+    // one, a later connection joined after such a stop and kept the runner up.
+    for (auto& dispatcher : dispatchers) dispatcher->Start([] { Wake('E'); });
   }
 
   WaitForTheEnd(dispatchers);
