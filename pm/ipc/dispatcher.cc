@@ -42,6 +42,20 @@ const Json* Field(const Json& object, const char* key) {
   return it == object.end() ? nullptr : &*it;
 }
 
+// Runs a request's callback with its reply or timeout; what it throws is
+// logged, never passed on to the receiving or expiry thread.
+void RunCallback(std::uint64_t id, const RpcCallback& callback, const Json& reply) {
+  try {
+    callback(reply);
+  } catch (const std::exception& e) {
+    Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw: %s\n",
+        static_cast<unsigned long long>(id), e.what());
+  } catch (...) {
+    Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw\n",
+        static_cast<unsigned long long>(id));
+  }
+}
+
 }  // namespace
 
 RpcDispatcher::RpcDispatcher(std::shared_ptr<ipc::Connection> connection, std::shared_ptr<Clock> clock)
@@ -218,15 +232,7 @@ void RpcDispatcher::ExpireDue(std::int64_t now) {
     }
     reply["pm::response"] = true;
     reply["pm::error"] = "timeout";
-    try {
-      request.callback(reply);
-    } catch (const std::exception& e) {
-      Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw: %s\n",
-          static_cast<unsigned long long>(id), e.what());
-    } catch (...) {
-      Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw\n",
-          static_cast<unsigned long long>(id));
-    }
+    RunCallback(id, request.callback, reply);
   }
 }
 
@@ -321,16 +327,7 @@ void RpcDispatcher::HandleReply(const Json& message) {
         static_cast<unsigned long long>(id));
     return;
   }
-  if (!callback) return;
-  try {
-    callback(message);
-  } catch (const std::exception& e) {
-    Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw: %s\n",
-        static_cast<unsigned long long>(id), e.what());
-  } catch (...) {
-    Log(LogType::Normal, "", "RpcDispatcher: callback of request %llu threw\n",
-        static_cast<unsigned long long>(id));
-  }
+  if (callback) RunCallback(id, callback, message);
 }
 
 void RpcDispatcher::HandleRequest(const Json& message) {
