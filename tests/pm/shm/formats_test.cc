@@ -5,14 +5,12 @@
 
 #include <gtest/gtest.h>
 
+#include "support/video_format.h"
+
 namespace {
 
 pm::VideoFormat Format(std::uint32_t code, int width, int height) {
-  pm::VideoFormat f;
-  f.code = code;
-  f.width = static_cast<std::int16_t>(width);
-  f.height = static_cast<std::int16_t>(height);
-  return f;
+  return pmtest::VideoFormatOf(code, width, height);
 }
 
 TEST(FrameFormats, StridesAndSizesOfEveryCode) {

@@ -9,6 +9,7 @@
 #include "pm/task/callbacks.h"
 #include "support/host_link.h"
 #include "support/log_capture.h"
+#include "support/video_format.h"
 #include "support/wait.h"
 
 namespace {
@@ -53,11 +54,7 @@ class QueueTest : public ::testing::Test, public Fixture {
 };
 
 pm::VideoFormat Video(std::uint32_t code, int width, int height) {
-  pm::VideoFormat format;
-  format.code = code;
-  format.width = static_cast<std::int16_t>(width);
-  format.height = static_cast<std::int16_t>(height);
-  return format;
+  return pmtest::VideoFormatOf(code, width, height);
 }
 
 TEST(SourceNotifications, CarryExactlyTheirKeysAndTypes) {

@@ -4,6 +4,8 @@
 
 #include <gtest/gtest.h>
 
+#include "support/video_format.h"
+
 #include <cstring>
 #include <functional>
 #include <memory>
@@ -26,11 +28,7 @@ struct Bytes {
 };
 
 pm::VideoFormat Format(std::uint32_t code, int width, int height) {
-  pm::VideoFormat f;
-  f.code = code;
-  f.width = static_cast<std::int16_t>(width);
-  f.height = static_cast<std::int16_t>(height);
-  return f;
+  return pmtest::VideoFormatOf(code, width, height);
 }
 
 // A video buffer over plain memory that counts its mappings.
