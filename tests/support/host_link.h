@@ -22,9 +22,8 @@ class HostLink {
 
   // The dispatcher the code under test sends on (started).
   const std::shared_ptr<pm::RpcDispatcher>& Dispatcher() const { return dispatcher_; }
-  // The next message the task sent, or nullopt after `timeoutMs`.
-  std::optional<nlohmann::json> Read(std::int64_t timeoutMs = 5000);
-  // Reads messages until one has "pm::command" == command.
+  // Reads messages until one has "pm::command" == command; nullopt when none
+  // comes within `timeoutMs`.
   std::optional<nlohmann::json> ReadCommand(const std::string& command, std::int64_t timeoutMs = 5000);
 
  private:

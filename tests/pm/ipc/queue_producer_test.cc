@@ -113,10 +113,15 @@ struct Fixture : ::testing::Test {
 using ProducerRecord = Fixture;
 
 // A record is its token (little-endian) and the record bytes, written as one
-// block from any number of entries; entries that do not add up to the record
-// size, or miss their bytes, write nothing and take no token.
+// block from any number of entries to each reader once; entries that do not
+// add up to the record size, or miss their bytes, write nothing and take no
+// token.
 TEST_F(ProducerRecord, IsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
   auto reader = Add();
+  // The same connection again, or none, is refused: one record goes out, not two.
+  EXPECT_FALSE(producer.AddConnection(reader->task));
+  EXPECT_FALSE(producer.AddConnection(nullptr));
+  EXPECT_EQ(producer.ReaderCount(), 1u);
   EXPECT_FALSE(producer.Send(1, {{record.data(), 59}}));
   EXPECT_FALSE(producer.Send(2, {{record.data(), 60}, {record.data(), 1}}));
   EXPECT_FALSE(producer.Send(3, {{record.data(), 30}, {nullptr, 30}}));
@@ -132,13 +137,6 @@ TEST_F(ProducerRecord, IsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
   EXPECT_EQ(std::vector<std::uint8_t>(got.begin(), got.begin() + 4), (std::vector<std::uint8_t>{0x44, 0x33, 0x22, 0x11}));
   EXPECT_TRUE(std::equal(record.begin(), record.end(), got.begin() + 4));
   EXPECT_TRUE(reader->Quiet());
-}
-
-TEST_F(ProducerRecord, SendBeforeAnyReaderReleasesDuringTheCall) {
-  EXPECT_TRUE(Send(9));
-  ASSERT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{9}));
-  EXPECT_EQ(releases.ThreadOf(0), std::this_thread::get_id());
-  EXPECT_EQ(producer.PendingCount(), 0u);
 }
 
 // ---------------------------------------------------------------------------
@@ -172,15 +170,19 @@ TEST_F(ProducerTokens, ReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIgnore
   EXPECT_EQ(producer.PendingCount(), 0u);
 }
 
-TEST_F(ProducerTokens, StopReleasesEveryPendingTokenInAscendingOrder) {
+// A record sent before any reader is released during the call; Stop releases
+// every pending token in ascending order, both on the calling thread.
+TEST_F(ProducerTokens, SendBeforeAnyReaderAndStopReleaseOnTheCallingThread) {
+  EXPECT_TRUE(Send(9));
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{9}));
   auto reader = Add();
   for (std::uint32_t token : {30u, 10u, 20u}) ASSERT_TRUE(Send(token));
   producer.Stop();
-  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{10, 20, 30}));
-  for (std::size_t i = 0; i < 3; ++i) EXPECT_EQ(releases.ThreadOf(i), std::this_thread::get_id());
+  EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{9, 10, 20, 30}));
+  for (std::size_t i = 0; i < 4; ++i) EXPECT_EQ(releases.ThreadOf(i), std::this_thread::get_id());
   EXPECT_EQ(producer.PendingCount(), 0u);
   producer.Stop();  // nothing more
-  EXPECT_EQ(releases.Tokens().size(), 3u);
+  EXPECT_EQ(releases.Tokens().size(), 4u);
 }
 
 TEST_F(ProducerTokens, ConcurrentSendersAndReturnsReleaseEachTokenOnce) {
@@ -266,17 +268,6 @@ TEST_F(ProducerTokens, TokenGivenUpWhileItsRecordIsBeingWrittenIsReleasedAfterTh
 
 using ProducerReaders = Fixture;
 
-TEST_F(ProducerReaders, SameConnectionTwiceIsRefused) {
-  auto reader = std::make_unique<Reader>(*server);
-  EXPECT_TRUE(producer.AddConnection(reader->task));
-  EXPECT_FALSE(producer.AddConnection(reader->task));
-  EXPECT_FALSE(producer.AddConnection(nullptr));
-  EXPECT_EQ(producer.ReaderCount(), 1u);
-  ASSERT_TRUE(Send(1));
-  reader->ReadRecord(64);
-  EXPECT_TRUE(reader->Quiet());  // one record, not two
-}
-
 // Returns that arrive while the producer does not watch the reader (before it
 // is added, or while the producer is stopped) are stale: discarded when it
 // starts watching, never taken for returns of later records.
@@ -343,13 +334,11 @@ TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   b->Return(11);
   ASSERT_TRUE(releases.WaitForCount(5));
   EXPECT_EQ(releases.Tokens(), (std::vector<std::uint32_t>{6, 5, 7, 2, 11}));
-}
 
-TEST_F(ProducerReaders, ReaderClosedOnOurSideIsDroppedToo) {
-  auto a = Add();
-  ASSERT_TRUE(Send(3));
-  a->task->Close();
-  ASSERT_TRUE(releases.WaitForCount(1));
+  // A reader closed on our side is dropped too, with what it owed.
+  ASSERT_TRUE(Send(12));
+  b->task->Close();
+  ASSERT_TRUE(releases.WaitForCount(6));
   EXPECT_EQ(producer.ReaderCount(), 0u);
   ExpectNoSpin();
 }

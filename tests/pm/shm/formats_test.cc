@@ -56,13 +56,6 @@ TEST(FrameFormats, StridesAndSizesOfEveryCode) {
   }
 }
 
-TEST(FrameFormats, BytesPerSampleGiveAudioByteSizes) {
-  EXPECT_EQ(2 * 480 * pm::BytesPerSample(pm::kCodeFl32), 3840);
-  EXPECT_EQ(2 * 480 * pm::BytesPerSample(pm::kCodeSowt), 1920);
-  EXPECT_EQ(pm::BytesPerSample(pm::kCodeNV12), 0);
-  EXPECT_EQ(pm::BytesPerSample(0), 0);
-}
-
 TEST(FrameFormats, LayoutPlanesPutsNV12ChromaAfterTheLumaRowsAndNeedsABase) {
   const pm::VideoPlanes none = pm::LayoutPlanes(Format(pm::kCodeNV12, 16, 8), nullptr, 0);
   EXPECT_EQ(none.planeCount, 0);

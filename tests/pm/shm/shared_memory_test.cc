@@ -59,15 +59,6 @@ std::vector<std::string> OurDevShmEntries() {
   return names;
 }
 
-// Maps "/" + name as the host does; null on failure.
-std::uint8_t* HostMap(const std::string& name, std::size_t size) {
-  const int fd = ::shm_open(("/" + name).c_str(), O_RDWR, 0);
-  if (fd < 0) return nullptr;
-  void* view = ::mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-  ::close(fd);
-  return view == MAP_FAILED ? nullptr : static_cast<std::uint8_t*>(view);
-}
-
 class SharedCpuMemoryTest : public testing::Test {
  protected:
   void TearDown() override {
@@ -112,9 +103,11 @@ TEST_F(SharedCpuMemoryTest, AnotherProcessSharesTheSegmentByNameAndOutlivesItsCr
   ASSERT_EQ(::pipe(toChild), 0);
   ASSERT_EQ(::pipe(toParent), 0);
   const pid_t pid = ::fork();
-  if (pid == 0) {
-    std::uint8_t* view = HostMap(name, kSize);
-    if (view == nullptr) ::_exit(10);
+  if (pid == 0) {  // maps "/" + name as the host does
+    const int fd = ::shm_open(("/" + name).c_str(), O_RDWR, 0);
+    void* mapped = fd < 0 ? MAP_FAILED : ::mmap(nullptr, kSize, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+    if (mapped == MAP_FAILED) ::_exit(10);
+    auto* view = static_cast<std::uint8_t*>(mapped);
     for (int i = 0; i < kSize; ++i)
       if (view[i] != static_cast<std::uint8_t>(i * 13)) ::_exit(11);
     std::memcpy(view + 100, "from the host", 13);
@@ -178,8 +171,6 @@ TEST_F(SharedCpuMemoryTest, NamesAreMadeUniqueAndTheOldOneGoesOnReCreate) {
   ASSERT_TRUE(b->Create(std::nullopt, 4096));
   const std::string first = a->GetName(), other = b->GetName(), second = UniqueName();
   EXPECT_NE(first, other);
-  EXPECT_EQ(first.size(), 36u + std::strlen(".net.quillfront.pm"));
-  EXPECT_TRUE(first.ends_with(".net.quillfront.pm"));
   EXPECT_TRUE(DevShmHas(first));
   ASSERT_TRUE(a->Create(second, 8192));
   EXPECT_FALSE(DevShmHas(first));
