@@ -4,7 +4,6 @@
 #include <thread>
 
 #include "pm/runtime/context.h"
-#include "pm/runtime/load_function.h"
 
 namespace {
 
@@ -38,12 +37,6 @@ TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
   auto none = pm::FindSingleton("registry-empty", [] { return nullptr; });
   EXPECT_EQ(none, nullptr);
   EXPECT_EQ(pm::GetContext()->registry.count("registry-empty"), 1u);
-}
-
-TEST(LoadFunction, FindsALibraryFunctionAndReportsMissingOnes) {
-  EXPECT_NE(pm::LoadFunction("libc.so.6", "strlen"), nullptr);
-  EXPECT_EQ(pm::LoadFunction("libc.so.6", "no_such_function_here"), nullptr);
-  EXPECT_EQ(pm::LoadFunction("libno-such-library.so", "strlen"), nullptr);
 }
 
 }  // namespace
