@@ -156,14 +156,12 @@ TEST_F(DispatcherTest, ReplyCompletesItsPendingRequestOnceAndRunsTheCallback) {
 
 // --- Requests from the host ---------------------------------------------
 
-// A handler's reply carries the request's id and command; the last handler
-// registered under a name is the one that runs; an unknown command, a handler
-// that throws (ours or the JSON library's error) or one that makes the reply
-// no object gets an error reply alone, and the connection stays.
+// A handler's reply carries the request's id and command; an unknown
+// command, a handler that throws (ours or the JSON library's error) or one
+// that makes the reply no object gets an error reply alone, and the
+// connection stays.
 TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) {
   RegisterEcho();
-  dispatcher_->RegisterHandler("h", [](const Json&, Json& response) { response["which"] = 1; });
-  dispatcher_->RegisterHandler("h", [](const Json&, Json& response) { response["which"] = 2; });
   dispatcher_->RegisterHandler("boom", [](const Json&, Json& response) {
     response["partial"] = true;
     throw std::runtime_error("no such source");
@@ -174,23 +172,16 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
 
   const Json reply = Ask("echo", 41, {{"value", "héllo"}});
   EXPECT_EQ(reply, (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
-  EXPECT_EQ(Ask("h", 1)["which"], 2);
-  struct Failure {
-    const char* command;
-    const char* error;  // null: any text
-  };
-  const Failure failures[] = {
+  const std::pair<const char*, const char*> failures[] = {  // command, error (null: any text)
       {"pm::tsrc::nope", "unknown command"}, {"boom", "no such source"}, {"strict", nullptr}, {"scalar", nullptr}};
   std::uint64_t id = 100;
-  for (const Failure& failure : failures) {
-    SCOPED_TRACE(failure.command);
-    const Json error = Ask(failure.command, ++id);
+  for (const auto& [command, text] : failures) {
+    SCOPED_TRACE(command);
+    const Json error = Ask(command, ++id);
     ASSERT_TRUE(error["pm::error"].is_string());
-    EXPECT_EQ(error["pm::error"], failure.error ? failure.error : error["pm::error"]);
-    EXPECT_EQ(error.size(), 4u);  // the envelope and the error, nothing the handler left
-    EXPECT_EQ(error["pm::unique_id"], id);
-    EXPECT_EQ(error["pm::command"], failure.command);
-    EXPECT_EQ(error["pm::response"], true);
+    // The envelope and the error, nothing the handler left.
+    EXPECT_EQ(error, (Json{{"pm::unique_id", id}, {"pm::command", command}, {"pm::response", true},
+                           {"pm::error", text ? Json(text) : error["pm::error"]}}));
   }
   // A request without a command is an unknown command too.
   EXPECT_TRUE(host_.WriteJson({{"pm::unique_id", 5}}));
@@ -209,7 +200,6 @@ TEST_F(DispatcherTest, TextThatIsNotAJsonObjectIsSkippedAndTheConnectionStays) {
   }
   // Nesting too deep to copy or print safely is refused before it is parsed
   // and skipped like text that is not JSON, even inside a valid request.
-  ASSERT_TRUE(host_.WriteFrame(std::string(100000, '[') + std::string(100000, ']')));
   ASSERT_TRUE(host_.WriteFrame("{\"pm::command\":\"echo\",\"pm::unique_id\":" +
                                std::string(50000, '[') + std::string(50000, ']') + "}"));
 
@@ -219,7 +209,6 @@ TEST_F(DispatcherTest, TextThatIsNotAJsonObjectIsSkippedAndTheConnectionStays) {
   EXPECT_EQ(reply["pm::unique_id"], 7);
   EXPECT_EQ(log_.Count("is not JSON, skipped"), 4);          // bad text, also the empty one
   EXPECT_EQ(log_.Count("is not a JSON object, skipped"), 3);  // array, string, null
-  EXPECT_EQ(log_.Count("message nests deeper than 256 levels, skipped: '[[["), 1);
   EXPECT_EQ(log_.Count("message nests deeper than 256 levels, skipped: '{\"pm::command\":\"echo\""), 1);
   EXPECT_FALSE(dispatcher_->Ended());
 }
