@@ -27,17 +27,18 @@ class Releases {
   Producer::ReleaseCallback Callback() {
     return [this](std::uint32_t token) {
       std::lock_guard<std::mutex> hold(mutex_);
-      tokens_.push_back(token);
-      threads_.push_back(std::this_thread::get_id());
+      seen_.emplace_back(token, std::this_thread::get_id());
     };
   }
   std::vector<std::uint32_t> Tokens() {
     std::lock_guard<std::mutex> hold(mutex_);
-    return tokens_;
+    std::vector<std::uint32_t> tokens;
+    for (const auto& [token, thread] : seen_) tokens.push_back(token);
+    return tokens;
   }
   std::thread::id ThreadOf(std::size_t i) {
     std::lock_guard<std::mutex> hold(mutex_);
-    return threads_.at(i);
+    return seen_.at(i).second;
   }
   bool WaitForCount(std::size_t n) {
     return pmtest::WaitFor([&] { return Tokens().size() >= n; });
@@ -45,8 +46,7 @@ class Releases {
 
  private:
   std::mutex mutex_;
-  std::vector<std::uint32_t> tokens_;      // guarded by mutex_
-  std::vector<std::thread::id> threads_;   // guarded by mutex_
+  std::vector<std::pair<std::uint32_t, std::thread::id>> seen_;  // guarded by mutex_
 };
 
 // A reader as the host sees it: `host` is its end, `task` the end added to
@@ -59,11 +59,12 @@ struct Reader {
     task = server.AcceptConnection(5000);
     EXPECT_TRUE(host && task);
   }
-  std::vector<std::uint8_t> ReadRecord(std::size_t bytes) {
+  std::vector<std::uint8_t> ReadRecord(std::size_t bytes = 64) {
     std::vector<std::uint8_t> record(bytes);
     EXPECT_TRUE(host->ReadFromSocket(record.data(), bytes, 5000));
     return record;
   }
+  std::uint32_t NextToken() { return pm::LoadLe32(ReadRecord().data()); }
   bool Quiet() {
     std::uint8_t byte;
     return !host->ReadFromSocket(&byte, 1, 20);
@@ -74,10 +75,6 @@ struct Reader {
     EXPECT_TRUE(host->Send({{bytes, 4}}));
   }
 };
-
-std::uint32_t TokenOf(const std::vector<std::uint8_t>& r) {
-  return pm::LoadLe32(r.data());
-}
 
 struct Fixture : ::testing::Test {
   // First, so that it outlives the producer thread, which may log until it
@@ -133,7 +130,7 @@ TEST_F(ProducerRecord, IsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
   EXPECT_TRUE(releases.Tokens().empty());
 
   ASSERT_TRUE(producer.Send(0x11223344, {{record.data(), 24}, {record.data() + 24, 34}, {record.data() + 58, 2}}));
-  const auto got = reader->ReadRecord(64);
+  const auto got = reader->ReadRecord();
   EXPECT_EQ(std::vector<std::uint8_t>(got.begin(), got.begin() + 4), (std::vector<std::uint8_t>{0x44, 0x33, 0x22, 0x11}));
   EXPECT_TRUE(std::equal(record.begin(), record.end(), got.begin() + 4));
   EXPECT_TRUE(reader->Quiet());
@@ -150,8 +147,8 @@ TEST_F(ProducerTokens, ReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIgnore
   auto a = Add();
   auto b = Add();
   ASSERT_TRUE(Send(5));
-  EXPECT_EQ(TokenOf(a->ReadRecord(64)), 5u);
-  EXPECT_EQ(TokenOf(b->ReadRecord(64)), 5u);
+  EXPECT_EQ(a->NextToken(), 5u);
+  EXPECT_EQ(b->NextToken(), 5u);
   a->Return(5);
   a->Return(5);
   a->Return(77);
@@ -190,7 +187,7 @@ TEST_F(ProducerTokens, ConcurrentSendersAndReturnsReleaseEachTokenOnce) {
   auto b = Add();
   constexpr std::uint32_t kPerSender = 200;
   auto echo = [](Reader* r) {
-    for (std::uint32_t n = 0; n < 2 * kPerSender; ++n) r->Return(TokenOf(r->ReadRecord(64)));
+    for (std::uint32_t n = 0; n < 2 * kPerSender; ++n) r->Return(r->NextToken());
   };
   std::vector<std::thread> threads;
   for (Reader* reader : {a.get(), b.get()}) threads.emplace_back(echo, reader);
@@ -279,7 +276,7 @@ TEST_F(ProducerReaders, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
     if (restart) {
       ASSERT_TRUE(producer.AddConnection(reader->task));
       ASSERT_TRUE(Send(1));
-      reader->ReadRecord(64);
+      reader->ReadRecord();
       producer.Stop();  // releases 1
     }
     reader->Return(1);
@@ -292,7 +289,7 @@ TEST_F(ProducerReaders, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
       ASSERT_TRUE(producer.AddConnection(reader->task));
     }
     ASSERT_TRUE(Send(4));
-    reader->ReadRecord(64);
+    reader->ReadRecord();
     reader->Return(4);
     ASSERT_TRUE(releases.WaitForCount(before + 1 + restart));
     EXPECT_EQ(releases.Tokens().back(), 4u);
@@ -305,15 +302,15 @@ TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   auto b = Add();
   for (std::uint32_t token : {7u, 2u, 5u}) ASSERT_TRUE(Send(token));
   for (int i = 0; i < 3; ++i) {
-    a->ReadRecord(64);
-    b->ReadRecord(64);
+    a->ReadRecord();
+    b->ReadRecord();
   }
   b->Return(5);
   b->Return(7);
   // Let b's returns be taken before a goes (a 6th token round trip as marker).
   ASSERT_TRUE(Send(6));
-  a->ReadRecord(64);
-  b->ReadRecord(64);
+  a->ReadRecord();
+  b->ReadRecord();
   a->Return(6);
   b->Return(6);
   ASSERT_TRUE(releases.WaitForCount(1));
@@ -329,7 +326,7 @@ TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
 
   // New records go to b alone, and b's return alone releases them.
   ASSERT_TRUE(Send(11));
-  b->ReadRecord(64);
+  b->ReadRecord();
   b->Return(2);
   b->Return(11);
   ASSERT_TRUE(releases.WaitForCount(5));
