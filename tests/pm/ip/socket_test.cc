@@ -74,7 +74,6 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   Listening b;
   EXPECT_GT(a.port(), 0);
   EXPECT_NE(a.port(), b.port());
-  EXPECT_EQ(a.acceptor.GetPort(), a.port());
 
   Socket second;
   ASSERT_TRUE(second.Init(a.port()));
@@ -92,7 +91,7 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   EXPECT_TRUE(log.Contains("Socket::Connect Failed : [errno=111,wsa=111]"));
 }
 
-TEST(SocketAccept, ConnectedEndsAreBlockingWithoutNagleAndKnowThePeersPort) {
+TEST(SocketAccept, ConnectedEndsAreBlockingWithoutNagleOnANonBlockingListener) {
   Pair pair;
   for (Socket* s : {&pair.client, &pair.server}) {
     int on = 0;
@@ -101,10 +100,6 @@ TEST(SocketAccept, ConnectedEndsAreBlockingWithoutNagleAndKnowThePeersPort) {
     EXPECT_NE(on, 0);
     EXPECT_EQ(::fcntl(s->GetHandle(), F_GETFL) & O_NONBLOCK, 0);
   }
-  sockaddr_in local{};
-  socklen_t length = sizeof(local);
-  ASSERT_EQ(::getsockname(pair.client.GetHandle(), reinterpret_cast<sockaddr*>(&local), &length), 0);
-  EXPECT_EQ(pair.server.StoredPort(), ntohs(local.sin_port));
   EXPECT_EQ(::fcntl(pair.listening.acceptor.GetHandle(), F_GETFL) & O_NONBLOCK, O_NONBLOCK);
 }
 
