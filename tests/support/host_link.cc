@@ -35,8 +35,4 @@ bool QueueReader::ReturnToken(std::uint32_t token) {
   return connection_->Send(std::move(list));
 }
 
-void QueueReader::Close() {
-  if (connection_) connection_->Close();
-}
-
 }  // namespace pmtest

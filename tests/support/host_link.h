@@ -40,7 +40,6 @@ class QueueReader {
   // Reads one record; false on timeout or a closed connection.
   bool ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs = 5000);
   bool ReturnToken(std::uint32_t token);
-  void Close();
 
  private:
   std::shared_ptr<pm::ipc::Connection> connection_;
