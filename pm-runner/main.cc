@@ -250,10 +250,12 @@ int main(int argc, char** argv) {
         pm::Log(pm::LogType::Normal, "", "pm-runner: AttachDispatcher threw: %s\n", e.what());
       }
       dispatchers.push_back(dispatcher);
-      // Receiving starts once the task's handlers are registered, so that no
-      // early request finds its command missing.
-      dispatcher->Start([] { Wake('E'); });
     }
+    // Receiving starts once the task's handlers are registered, so that no
+    // early request finds its command missing, and once the task holds every
+    // dispatcher: a request on one connection that stops the task must stop
+    // them all, or the runner would wait for a connection nobody ends.
+    for (const auto& dispatcher : dispatchers) dispatcher->Start([] { Wake('E'); });
   }
 
   WaitForTheEnd(dispatchers);
