@@ -26,86 +26,76 @@ bool ScriptedInitialize() {
 const char* ScriptedVersion() { return "scripted 9.9"; }
 void ScriptedDestroy() { ++g_destroyCalls; }
 
-class FactoryTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    g_cpuSupported = true;
-    g_initializeResult = true;
+std::shared_ptr<const TaskNDISource::NdiApi> ScriptedApi() {
+  auto api = std::make_shared<TaskNDISource::NdiApi>();
+  api->is_supported_CPU = ScriptedCpu;
+  api->initialize = ScriptedInitialize;
+  api->version = ScriptedVersion;
+  api->destroy = ScriptedDestroy;
+  return api;
+}
+
+TEST(Factory, GivesATaskOnlyOnAUsableRuntimeAndShutsTheRuntimeDownOnceForEach) {
+  const struct {
+    bool cpu, initializes;
+    int initializeCalls;
+    const char* line;
+  } cases[] = {
+      {false, true, 0, "#ndisource: failed initialization. CPU not supported\n"},
+      {true, false, 1, "#ndisource: failed initialization.\n"},
+      {true, true, 1, "#ndisource: Initialized NDIlib (scripted 9.9)\n"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.line);
+    g_cpuSupported = c.cpu;
+    g_initializeResult = c.initializes;
     g_initializeCalls = 0;
     g_destroyCalls = 0;
-    auto api = std::make_shared<TaskNDISource::NdiApi>();
-    api->is_supported_CPU = ScriptedCpu;
-    api->initialize = ScriptedInitialize;
-    api->version = ScriptedVersion;
-    api->destroy = ScriptedDestroy;
-    api_ = api;
+    pmtest::LogCapture log;
+    pm::TaskBase* base = TaskNDISource::MakeTask(ScriptedApi());
+    EXPECT_EQ(log.Lines(), std::vector<std::string>{c.line});
+    EXPECT_EQ(g_initializeCalls.load(), c.initializeCalls);
+    EXPECT_EQ(g_destroyCalls.load(), base ? 0 : 1);
+    if (!c.cpu || !c.initializes) {
+      EXPECT_EQ(base, nullptr);
+      continue;
+    }
+    auto* task = dynamic_cast<TaskNDISource::NDISourceTask*>(base);
+    ASSERT_NE(task, nullptr);
+    EXPECT_TRUE(task->HasSourceFactory() && task->HasDiscoveryFactory());
+    // Shutdown of an idle task touches no runtime, and the destructor (through
+    // the base, as the runner ends it) shuts the runtime down once.
+    base->Shutdown();
+    EXPECT_EQ(g_destroyCalls.load(), 0);
+    delete base;
+    EXPECT_EQ(g_destroyCalls.load(), 1);
   }
-  std::shared_ptr<const TaskNDISource::NdiApi> api_;
-};
-
-TEST_F(FactoryTest, UnsupportedProcessorGivesNoTaskAndShutsTheRuntimeDownOnce) {
-  g_cpuSupported = false;
-  pmtest::LogCapture log;
-  EXPECT_EQ(TaskNDISource::MakeTask(api_), nullptr);
-  EXPECT_EQ(g_initializeCalls.load(), 0);
-  EXPECT_EQ(g_destroyCalls.load(), 1);
-  EXPECT_EQ(log.Lines(), std::vector<std::string>{"#ndisource: failed initialization. CPU not supported\n"});
 }
 
-TEST_F(FactoryTest, FailedInitialisationGivesNoTaskAndShutsTheRuntimeDownOnce) {
-  g_initializeResult = false;
-  pmtest::LogCapture log;
-  EXPECT_EQ(TaskNDISource::MakeTask(api_), nullptr);
-  EXPECT_EQ(g_destroyCalls.load(), 1);
-  EXPECT_EQ(log.Lines(), std::vector<std::string>{"#ndisource: failed initialization.\n"});
-}
-
-TEST_F(FactoryTest, SuccessLogsOneLineInstallsBothFactoriesAndDestroysOnce) {
-  pmtest::LogCapture log;
-  pm::TaskBase* base = TaskNDISource::MakeTask(api_);
-  ASSERT_NE(base, nullptr);
-  EXPECT_EQ(log.Lines(), std::vector<std::string>{"#ndisource: Initialized NDIlib (scripted 9.9)\n"});
-  auto* task = dynamic_cast<TaskNDISource::NDISourceTask*>(base);
-  ASSERT_NE(task, nullptr);
-  EXPECT_TRUE(task->HasSourceFactory());
-  EXPECT_TRUE(task->HasDiscoveryFactory());
-  EXPECT_EQ(g_destroyCalls.load(), 0);
-  // Shutdown of an idle task touches no runtime, and the destructor (through
-  // the base, as the runner ends it) shuts the runtime down once.
-  base->Shutdown();
-  EXPECT_EQ(g_destroyCalls.load(), 0);
-  delete base;
-  EXPECT_EQ(g_destroyCalls.load(), 1);
-  EXPECT_EQ(g_initializeCalls.load(), 1);
-}
-
-TEST(FactoryLibrary, MissingLibraryIsNamedInOneLine) {
-  pmtest::LogCapture log;
-  EXPECT_EQ(TaskNDISource::MakeTaskFromLibrary("/nonexistent/libno-such-ndi.so"), nullptr);
-  ASSERT_EQ(log.Lines().size(), 1u);
-  EXPECT_EQ(log.Lines()[0].rfind("#ndisource: ", 0), 0u);
-  EXPECT_TRUE(log.Contains("/nonexistent/libno-such-ndi.so"));
-}
-
+// A library that is missing or lacks a function is named in the one line.
+TEST(FactoryLibrary, GivesATaskOnlyOnACompleteLibraryAfterOneLineSayingWhy) {
+  const struct {
+    std::string path, text;  // the one line starts "#ndisource: " and holds text
+    bool task;
+  } cases[] = {
+      {"/nonexistent/libno-such-ndi.so", "/nonexistent/libno-such-ndi.so", false},
 #ifdef STUB_RUNTIME_PARTIAL_PATH
-TEST(FactoryLibrary, MissingSymbolIsNamedInOneLine) {
-  pmtest::LogCapture log;
-  EXPECT_EQ(TaskNDISource::MakeTaskFromLibrary(STUB_RUNTIME_PARTIAL_PATH), nullptr);
-  ASSERT_EQ(log.Lines().size(), 1u);
-  const std::string line = log.Lines()[0];
-  EXPECT_EQ(line.rfind("#ndisource: ", 0), 0u);
-  EXPECT_NE(line.find("lacks 'NDIlib_"), std::string::npos) << line;
-}
+      {STUB_RUNTIME_PARTIAL_PATH, "lacks 'NDIlib_", false},
 #endif
-
 #ifdef STUB_RUNTIME_COMPLETE_PATH
-TEST(FactoryLibrary, CompleteLibraryGivesATaskAfterOneInitialisationLine) {
-  pmtest::LogCapture log;
-  pm::TaskBase* task = TaskNDISource::MakeTaskFromLibrary(STUB_RUNTIME_COMPLETE_PATH);
-  ASSERT_NE(task, nullptr);
-  EXPECT_EQ(log.Lines(), std::vector<std::string>{"#ndisource: Initialized NDIlib (stub 1.0)\n"});
-  delete task;
-}
+      {STUB_RUNTIME_COMPLETE_PATH, "Initialized NDIlib (stub 1.0)\n", true},
 #endif
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.path);
+    pmtest::LogCapture log;
+    pm::TaskBase* task = TaskNDISource::MakeTaskFromLibrary(c.path.c_str());
+    EXPECT_EQ(task != nullptr, c.task);
+    EXPECT_EQ(log.Lines().size(), 1u);
+    EXPECT_EQ(log.Lines().at(0).rfind("#ndisource: ", 0), 0u);
+    EXPECT_TRUE(log.Contains(c.text)) << log.Lines()[0];
+    delete task;
+  }
+}
 
 }  // namespace

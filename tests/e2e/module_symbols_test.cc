@@ -20,29 +20,25 @@ bool LinkerOrRuntimeName(const std::string& name) {
 }
 
 TEST(TaskModule, ExportsOnlyTheFactory) {
-  const std::string command = std::string("nm -D --defined-only '") + PM_MODULE_PATH + "' 2>&1";
+  // One line per symbol: name, type, value, size.
+  const std::string command = std::string("nm -D --defined-only -P '") + PM_MODULE_PATH + "' 2>&1";
   FILE* pipe = ::popen(command.c_str(), "r");
   ASSERT_NE(pipe, nullptr);
   std::string output;
   char buffer[4096];
-  std::size_t n = 0;
-  while ((n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0) output.append(buffer, n);
+  for (std::size_t n; (n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0;) output.append(buffer, n);
   ASSERT_EQ(::pclose(pipe), 0) << output;
 
   std::istringstream lines(output);
-  std::string line;
-  bool factory = false;
-  while (std::getline(lines, line)) {
-    if (line.empty()) continue;
-    const std::string name = line.substr(line.find_last_of(' ') + 1);
+  std::string factoryType;
+  for (std::string name, type, rest; lines >> name >> type && std::getline(lines, rest);) {
     if (name == "pmTask_Factory") {
-      factory = true;
-      EXPECT_NE(line.find(" T "), std::string::npos) << line;
-      continue;
+      factoryType = type;
+    } else {
+      EXPECT_TRUE(LinkerOrRuntimeName(name)) << "exported: " << name << " " << type;
     }
-    EXPECT_TRUE(LinkerOrRuntimeName(name)) << "exported: " << line;
   }
-  EXPECT_TRUE(factory) << output;
+  EXPECT_EQ(factoryType, "T") << output;
 }
 
 }  // namespace

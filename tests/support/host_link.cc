@@ -4,28 +4,18 @@ namespace pmtest {
 
 HostLink::HostLink() {
   HostListener listener;
-  std::shared_ptr<pm::ipc::Connection> task = pm::ipc::Connection::Open(listener.Port());
+  dispatcher_ = std::make_shared<pm::RpcDispatcher>(pm::ipc::Connection::Open(listener.Port()));
   host_ = listener.Accept();
-  dispatcher_ = std::make_shared<pm::RpcDispatcher>(task);
   dispatcher_->Start();
 }
 
-HostLink::~HostLink() {
-  dispatcher_->Stop();
-  host_.Close();
-}
-
-std::optional<nlohmann::json> HostLink::Read(std::int64_t timeoutMs) {
-  nlohmann::json message = host_.ReadJson(std::chrono::milliseconds(timeoutMs));
-  if (message.is_discarded()) return std::nullopt;
-  return message;
-}
+HostLink::~HostLink() { dispatcher_->Stop(); }
 
 std::optional<nlohmann::json> HostLink::ReadCommand(const std::string& command, std::int64_t timeoutMs) {
   for (;;) {
-    auto message = Read(timeoutMs);
-    if (!message) return std::nullopt;
-    if (message->value("pm::command", "") == command) return message;
+    const nlohmann::json message = host_.ReadJson(std::chrono::milliseconds(timeoutMs));
+    if (message.is_discarded()) return std::nullopt;
+    if (message.value("pm::command", "") == command) return message;
   }
 }
 
@@ -43,10 +33,6 @@ bool QueueReader::ReturnToken(std::uint32_t token) {
   pm::BufferList list;
   list.emplace_back(&token, 4u);
   return connection_->Send(std::move(list));
-}
-
-void QueueReader::Close() {
-  if (connection_) connection_->Close();
 }
 
 }  // namespace pmtest

@@ -22,9 +22,8 @@ class HostLink {
 
   // The dispatcher the code under test sends on (started).
   const std::shared_ptr<pm::RpcDispatcher>& Dispatcher() const { return dispatcher_; }
-  // The next message the task sent, or nullopt after `timeoutMs`.
-  std::optional<nlohmann::json> Read(std::int64_t timeoutMs = 5000);
-  // Reads messages until one has "pm::command" == command.
+  // Reads messages until one has "pm::command" == command; nullopt when none
+  // comes within `timeoutMs`.
   std::optional<nlohmann::json> ReadCommand(const std::string& command, std::int64_t timeoutMs = 5000);
 
  private:
@@ -41,7 +40,6 @@ class QueueReader {
   // Reads one record; false on timeout or a closed connection.
   bool ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs = 5000);
   bool ReturnToken(std::uint32_t token);
-  void Close();
 
  private:
   std::shared_ptr<pm::ipc::Connection> connection_;

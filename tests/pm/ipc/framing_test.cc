@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <cstring>
 #include <string>
 #include <vector>
 
@@ -77,22 +76,6 @@ TEST(FrameReader, ExactLimitIsAcceptedOneByteMoreStopsTheStreamForGood) {
     EXPECT_EQ(reader.Feed(stream.data() + before.size() + 4, 9), 0u);
     EXPECT_EQ(Drain(reader), Messages{"ok"});
   }
-}
-
-TEST(FrameReader, ExactBlockReadsThroughWritePointer) {
-  // The way the receive loop uses it: read exactly Wanted() bytes into
-  // WritePointer(), possibly in parts, then Commit.
-  const std::string stream = EncodeFrame("abc") + EncodeFrame("");
-  FrameReader reader;
-  for (std::size_t at = 0; at < stream.size();) {
-    ASSERT_GT(reader.Wanted(), 0u);
-    const std::size_t n = std::min<std::size_t>(reader.Wanted(), 2);  // short reads
-    std::memcpy(reader.WritePointer(), stream.data() + at, n);
-    reader.Commit(n);
-    at += n;
-  }
-  EXPECT_EQ(Drain(reader), (Messages{"abc", ""}));
-  EXPECT_EQ(reader.Wanted(), 4u);
 }
 
 }  // namespace

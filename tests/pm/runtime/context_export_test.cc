@@ -24,12 +24,4 @@ TEST(ContextWithExport, IsTheExportedBlockMarkedFromHost) {
   EXPECT_EQ(g_calls, 1);  // looked up once, then cached
 }
 
-TEST(ContextWithExport, TheHostsSinkReceivesTheLines) {
-  std::string seen;
-  pm::GetContext()->logSink = [&](pm::LogType, const char* line) { seen += line; };
-  pm::Log(pm::LogType::Normal, "", "to the host %d", 1);
-  pm::GetContext()->logSink = nullptr;
-  EXPECT_EQ(seen, "to the host 1\n");
-}
-
 }  // namespace

@@ -69,11 +69,8 @@ TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
   }
 }
 
-TEST(Parse, ValidTextKeepsKeysInByteOrder) {
-  const Json j = pmjson::Parse("{\"b\":1,\"a\":[true,null],\"B\":2.5}", "x");
-  EXPECT_EQ(pmjson::Dump(j), "{\"B\":2.5,\"a\":[true,null],\"b\":1}");
-  EXPECT_NO_THROW(pmjson::Dump(Json(std::string("a\xFF"))));  // names from the network need not be UTF-8
-}
+// Names from the network need not be UTF-8.
+TEST(Dump, PrintsTextThatIsNotUtf8) { EXPECT_NO_THROW(pmjson::Dump(Json(std::string("a\xFF")))); }
 
 struct Row {
   Json value;

@@ -46,22 +46,6 @@ TEST(Log, LongLinesAreDeliveredWholeByBothEntryPointsAndLeaveNothingBehind) {
   EXPECT_EQ(capture.Lines(), expected);
 }
 
-// The sink gets the level, and a complete line without a tag is handed
-// through as it is, without a copy.
-TEST(LogSink, GetsTheLevelAndACompleteUntaggedLineUncopied) {
-  pm::Context* context = pm::GetContext();
-  auto previous = context->logSink;
-  std::vector<std::pair<int, const char*>> seen;
-  context->logSink = [&](LogType level, const char* line) { seen.emplace_back(static_cast<int>(level), line); };
-  const char* text = "abc\n";
-  Log(LogType::Normal, "", "a");
-  LogText("", text);
-  context->logSink = previous;
-  ASSERT_EQ(seen.size(), 2u);
-  EXPECT_EQ(seen[0].first, 100);
-  EXPECT_EQ(seen[1], std::make_pair(100, text));
-}
-
 TEST(LogSink, DefaultServesAnEmptySlotWithoutWritingIt) {
   pm::Context* context = pm::GetContext();
   auto previous = context->logSink;

@@ -39,10 +39,7 @@ TEST(FrameFormats, StridesAndSizesOfEveryCode) {
       {pm::kCodeRgba, 4, 10, -16, 16, 0},
       {pm::kCodeJpeg, 100, 10, 0, 400, 4000},
       // Codes without a frame layout of their own.
-      {0, 1920, 1080, 0, 0, 0},
       {pm::kCodeI420, 1920, 1080, 4096, 0, 0},
-      {pm::kCodeBGRX, 1920, 1080, 0, 0, 0},
-      {pm::kCodeFl32, 1920, 1080, 4096, 0, 0},
       {0xFFFFFFFFu, 1920, 1080, 0, 0, 0},
   };
   for (const Row& row : rows) {
@@ -52,13 +49,6 @@ TEST(FrameFormats, StridesAndSizesOfEveryCode) {
     EXPECT_EQ(pm::DefaultStride(format), row.defaultStride);
     EXPECT_EQ(pm::FrameSize(format, row.stride), row.size);
   }
-}
-
-TEST(FrameFormats, BytesPerSampleGiveAudioByteSizes) {
-  EXPECT_EQ(2 * 480 * pm::BytesPerSample(pm::kCodeFl32), 3840);
-  EXPECT_EQ(2 * 480 * pm::BytesPerSample(pm::kCodeSowt), 1920);
-  EXPECT_EQ(pm::BytesPerSample(pm::kCodeNV12), 0);
-  EXPECT_EQ(pm::BytesPerSample(0), 0);
 }
 
 TEST(FrameFormats, LayoutPlanesPutsNV12ChromaAfterTheLumaRowsAndNeedsABase) {
