@@ -1,6 +1,6 @@
-// Settings-dialog widgets: what FromJson reads, pop-up
-// validation and selection, FromGui, and a whole dialog round trip with its
-// exact JSON.
+// Settings-dialog widgets: what FromJson reads, pop-up validation and
+// selection, FromGui, and a whole dialog round trip (the exact text of such a
+// dialog is pinned by the NDI source's panel test).
 #include <gtest/gtest.h>
 
 #include "pm/cfg/object.h"
@@ -55,18 +55,13 @@ TEST(WidgetFromJson, ReadsOnlyValue) {
   EXPECT_EQ(gui.status.title.value, "p_status_label");
   gui.status.FromJson(Json::parse(R"({"value":["a",2,true]})"));  // an array: its last element
   EXPECT_EQ(gui.status.value.value, "1");
-}
-
-TEST(WidgetFromJson, MissingValueOrNonObjectLeavesTheValue) {
-  SourceGui gui;
-  gui.status.value = "kept";
-  gui.bandwidth.value = 2;
+  // Without a value, or not an object: the value stays.
   for (const Json& in : {Json::object({{"title", "x"}}), Json("value"), Json::array({Json{{"value", "x"}}}),
                          Json(nullptr)}) {
     gui.status.FromJson(in);
     gui.bandwidth.FromJson(in);
   }
-  EXPECT_EQ(gui.status.value.value, "kept");
+  EXPECT_EQ(gui.status.value.value, "1");
   EXPECT_EQ(gui.bandwidth.value.value, 2);
 }
 
@@ -135,33 +130,10 @@ TEST(Popup, IndexValidationSelectionAndReading) {
 // ---------------------------------------------------------------------------
 // FromGui
 
-TEST(FromGui, CopiesTheValueOfTheWidgetWithTheMembersKey) {
-  struct Cfg : pm::cfg::Configuration {
-    Cfg() : Configuration(nullptr, "", "configuration", false) {}
-    pm::cfg::MemberT<std::string> status{this, "status", "old"};
-    pm::cfg::MemberT<std::int64_t> bandwidth{this, "bandwidth", 9};
-    pm::cfg::MemberT<std::string> untouched{this, "untouched", "same"};
-  } cfg;
-  SourceGui gui;
-  gui.status.value = "ndi_state_idle";
-  gui.bandwidth.value = 2;
-  cfg.FromGui(gui);
-  EXPECT_EQ(cfg.status.value, "ndi_state_idle");
-  EXPECT_EQ(cfg.bandwidth.value, 2);
-  EXPECT_EQ(cfg.untouched.value, "same");
-}
-
-TEST(FromGui, WidgetWithoutValueClearsTheMember) {
-  struct Cfg : pm::cfg::Configuration {
-    Cfg() : Configuration(nullptr, "", "configuration", false) {}
-    pm::cfg::MemberT<std::string> reconnect{this, "reconnect", "x"};
-  } cfg;
-  SourceGui gui;
-  cfg.FromGui(gui);
-  EXPECT_EQ(cfg.reconnect.value, "");
-}
-
-TEST(FromGui, TakesTheFirstWidgetAndSkipsNonWidgetsAndGrandchildren) {
+// A member takes the value of the first direct child widget with its key
+// (byte for byte), is cleared by a widget without a value, and is kept when
+// only a non-widget or a grandchild has its key.
+TEST(FromGui, CopiesTheValueOfTheFirstWidgetWithTheMembersKey) {
   struct Plain : pm::cfg::Object {
     explicit Plain(Object* parent) : Object(parent, "", "k", false) {}
     pm::cfg::MemberT<std::string> value{this, "value", "not a widget"};
@@ -170,11 +142,12 @@ TEST(FromGui, TakesTheFirstWidgetAndSkipsNonWidgetsAndGrandchildren) {
     explicit Group(Object* parent) : Object(parent, "", "group", false) {}
     pm::cfg::StaticText nested{this, "deep", "t"};
   };
-  struct G : pm::cfg::Gui {
-    G() : Gui(nullptr, "", "gui", true) {
+  struct G : SourceGui {
+    G() {
       first.value = "first";
       second.value = "second";
       group.nested.value = "grandchild";
+      bandwidth.value = 2;
     }
     Plain plain{this};
     pm::cfg::StaticText first{this, "k", "t"};
@@ -185,12 +158,16 @@ TEST(FromGui, TakesTheFirstWidgetAndSkipsNonWidgetsAndGrandchildren) {
     Cfg() : Configuration(nullptr, "", "configuration", false) {}
     pm::cfg::MemberT<std::string> k{this, "k", ""};
     pm::cfg::MemberT<std::string> deep{this, "deep", "kept"};
-    pm::cfg::MemberT<std::string> K{this, "K", "kept"};  // keys match byte for byte
+    pm::cfg::MemberT<std::string> K{this, "K", "kept"};
+    pm::cfg::MemberT<std::int64_t> bandwidth{this, "bandwidth", 9};
+    pm::cfg::MemberT<std::string> reconnect{this, "reconnect", "x"};
   } cfg;
   cfg.FromGui(gui);
   EXPECT_EQ(cfg.k.value, "first");
   EXPECT_EQ(cfg.deep.value, "kept");
   EXPECT_EQ(cfg.K.value, "kept");
+  EXPECT_EQ(cfg.bandwidth.value, 2);
+  EXPECT_EQ(cfg.reconnect.value, "");
 }
 
 // ---------------------------------------------------------------------------
@@ -206,20 +183,6 @@ TEST(RoundTrip, HostEditedDialogBecomesConfigurationAndBack) {
   gui.status.indication = pm::cfg::VisualIndication::Error;
   gui.video.value = "1920x1080 @ 29.97 fps";
   const std::string sent = pmjson::Dump(Write(gui));
-  EXPECT_EQ(sent,
-            R"({"audio":{"ghosted":false,"indication":0,"justification":108,"pm::order":4,)"
-            R"("title":"ndi_audio_status_label","type":"static_text","value":"","visible":true},)"
-            R"("bandwidth":{"ghosted":false,"pm::order":0,"title":"ndi_bandwidth_label","type":"popup",)"
-            R"("value":1,"valueSetID":"","values":["ndi_bandwidth_highest","ndi_bandwidth_lowest",)"
-            R"("ndi_bandwidth_audio_only"],"visible":true},)"
-            R"("reconnect":{"action":1668641652,"command":"taskndisource::reconnect","ghosted":false,)"
-            R"("pm::order":1,"title":"ndi_reconnect_button","type":"button","visible":true},)"
-            R"("status":{"ghosted":false,"indication":101,"justification":108,"pm::order":2,)"
-            R"("title":"p_status_label","type":"static_text","value":"taskvistafeed_status_error",)"
-            R"("visible":true},)"
-            R"("video":{"ghosted":false,"indication":0,"justification":108,"pm::order":3,)"
-            R"("title":"ndi_video_status_label","type":"static_text","value":"1920x1080 @ 29.97 fps",)"
-            R"("visible":true}})");
 
   // Reading our own text back into a fresh dialog takes every value; the
   // indication is the task's to set, not the host's.
