@@ -240,13 +240,9 @@ class FakeVideoBuffer : public pm::VideoBuffer {
  public:
   explicit FakeVideoBuffer(const pm::VideoFormat& format)
       : format_(format), memory(static_cast<std::size_t>(RowBytes()) * static_cast<std::size_t>(Rows())) {}
-  pm::VideoPlanes Planes() override {
-    pm::VideoPlanes planes;
-    planes.planeCount = 1;
-    planes.plane[0] = pm::Plane{memory.data(), Rows(), RowBytes()};
-    return planes;
-  }
-  std::pair<std::uint8_t*, std::int32_t> MapData() override { return {memory.data(), RowBytes()}; }
+  // The intake only copies whole frames.
+  pm::VideoPlanes Planes() override { return {}; }
+  std::pair<std::uint8_t*, std::int32_t> MapData() override { return {nullptr, 0}; }
   void UnmapData() override {}
   pm::VideoFormat Format() const override { return format_; }
   // Copies height rows (and NV12's chroma rows) of one row of the format
