@@ -47,32 +47,9 @@ TEST_F(DiscoveryTest, ScansAfter125MsThenDoublingTo4s) {
   EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
 }
 
-TEST_F(DiscoveryTest, SenderIsAnnouncedOnceWhileItStaysAndAnewAfterItVanished) {
-  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
-  discovery->Start();
-  NextScan();
-  NextScan();
-  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)"});
-  EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: STUDIO (Cam 1) (127.0.0.1:1)\n"), 1);
-  const pm::SourceInfo info = callbacks->Infos().at(0);
-  EXPECT_EQ(info.produces, 3u);
-  EXPECT_EQ(info.maximumLatencySeconds, 1.0);
-
-  ndi.SetSources({});
-  NextScan();
-  EXPECT_EQ(callbacks->Calls().back(), "-NDICaptureDevice~STUDIO (Cam 1)");
-  NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 2u);
-
-  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
-  NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 3u);
-  EXPECT_EQ(callbacks->Calls().back(), "+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)");
-  EXPECT_EQ(logs.Count("Discovered NDI Source"), 2);
-}
-
-// Senders are told apart by URL, so two with one name are two entries with
-// one id. Within a scan every withdrawal comes first, and an id that an entry
+// A sender is announced once while it stays, withdrawn once, and announced
+// anew when it is back. Senders are told apart by URL, so two with one name
+// are two entries with one id. Within a scan every withdrawal comes first, and an id that an entry
 // still carries afterwards is announced again: the last word about a present
 // sender is "available", whatever order the table walks its URLs in (each
 // move is scripted both ways round).
@@ -90,13 +67,15 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
       {"first of two sharing a name vanished", {{at1, at2}, {at2}}, {on, on, off, on}},
       {"second of two sharing a name vanished", {{at1, at2}, {at1}}, {on, on, off, on}},
       {"both of two vanished", {{at1, at2}, {}, {}}, {on, on, off, off}},
-      {"vanished", {{at1}, {}, {}}, {on, off}},
+
       {"entries without name or url are ignored",
        {{Entry{std::nullopt, "10.0.0.1:1"}, Entry{"B (y)", std::nullopt}, Entry{"", "10.0.0.3:1"}, Entry{"C (z)", ""}, at1}},
        {on}},
+      {"stays, vanishes and comes back", {{at1}, {at1}, {}, {}, {at1}}, {on, off, on}},
   };
   for (const Script& script : scripts) {
     SCOPED_TRACE(script.name);
+    logs.Clear();
     auto calls = std::make_shared<nditest::FakeDiscoveryCallbacks>();
     Discovery fresh(calls, ndi.Api(), env.Make());
     for (const std::vector<Entry>& scan : script.scans) {
@@ -104,7 +83,13 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
       ASSERT_TRUE(fresh.ScanOnce(reinterpret_cast<void*>(0x10)));
     }
     EXPECT_EQ(calls->Calls(), script.calls);
+    for (const pm::SourceInfo& info : calls->Infos()) {
+      EXPECT_EQ(info.produces, 3u);
+      EXPECT_EQ(info.maximumLatencySeconds, 1.0);
+    }
   }
+  // Of the last script: one line for each announcement.
+  EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: A (x) (10.0.0.1:1)\n"), 2);
 }
 
 TEST_F(DiscoveryTest, StopEndsAWaitAndARestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
