@@ -120,6 +120,9 @@ TEST_F(IntakeTest, BadVideoFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{line});
   }
   EXPECT_TRUE(callbacks->Seen().calls.empty());
+  // The largest describable frame is taken.
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCNV12, 32767, 1, 32767)));
+  EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).width, 32767);
   callbacks->SetDry(true, false);
   EXPECT_FALSE(Video(nditest::AnyVideo()));
   EXPECT_TRUE(logs.Contains("#ndisource: video well ran dry\n"));
@@ -131,7 +134,7 @@ TEST_F(IntakeTest, BadVideoFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
   bigger.height = 1080;
   callbacks->OverrideVideoFormat(bigger);
   EXPECT_FALSE(Video(nditest::AnyVideo()));
-  EXPECT_EQ(callbacks->Seen().videoSent.size(), 1u);
+  EXPECT_EQ(callbacks->Seen().videoSent.size(), 2u);  // the largest and the good one
 }
 
 TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
