@@ -115,6 +115,7 @@ TEST_F(ConfigTest, PanelAndConfigurationTranslateBothWays) {
 // Unknown texts select the highest; a text that does not read keeps the value.
 TEST_F(ConfigTest, ConfigurationSetsTheReceiveBandwidth) {
   const std::pair<const char*, std::uint32_t> cases[] = {
+      {R"({"bandwidth":"ndi_bandwidth_lowest"})", 0u},   {R"({"bandwidth":"ndi_bandwidth_highest"})", 100u},
       {R"({"bandwidth":"ndi_bandwidth_lowest"})", 0u},   {R"({"bandwidth":"fastest please"})", 100u},
       {R"({"bandwidth":"ndi_bandwidth_audio_only"})", 10u}, {"not json", 10u},
       {R"({"bandwidth":"ndi_bandwidth_lowest "})", 100u},

@@ -264,6 +264,7 @@ TEST_F(TaskSourceTest, FailedStartOrConfigurationLeavesNothingAndLogsTheRequest)
     pmtest::LogCapture log;
     const Json reply = Ask("pm::tsrc::start_source", {{"unique_id", c.id}});
     EXPECT_FALSE(reply.contains("pm::error"));
+    EXPECT_TRUE(c.id.is_string() || !reply.contains("unique_id"));
     EXPECT_EQ(journal_.Lines(), c.journal);
     EXPECT_EQ(task_->SourceCount(), 0u);
     EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
