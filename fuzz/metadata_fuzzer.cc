@@ -12,9 +12,8 @@
 #include <memory>
 #include <string>
 
-#include "fakes.h"
 #include "fuzz_support.h"
-#include "scripted_ndi.h"
+#include "ndi_harness.h"
 #include "taskndisource/ndi_source.h"
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {

@@ -5,8 +5,7 @@
 
 #include <algorithm>
 
-#include "fakes.h"
-#include "scripted_ndi.h"
+#include "ndi_harness.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 #include "taskndisource/discovery.h"
@@ -48,40 +47,9 @@ TEST_F(DiscoveryTest, ScansAfter125MsThenDoublingTo4s) {
   EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
 }
 
-TEST_F(DiscoveryTest, SenderIsAnnouncedOnceWhileItStaysAndAnewAfterItVanished) {
-  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
-  discovery->Start();
-  NextScan();
-  NextScan();
-  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)"});
-  EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: STUDIO (Cam 1) (127.0.0.1:1)\n"), 1);
-  const pm::SourceInfo info = callbacks->Seen().infos.at(0);
-  EXPECT_EQ(info.produces, 3u);
-  EXPECT_EQ(info.maximumLatencySeconds, 1.0);
-
-  ndi.SetSources({});
-  NextScan();
-  EXPECT_EQ(callbacks->Seen().calls.back(), "-NDICaptureDevice~STUDIO (Cam 1)");
-  NextScan();
-  EXPECT_EQ(callbacks->Seen().calls.size(), 2u);
-
-  ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
-  NextScan();
-  EXPECT_EQ(callbacks->Seen().calls.size(), 3u);
-  EXPECT_EQ(callbacks->Seen().calls.back(), "+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)");
-  EXPECT_EQ(logs.Count("Discovered NDI Source"), 2);
-}
-
-TEST_F(DiscoveryTest, EntriesWithoutNameOrUrlAreIgnored) {
-  ndi.SetSources({Entry{std::nullopt, "10.0.0.1:1"}, Entry{"B (y)", std::nullopt}, Entry{"", "10.0.0.3:1"},
-                  Entry{"C (z)", ""}, Entry{"D (w)", "10.0.0.4:1"}});
-  discovery->Start();
-  NextScan();
-  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"+NDICaptureDevice~D (w) D (w)"});
-}
-
-// Senders are told apart by URL, so two with one name are two entries with
-// one id. Within a scan every withdrawal comes first, and an id that an entry
+// A sender is announced once while it stays, withdrawn once, and announced
+// anew when it is back. Senders are told apart by URL, so two with one name
+// are two entries with one id. Within a scan every withdrawal comes first, and an id that an entry
 // still carries afterwards is announced again: the last word about a present
 // sender is "available", whatever order the table walks its URLs in (each
 // move is scripted both ways round).
@@ -99,41 +67,46 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
       {"first of two sharing a name vanished", {{at1, at2}, {at2}}, {on, on, off, on}},
       {"second of two sharing a name vanished", {{at1, at2}, {at1}}, {on, on, off, on}},
       {"both of two vanished", {{at1, at2}, {}, {}}, {on, on, off, off}},
-      {"vanished", {{at1}, {}, {}}, {on, off}},
+
+      {"entries without name or url are ignored",
+       {{Entry{std::nullopt, "10.0.0.1:1"}, Entry{"B (y)", std::nullopt}, Entry{"", "10.0.0.3:1"}, Entry{"C (z)", ""}, at1}},
+       {on}},
+      {"stays, vanishes and comes back", {{at1}, {at1}, {}, {}, {at1}}, {on, off, on}},
   };
   for (const Script& script : scripts) {
     SCOPED_TRACE(script.name);
+    logs.Clear();
     auto calls = std::make_shared<nditest::FakeDiscoveryCallbacks>();
     Discovery fresh(calls, ndi.Api(), env.Make());
     for (const std::vector<Entry>& scan : script.scans) {
       ndi.SetSources(scan);
       ASSERT_TRUE(fresh.ScanOnce(reinterpret_cast<void*>(0x10)));
     }
-    EXPECT_EQ(calls->Seen().calls, script.calls);
+    EXPECT_EQ(calls->Calls(), script.calls);
+    for (const pm::SourceInfo& info : calls->Infos()) {
+      EXPECT_EQ(info.produces, 3u);
+      EXPECT_EQ(info.maximumLatencySeconds, 1.0);
+    }
   }
+  // Of the last script: one line for each announcement.
+  EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: A (x) (10.0.0.1:1)\n"), 2);
 }
 
-TEST_F(DiscoveryTest, StopDuringAWaitEndsWithoutAnotherScan) {
-  discovery->Start();
-  NextScan();
-  discovery->Stop();
-  EXPECT_EQ(ndi.Seen().listCalls, 1);
-  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
-  EXPECT_EQ(*env.exits, 0);
-}
-
-TEST_F(DiscoveryTest, RestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
+TEST_F(DiscoveryTest, StopEndsAWaitAndARestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Stop();  // nothing runs: the signal must not outlive this call's purpose
   discovery->Start();
   NextScan();
-  discovery->Stop();
+  discovery->Stop();  // during a wait: ends without another scan
+  EXPECT_EQ(ndi.Seen().listCalls, 1);
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
+  EXPECT_EQ(*env.exits, 0);
   discovery->Start();
   discovery->Start();  // a second start while running is ignored
   waits = 3;           // the first loop's two waits, then this loop's first
   EXPECT_EQ(env.clock->AwaitWait(waits), 125);
   NextScan();
-  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);  // still there: not announced again
+  EXPECT_EQ(callbacks->Calls().size(), 1u);  // still there: not announced again
   EXPECT_EQ(ndi.Seen().findersCreated, 2);
   EXPECT_EQ(ndi.Seen().maxLiveFinders, 1);
 }
@@ -146,7 +119,7 @@ TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Start();
   NextScan();
-  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);
+  EXPECT_EQ(callbacks->Calls().size(), 1u);
 }
 
 TEST_F(DiscoveryTest, WithoutCallbacksTheTableIsKeptAndNothingAnnounced) {

@@ -1,5 +1,5 @@
 // Loading the runtime table by name: every entry from a complete library, the
-// first missing symbol or the missing library named on failure.
+// first missing symbol named on failure.
 
 #include <gtest/gtest.h>
 
@@ -31,13 +31,7 @@ TEST(LoadNdiApi, MissingSymbolIsNamedAndTheTableLeftEmpty) {
   EXPECT_FALSE(LoadNdiApi(STUB_RUNTIME_PARTIAL_PATH, &api, &missing));
   EXPECT_EQ(missing, "NDIlib_find_create_v2");
   EXPECT_EQ(api.version, nullptr);
-}
-
-TEST(LoadNdiApi, MissingLibraryIsNamed) {
-  NdiApi api;
-  std::string missing;
-  EXPECT_FALSE(LoadNdiApi("libno-such-ndi-runtime.so", &api, &missing));
-  EXPECT_EQ(missing, "libno-such-ndi-runtime.so");
+  // (A missing library is named in the factory's line; without places to write, nothing is.)
   EXPECT_FALSE(LoadNdiApi("libno-such-ndi-runtime.so", nullptr, nullptr));
 }
 

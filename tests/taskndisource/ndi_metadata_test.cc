@@ -3,21 +3,17 @@
 
 #include <gtest/gtest.h>
 
-#include <deque>
-
-#include "fakes.h"
-#include "scripted_ndi.h"
+#include "ndi_harness.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 #include "taskndisource/ndi_source.h"
 
 namespace {
 
-using nditest::Entry;
-using nditest::VideoCapture;
+using nditest::AnyVideo;
 using TaskNDISource::NDISource;
-using TaskNDISource::ReceiverState;
 using TaskNDISource::ShotEvent;
+using Lines = std::vector<std::string>;
 
 constexpr char kId[] = "NDICaptureDevice~STUDIO (Cam 1)";
 void* const kReceiver = reinterpret_cast<void*>(0x10);
@@ -27,14 +23,13 @@ class MetadataTest : public ::testing::Test {
   ~MetadataTest() override { source->Stop(); }
 
   void Metadata(const std::string& text) { source->ProcessMetadataFrame(nditest::MetadataCapture(text)->metadata); }
-
-  std::vector<std::string> Ptz(std::vector<nlohmann::json> commands) {
-    std::deque<nlohmann::json> queue(commands.begin(), commands.end());
-    const std::size_t before = ndi.Seen().ptzCalls.size();
-    source->RunPtzCommands(kReceiver, queue);
-    EXPECT_TRUE(queue.empty());
-    const auto calls = ndi.Seen().ptzCalls;
-    return std::vector<std::string>(calls.begin() + static_cast<std::ptrdiff_t>(before), calls.end());
+  bool WaitFor(const std::function<bool()>& done) { return pmtest::WaitFor(done); }
+  // Starts the loop on a listed sender and waits until a frame was delivered.
+  void StartReceiving() {
+    ndi.SetSources({nditest::Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
+    ndi.Push(AnyVideo());
+    source->Start();
+    ASSERT_TRUE(WaitFor([&] { return source->State() == TaskNDISource::ReceiverState::Receiving; }));
   }
 
   pmtest::LogCapture logs;
@@ -44,188 +39,152 @@ class MetadataTest : public ::testing::Test {
   std::shared_ptr<NDISource> source = std::make_shared<NDISource>(callbacks, kId, ndi.Api(), env.Make());
 };
 
-TEST_F(MetadataTest, ShotEventIsPrintedIndentedWithItsTerminatingZeroCounted) {
+// Events go out in order, printed indented and escaped with the terminating
+// zero counted; a refused send stops the pass and keeps the event first.
+TEST_F(MetadataTest, ShotEventsAreSentInOrderAndAnUnsentOneStaysFirst) {
   std::deque<ShotEvent> queue{ShotEvent{"X", 1, 0}, ShotEvent{"a\"b<&>", 0, 1}};
-  source->SendShotEvents(kReceiver, queue);
-  EXPECT_TRUE(queue.empty());
-  const auto sent = ndi.Seen().metadataSent;
-  ASSERT_EQ(sent.size(), 2u);
-  EXPECT_EQ(sent[0], "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(sent[1],
-            "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(ndi.Seen().metadataLengths[0], static_cast<int>(sent[0].size()) + 1);
-}
-
-TEST_F(MetadataTest, UnsentShotEventStaysFirstForTheNextPass) {
-  std::deque<ShotEvent> queue{ShotEvent{"one", 0, 0}, ShotEvent{"two", 0, 0}};
   ndi.SetMetadataResult(false);
   source->SendShotEvents(kReceiver, queue);
   ASSERT_EQ(queue.size(), 2u);
-  EXPECT_EQ(queue.front().name, "one");
-  EXPECT_EQ(ndi.Seen().metadataLengths.size(), 1u);  // stopped at the first failure
+  EXPECT_EQ(ndi.Seen().metadataLengths.size(), 1u);
   ndi.SetMetadataResult(true);
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  ASSERT_EQ(ndi.Seen().metadataSent.size(), 2u);
-  EXPECT_NE(ndi.Seen().metadataSent[0].find("\"one\""), std::string::npos);
-  EXPECT_NE(ndi.Seen().metadataSent[1].find("\"two\""), std::string::npos);
+  const auto sent = ndi.Seen().metadataSent;
+  EXPECT_EQ(sent, (Lines{"<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n",
+                         "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n"
+                         "</skyrelay_ext>\n"}));
+  EXPECT_EQ(ndi.Seen().metadataLengths[1], static_cast<int>(sent[0].size()) + 1);
 }
 
-TEST_F(MetadataTest, EveryPtzCommandReachesItsCallWithItsParameters) {
-  EXPECT_EQ(Ptz({
-                {{"command", "RecallPreset"}, {"preset", 3}, {"speed", 0.5}},
-                {{"command", "StorePreset"}, {"preset", 7}},
-                {{"command", "PanTilt"}, {"pan", -0.25}, {"tilt", 0.75}},
-                {{"command", "PanTiltSpeed"}, {"pan", 1}, {"tilt", -1}},
-                {{"command", "Zoom"}, {"zoom", 0.5}},
-                {{"command", "AutoFocus"}},
-                {{"command", "Focus"}, {"val", 0.25}},
-                {{"command", "FocusSpeed"}, {"speed", -0.5}},
-                {{"command", "AutoExposure"}},
-                {{"command", "ExposureManual"}, {"level", 0.125}},
-                {{"command", "BalanceMode"}, {"mode", "auto"}},
-                {{"command", "BalanceMode"}, {"mode", "indoor"}},
-                {{"command", "BalanceMode"}, {"mode", "outdoor"}},
-                {{"command", "BalanceMode"}, {"mode", "oneshot"}},
-                {{"command", "BalanceMode"}, {"mode", "manual"}, {"red", 0.5}, {"blue", 0.25}},
-            }),
-            (std::vector<std::string>{"recall_preset(3,0.5)", "store_preset(7)", "pan_tilt(-0.25,0.75)",
-                                      "pan_tilt_speed(1,-1)", "zoom(0.5)", "auto_focus()", "focus(0.25)",
-                                      "focus_speed(-0.5)", "exposure_auto()", "exposure_manual(0.125)",
-                                      "white_balance_auto()", "white_balance_indoor()", "white_balance_outdoor()",
-                                      "white_balance_oneshot()", "white_balance_manual(0.5,0.25)"}));
-  EXPECT_EQ(logs.Lines(), std::vector<std::string>{"ptz_white_balance_oneshot\n"});
+// Each command reaches its call with its parameters read leniently (defaults
+// for missing ones, clamped to the call's type); any other shape does nothing.
+TEST_F(MetadataTest, PtzCommandsReachTheirCallsAndOtherShapesDoNothing) {
+  const std::pair<nlohmann::json, const char*> cases[] = {
+      {{{"command", "RecallPreset"}, {"preset", 3}, {"speed", 0.5}}, "recall_preset(3,0.5)"},
+      {{{"command", "StorePreset"}, {"preset", 7}}, "store_preset(7)"},
+      {{{"command", "PanTilt"}, {"pan", -0.25}, {"tilt", 0.75}}, "pan_tilt(-0.25,0.75)"},
+      {{{"command", "PanTiltSpeed"}, {"pan", 1}, {"tilt", -1}}, "pan_tilt_speed(1,-1)"},
+      {{{"command", "Zoom"}, {"zoom", 0.5}}, "zoom(0.5)"},
+      {{{"command", "AutoFocus"}}, "auto_focus()"},
+      {{{"command", "Focus"}, {"val", 0.25}}, "focus(0.25)"},
+      {{{"command", "FocusSpeed"}, {"speed", -0.5}}, "focus_speed(-0.5)"},
+      {{{"command", "AutoExposure"}}, "exposure_auto()"},
+      {{{"command", "ExposureManual"}, {"level", 0.125}}, "exposure_manual(0.125)"},
+      {{{"command", "BalanceMode"}, {"mode", "auto"}}, "white_balance_auto()"},
+      {{{"command", "BalanceMode"}, {"mode", "indoor"}}, "white_balance_indoor()"},
+      {{{"command", "BalanceMode"}, {"mode", "outdoor"}}, "white_balance_outdoor()"},
+      {{{"command", "BalanceMode"}, {"mode", "oneshot"}}, "white_balance_oneshot()"},
+      {{{"command", "BalanceMode"}, {"mode", "manual"}, {"red", 0.5}, {"blue", 0.25}}, "white_balance_manual(0.5,0.25)"},
+      // Lenient parameters.
+      {{{"command", "RecallPreset"}}, "recall_preset(0,1)"},
+      {{{"command", "RecallPreset"}, {"preset", "3"}}, "recall_preset(3,1)"},
+      {{{"command", "PanTilt"}, {"pan", 0.5}}, "pan_tilt(0.5,0)"},
+      {{{"command", "Zoom"}, {"zoom", "0.5"}}, "zoom(0.5)"},
+      {{{"command", "Focus"}, {"val", true}}, "focus(1)"},
+      {{{"command", "StorePreset"}, {"preset", 2.9}}, "store_preset(2)"},
+      {{{"command", "BalanceMode"}, {"mode", "manual"}}, "white_balance_manual(0,0)"},
+      {{{"command", "Zoom"}, {"zoom", nullptr}}, "zoom(0)"},
+      {{{"command", "Zoom"}, {"zoom", {1, 2}}}, "zoom(0)"},
+      {{{"command", "Zoom"}, {"zoom", 1e300}}, "zoom(3.40282e+38)"},
+      {{{"command", "StorePreset"}, {"preset", 99999999999}}, "store_preset(2147483647)"},
+      // Other shapes.
+      {nullptr, nullptr},
+      {42, nullptr},
+      {"Zoom", nullptr},
+      {nlohmann::json::array({"command", "Zoom"}), nullptr},
+      {nlohmann::json::object(), nullptr},
+      {{{"command", "zoom"}}, nullptr},
+      {{{"command", " Zoom"}}, nullptr},
+      {{{"command", 5}}, nullptr},
+      {{{"command", "BalanceMode"}}, nullptr},
+      {{{"command", "BalanceMode"}, {"mode", "Auto"}}, nullptr},
+      {{{"Command", "Zoom"}}, nullptr},
+  };
+  std::deque<nlohmann::json> queue;
+  Lines expected;
+  for (const auto& [command, call] : cases) {
+    queue.push_back(command);
+    if (call != nullptr) expected.push_back(call);
+  }
+  source->RunPtzCommands(kReceiver, queue);
+  EXPECT_TRUE(queue.empty());
+  EXPECT_EQ(ndi.Seen().ptzCalls, expected);
+  EXPECT_EQ(logs.Lines(), Lines{"ptz_white_balance_oneshot\n"});
 }
 
-TEST_F(MetadataTest, PtzParametersAreReadLenientlyWithTheirDefaults) {
-  EXPECT_EQ(Ptz({
-                {{"command", "RecallPreset"}},
-                {{"command", "RecallPreset"}, {"preset", "3"}},
-                {{"command", "PanTilt"}, {"pan", 0.5}},
-                {{"command", "Zoom"}, {"zoom", "0.5"}},
-                {{"command", "Focus"}, {"val", true}},
-                {{"command", "StorePreset"}, {"preset", 2.9}},
-                {{"command", "BalanceMode"}, {"mode", "manual"}},
-                {{"command", "Zoom"}, {"zoom", nullptr}},
-                {{"command", "Zoom"}, {"zoom", {1, 2}}},
-                {{"command", "Zoom"}, {"zoom", 1e300}},
-                {{"command", "StorePreset"}, {"preset", 99999999999}},
-            }),
-            (std::vector<std::string>{"recall_preset(0,1)", "recall_preset(3,1)", "pan_tilt(0.5,0)", "zoom(0.5)",
-                                      "focus(1)", "store_preset(2)", "white_balance_manual(0,0)", "zoom(0)",
-                                      "zoom(0)", "zoom(3.40282e+38)", "store_preset(2147483647)"}));
-}
-
-TEST_F(MetadataTest, PtzOfAnyOtherShapeDoesNothing) {
-  EXPECT_TRUE(Ptz({
-                      nullptr,
-                      42,
-                      "Zoom",
-                      nlohmann::json::array({"command", "Zoom"}),
-                      nlohmann::json::object(),
-                      {{"command", "zoom"}},
-                      {{"command", " Zoom"}},
-                      {{"command", 5}},
-                      {{"command", "BalanceMode"}},
-                      {{"command", "BalanceMode"}, {"mode", "Auto"}},
-                      {{"Command", "Zoom"}},
-                  })
-                  .empty());
-  EXPECT_TRUE(logs.Lines().empty());
-}
-
-TEST_F(MetadataTest, ModelNameIsLoggedWhenItChanges) {
-  Metadata(R"(<ndi_product model_name="PTZ Cam 2000"/>)");
-  Metadata(R"(<ndi_product model_name="PTZ Cam 2000" serial="1"/>)");
-  EXPECT_EQ(logs.Lines(), std::vector<std::string>{"#ndisource: NDI source model name: PTZ Cam 2000\n"});
-  EXPECT_EQ(source->ModelName(), "PTZ Cam 2000");
-  Metadata("<ndi_product/>");
-  EXPECT_EQ(source->ModelName(), "");
-  EXPECT_EQ(logs.Count("NDI source model name"), 2);
-}
-
-// One frame each on a fresh source: what reaches the host and what is logged.
-TEST_F(MetadataTest, FramesAreReadAsTheirXmlSays) {
+// Frames on a fresh source each: what reaches the host, what is logged and
+// the model name kept. A frame is its text and zero, or exactly `length`
+// bytes of its text (a read past them is the sanitizer's to catch).
+TEST_F(MetadataTest, FramesAreReadAsTheirXmlSaysWithinTheirLength) {
+  constexpr int kWithZero = -1000;
   const std::string parseFailed = "#ndisource: failed to parse metadata frame\n";
-  const std::string invalidBuildOut = "#ndisource: invalid buildOutDuration in NDI metadata frame\n";
+  const std::string badBuildOut = "#ndisource: invalid buildOutDuration in NDI metadata frame\n";
+  const std::string badLength = "#ndisource: invalid length in NDI metadata frame\n";
+  const std::string modelLine = "#ndisource: NDI source model name: ";
+  const std::string buildOne = "<metadata><buildOutDuration>1</buildOutDuration></metadata>";
+  const std::string withZero = std::string("<ndi_product model_name=\"A\"/>") + '\0' + "garbage that is not XML";
   std::string deep;
   for (int i = 0; i < 10000; ++i) deep += "<a>";
-  struct Case {
+  struct Frame {
     std::string text;
-    std::vector<std::string> calls;
-    std::vector<std::string> log;
+    int length = kWithZero;
+    bool noData = false;
+  };
+  struct Case {
+    std::vector<Frame> frames;
+    Lines calls, log;
+    std::string model;
   } cases[] = {
-      {"<metadata><buildOutDuration>0.5</buildOutDuration></metadata>", {"buildout 352800000"}, {}},
-      {"<skyrelay_ext>\n  <other/>\n  <buildOutDuration> 2 </buildOutDuration></skyrelay_ext>",
-       {"buildout 1411200000"}, {}},
-      {"<other><buildOutDuration>0.5</buildOutDuration></other>", {}, {}},
-      {"<metadata><buildOutDuration>soon</buildOutDuration></metadata>", {}, {}},
-      {"<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>", {}, {}},
-      {"<metadata><buildOutDuration>1e300</buildOutDuration></metadata>", {}, {invalidBuildOut}},
-      {"<metadata><buildOutDuration>nan</buildOutDuration></metadata>", {}, {invalidBuildOut}},
-      {"<metadata><buildOutDuration>-inf</buildOutDuration></metadata>", {}, {invalidBuildOut}},
-      {"", {}, {parseFailed}},
-      {"not xml at all", {}, {parseFailed}},
-      {"<metadata><buildOutDuration>0.5</metadata>", {}, {parseFailed}},
-      {"<!-- only a comment -->", {}, {"#ndisource: metadata frame has no root element\n"}},
-      {std::string(1 << 20, '<'), {}, {parseFailed}},
-      {deep, {}, {parseFailed}},
+      {{{"<metadata><buildOutDuration>0.5</buildOutDuration></metadata>"}}, {"buildout 352800000"}, {}, ""},
+      {{{"<skyrelay_ext>\n  <other/>\n  <buildOutDuration> 2 </buildOutDuration></skyrelay_ext>"}},
+       {"buildout 1411200000"}, {}, ""},
+      {{{"<other><buildOutDuration>0.5</buildOutDuration></other>"}}, {}, {}, ""},
+      {{{"<metadata><buildOutDuration>soon</buildOutDuration></metadata>"}}, {}, {}, ""},
+      {{{"<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>"}}, {}, {}, ""},
+      {{{"<metadata><buildOutDuration>1e300</buildOutDuration></metadata>"}}, {}, {badBuildOut}, ""},
+      {{{"<metadata><buildOutDuration>nan</buildOutDuration></metadata>"}}, {}, {badBuildOut}, ""},
+      {{{"<metadata><buildOutDuration>-inf</buildOutDuration></metadata>"}}, {}, {badBuildOut}, ""},
+      {{{""}}, {}, {parseFailed}, ""},
+      {{{"not xml at all"}}, {}, {parseFailed}, ""},
+      {{{"<metadata><buildOutDuration>0.5</metadata>"}}, {}, {parseFailed}, ""},
+      {{{"<!-- only a comment -->"}}, {}, {"#ndisource: metadata frame has no root element\n"}, ""},
+      {{{std::string(1 << 20, '<')}}, {}, {parseFailed}, ""},
+      {{{deep}}, {}, {parseFailed}, ""},
+      {{{"<a/>", 0}}, {}, {badLength}, ""},
+      {{{"<a/>", -5}}, {}, {badLength}, ""},
+      {{{"<a/>", 5, true}}, {}, {"#ndisource: null data in NDI metadata frame\n"}, ""},
+      {{{buildOne, static_cast<int>(buildOne.size())}}, {"buildout 705600000"}, {}, ""},  // no zero
+      {{{withZero, static_cast<int>(withZero.size())}}, {}, {modelLine + "A\n"}, "A"},   // a zero ends the text
+      // The model name is logged when it changes, and forgotten by a product without one.
+      {{{R"(<ndi_product model_name="PTZ Cam 2000"/>)"}, {R"(<ndi_product model_name="PTZ Cam 2000" serial="1"/>)"}},
+       {}, {modelLine + "PTZ Cam 2000\n"}, "PTZ Cam 2000"},
+      {{{R"(<ndi_product model_name="B"/>)"}, {"<ndi_product/>"}}, {}, {modelLine + "B\n", modelLine + "\n"}, ""},
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(c.text.substr(0, 80));
+    SCOPED_TRACE(c.frames[0].text.substr(0, 80));
     auto fresh = std::make_shared<nditest::FakeCallbacks>();
     NDISource one(fresh, kId, ndi.Api(), env.Make());
     logs.Clear();
-    one.ProcessMetadataFrame(nditest::MetadataCapture(c.text)->metadata);
+    for (const Frame& f : c.frames) {
+      if (f.length == kWithZero) {
+        one.ProcessMetadataFrame(nditest::MetadataCapture(f.text)->metadata);
+        continue;
+      }
+      std::unique_ptr<char[]> exact(new char[f.text.size()]);
+      std::memcpy(exact.get(), f.text.data(), f.text.size());
+      one.ProcessMetadataFrame(ndi_metadata_frame{f.length, 0, f.noData ? nullptr : exact.get()});
+    }
     EXPECT_EQ(fresh->Seen().calls, c.calls);
     EXPECT_EQ(logs.Lines(), c.log);
+    EXPECT_EQ(one.ModelName(), c.model);
   }
 }
 
-TEST_F(MetadataTest, FramesWithoutUsableDataAreDroppedWithTheirLine) {
-  const std::pair<ndi_metadata_frame, const char*> cases[] = {
-      {{0, 0, const_cast<char*>("<a/>")}, "#ndisource: invalid length in NDI metadata frame\n"},
-      {{-5, 0, const_cast<char*>("<a/>")}, "#ndisource: invalid length in NDI metadata frame\n"},
-      {{5, 0, nullptr}, "#ndisource: null data in NDI metadata frame\n"},
-  };
-  for (const auto& [frame, line] : cases) {
-    logs.Clear();
-    source->ProcessMetadataFrame(frame);
-    EXPECT_EQ(logs.Lines(), std::vector<std::string>{line});
-  }
-  EXPECT_TRUE(callbacks->Seen().calls.empty());
-}
-
-TEST_F(MetadataTest, MetadataIsReadOnlyWithinItsLength) {
-  // No terminating zero: exactly `length` bytes are read (ASan guards the end).
-  const std::string text = "<metadata><buildOutDuration>1</buildOutDuration></metadata>";
-  auto* exact = new char[text.size()];
-  std::memcpy(exact, text.data(), text.size());
-  ndi_metadata_frame frame{static_cast<int>(text.size()), 0, exact};
-  source->ProcessMetadataFrame(frame);
-  delete[] exact;
-  // A zero inside the length ends the text there.
-  std::string withZero = "<ndi_product model_name=\"A\"/>";
-  withZero.push_back('\0');
-  withZero += "garbage that is not XML";
-  ndi_metadata_frame early{static_cast<int>(withZero.size()), 0, withZero.data()};
-  source->ProcessMetadataFrame(early);
-  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"buildout 705600000"});
-  EXPECT_EQ(source->ModelName(), "A");
-}
-
-TEST_F(MetadataTest, PtzSupportIsReportedWithTheModelName) {
-  Metadata(R"(<ndi_product model_name="Model X"/>)");
-  ndi.SetPtzSupported(true);
-  source->ReportPtzSupport(kReceiver);
-  ndi.SetPtzSupported(false);
-  source->ReportPtzSupport(kReceiver);
-  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/Model X", "ptz /"}));
-  EXPECT_TRUE(logs.Contains("#ndisource: NDICaptureDevice~STUDIO (Cam 1) supports PTZ\n"));
-}
-
-// The vendor runtime's order: PTZ support first, the product metadata after.
-TEST_F(MetadataTest, AModelNameArrivingAfterPtzSupportIsReportedAgain) {
+// The suite goes with the model name; the vendor runtime reports PTZ support
+// before the product metadata, so a model name arriving (or changing) after
+// the support was reported is reported again.
+TEST_F(MetadataTest, PtzSupportIsReportedWithTheModelNameAndAgainWhenTheNameArrives) {
   ndi.SetPtzSupported(true);
   source->ReportPtzSupport(kReceiver);
   Metadata(R"(<ndi_product model_name="Model Y"/>)");
@@ -233,84 +192,71 @@ TEST_F(MetadataTest, AModelNameArrivingAfterPtzSupportIsReportedAgain) {
   ndi.SetPtzSupported(false);
   source->ReportPtzSupport(kReceiver);
   Metadata(R"(<ndi_product model_name="Model Z"/>)");
-  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
+  ndi.SetPtzSupported(true);
+  source->ReportPtzSupport(kReceiver);
+  EXPECT_EQ(callbacks->Seen().calls, (Lines{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /", "ptz NDI3/Model Z"}));
+  EXPECT_TRUE(logs.Contains("#ndisource: NDICaptureDevice~STUDIO (Cam 1) supports PTZ\n"));
 }
 
 // Through the receiver loop: tally, shot events and PTZ commands reach the
 // sender only after a delivered frame, in order.
-class MetadataLoopTest : public MetadataTest {
- protected:
-  void StartReceiving() {
-    ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
-    ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-    source->Start();
-    ASSERT_TRUE(pmtest::WaitFor([&] { return source->State() == ReceiverState::Receiving; }));
-  }
-};
-
-TEST_F(MetadataLoopTest, TallyChangesBetweenTwoPassesAreSentAsOne) {
+TEST_F(MetadataTest, TallyChangesBetweenTwoPassesAreSentAsOne) {
   StartReceiving();
   ndi.BlockCapture(true);
   const int captures = ndi.Seen().captures;
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures; }));
+  ASSERT_TRUE(WaitFor([&] { return ndi.Seen().captures > captures; }));
   const std::size_t before = ndi.Seen().tallies.size();
   source->HandleShotEvent("TALLY_LIVE_ON");
   source->HandleShotEvent("TALLY_PREVIEW_ON");
   ndi.BlockCapture(false);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().tallies.size() > before; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures + 2; }));
+  ASSERT_TRUE(WaitFor([&] { return ndi.Seen().tallies.size() > before && ndi.Seen().captures > captures + 2; }));
   const auto tallies = ndi.Seen().tallies;
   ASSERT_EQ(tallies.size(), before + 1);
   EXPECT_TRUE(tallies.back().on_program);
   EXPECT_TRUE(tallies.back().on_preview);
 }
 
-TEST_F(MetadataLoopTest, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
+TEST_F(MetadataTest, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
   source->HandleShotEvent("Cut before start");
   StartReceiving();  // Start empties the queue: the event above is never sent
-  source->HandleShotEvent("TALLY_PREVIEW_ON");
-  source->HandleShotEvent(" TALLY_LIVE_ON");  // not a tally command
-  source->HandleShotEvent("TALLY_LIVE_ON ");
-  source->HandleShotEvent("Cut");
+  for (const char* event : {"TALLY_PREVIEW_ON", " TALLY_LIVE_ON", "TALLY_LIVE_ON ", "Cut"}) source->HandleShotEvent(event);
   // The loop may take the events in more than one batch; each batch goes
   // out after a delivered frame.
-  for (int i = 0; i < 3; ++i) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().metadataSent.size() >= 5; }));
+  for (int i = 0; i < 3; ++i) ndi.Push(AnyVideo());
+  ASSERT_TRUE(WaitFor([&] { return ndi.Seen().metadataSent.size() >= 5; }));
   const auto sent = ndi.Seen().metadataSent;
-  ASSERT_EQ(sent.size(), 5u);
-  EXPECT_EQ(sent[2], "<skyrelay_ext>\n    <event value=\" TALLY_LIVE_ON\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(sent[3], "<skyrelay_ext>\n    <event value=\"TALLY_LIVE_ON \" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(sent[4], "<skyrelay_ext>\n    <event value=\"Cut\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; }));
+  const auto event = [](const std::string& name) {
+    return "<skyrelay_ext>\n    <event value=\"" + name + "\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
+  };
+  EXPECT_EQ(Lines(sent.begin() + 2, sent.end()), (Lines{event(" TALLY_LIVE_ON"), event("TALLY_LIVE_ON "), event("Cut")}));
+  ASSERT_TRUE(WaitFor([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; }));
   EXPECT_FALSE(ndi.Seen().tallies.back().on_program);
 }
 
-TEST_F(MetadataLoopTest, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
+TEST_F(MetadataTest, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.1}});
   StartReceiving();
   ndi.SetConnections(0);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Seen().states == std::vector<std::int32_t>{1, 2, 3}; }));
+  ASSERT_TRUE(WaitFor([&] { return callbacks->Seen().states == std::vector<std::int32_t>{1, 2, 3}; }));
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.5}});
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
   EXPECT_TRUE(ndi.Seen().ptzCalls.empty());
   ndi.SetConnections(1);
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   env.clock->AdvanceMs(5000);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().ptzCalls.empty(); }));
-  EXPECT_EQ(ndi.Seen().ptzCalls, std::vector<std::string>{"zoom(0.5)"});
+  ASSERT_TRUE(WaitFor([&] { return !ndi.Seen().ptzCalls.empty(); }));
   source->Stop();
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.9}});
-  EXPECT_EQ(ndi.Seen().ptzCalls.size(), 1u);
+  EXPECT_EQ(ndi.Seen().ptzCalls, Lines{"zoom(0.5)"});
 }
 
-TEST_F(MetadataLoopTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
+TEST_F(MetadataTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
   ndi.SetPtzSupported(true);
   ndi.Push(nditest::MetadataCapture(R"(<ndi_product model_name="Cam"/>)"));
-  ndi.Push(nditest::TypeOnly(kNdiFrameStatusChange));
-  ndi.Push(nditest::TypeOnly(kNdiFrameError));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameStatusChange));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameError));
   StartReceiving();  // the metadata frame counts as delivered
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Count("ptz NDI3/Cam") == 1; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().queued == 0; }));
+  ASSERT_TRUE(WaitFor([&] { return callbacks->Count("ptz NDI3/Cam") == 1 && ndi.Seen().queued == 0; }));
   source->Stop();
   EXPECT_EQ(ndi.Seen().frees[2], 1);
   EXPECT_EQ(ndi.Seen().frees[0], 1);

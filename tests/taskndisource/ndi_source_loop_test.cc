@@ -7,8 +7,7 @@
 #include <atomic>
 #include <thread>
 
-#include "fakes.h"
-#include "scripted_ndi.h"
+#include "ndi_harness.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 #include "taskndisource/ndi_config.h"
@@ -17,7 +16,7 @@
 namespace {
 
 using nditest::Entry;
-using nditest::VideoCapture;
+using nditest::AnyVideo;
 using TaskNDISource::NDISource;
 using TaskNDISource::ReceiverState;
 
@@ -39,17 +38,10 @@ class LoopTest : public ::testing::Test {
     Make();
     source->Start();
   }
-
-  // Waits (real time) until `done` holds.
+  // Wait (real time) until `done` holds.
   static void Until(const std::function<bool()>& done) { ASSERT_TRUE(pmtest::WaitFor(done)); }
-
-  void UntilState(ReceiverState state) {
-    Until([&] { return source->State() == state; });
-  }
-
-  void UntilStates(std::vector<std::int32_t> states) {
-    Until([&] { return callbacks->Seen().states == states; });
-  }
+  void UntilState(ReceiverState state) { Until([&] { return source->State() == state; }); }
+  void UntilStates(std::vector<std::int32_t> states) { Until([&] { return callbacks->Seen().states == states; }); }
 
   pmtest::LogCapture logs;
   nditest::ScriptedNdi ndi;
@@ -58,8 +50,11 @@ class LoopTest : public ::testing::Test {
   std::shared_ptr<NDISource> source;
 };
 
+// (With an id too short to carry a name: the empty name is looked for.)
 TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
-  Run();
+  ndi.SetSources({Entry{kName, kUrl}});
+  source = std::make_shared<NDISource>(callbacks, "short", ndi.Api(), env.Make());
+  source->Start();
   for (int attempt = 1; attempt <= 130; ++attempt) {
     ASSERT_EQ(env.clock->AwaitWait(attempt), 250) << attempt;
     ASSERT_EQ(logs.Count("#ndisource: waiting for source to be found\n"), attempt);
@@ -76,16 +71,31 @@ TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
   EXPECT_EQ(*env.exits, 0);
 }
 
-TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
-  ndi.SetSources({Entry{kName, ""}});
-  Run();
+// A finder or receiver that cannot be made, or a sender listed without a
+// URL, is an error: told, on the panel, and kept (the sender coming back with
+// a URL does not end it) until a reconnect.
+TEST_F(LoopTest, ErrorsAreToldAndKeptUntilAReconnect) {
+  const std::pair<std::function<void()>, const char*> cases[] = {
+      {[&] { ndi.FailFinderCreate(true); }, "#ndisource: failed to create NDI finder\n"},
+      {[&] { ndi.FailReceiverCreate(true); }, "#ndisource: failed to create NDI receiver\n"},
+      {[&] { ndi.SetSources({Entry{kName, ""}}); }, "#ndisource: source has no url\n"},
+  };
+  for (const auto& [fault, line] : cases) {
+    SCOPED_TRACE(line);
+    ndi.SetSources({Entry{kName, kUrl}});
+    fault();
+    if (source) source->Stop();
+    env.clock = std::make_shared<pmtest::ManualClock>();  // each run's waits counted from 1
+    Run();
+    UntilState(ReceiverState::Error);
+    EXPECT_TRUE(logs.Contains(line));
+    const std::string gui = callbacks->Seen().guis.back();
+    EXPECT_NE(gui.find("\"indication\":101"), std::string::npos) << gui;
+    EXPECT_NE(gui.find("taskvistafeed_status_error"), std::string::npos) << gui;
+    ndi.FailFinderCreate(false);
+    ndi.FailReceiverCreate(false);
+  }
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
-  EXPECT_TRUE(logs.Contains("#ndisource: source has no url\n"));
-  EXPECT_EQ(source->State(), ReceiverState::Error);
-  const std::string gui = callbacks->Seen().guis.back();
-  EXPECT_NE(gui.find("\"indication\":101"), std::string::npos) << gui;
-  EXPECT_NE(gui.find("taskvistafeed_status_error"), std::string::npos) << gui;
-  // The sender comes back with a URL: Error is left only by a reconnect.
   ndi.SetSources({Entry{kName, kUrl}});
   env.clock->AdvanceMs(5000);
   ASSERT_EQ(env.clock->AwaitWait(2), 5000);
@@ -93,41 +103,16 @@ TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
   EXPECT_TRUE(ndi.Seen().receivers.empty());
   for (std::int32_t state : callbacks->Seen().states) EXPECT_NE(state, 4);
   source->ExecuteCustomActionCommand("taskndisource::reconnect");
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   UntilState(ReceiverState::Receiving);
 }
 
-TEST_F(LoopTest, FirstOfTwoSendersWithOneNameIsUsed) {
+// The first sender listed with the name is taken, with the task's receiver
+// settings, told the tally and both documents, then received.
+TEST_F(LoopTest, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) {
   ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{std::nullopt, "10.0.0.2:1"}, Entry{kName, kUrl},
                   Entry{kName, "10.0.0.3:1"}});
-  Run();
-  Until([&] { return !ndi.Seen().receivers.empty(); });
-  const auto created = ndi.Seen().receivers.at(0);
-  EXPECT_EQ(created.name, kName);
-  EXPECT_EQ(created.url, kUrl);
-  EXPECT_EQ(created.colorFormat, 1);
-  EXPECT_EQ(created.bandwidth, 100);
-  EXPECT_FALSE(created.allowFields);
-}
-
-TEST_F(LoopTest, FailingFinderOrReceiverGoesToError) {
-  ndi.FailFinderCreate(true);
-  Run();
-  UntilState(ReceiverState::Error);
-  EXPECT_TRUE(logs.Contains("#ndisource: failed to create NDI finder\n"));
-  source->Stop();
-
-  ndi.FailFinderCreate(false);
-  ndi.FailReceiverCreate(true);
-  ndi.SetSources({Entry{kName, kUrl}});
-  source->Start();
-  UntilState(ReceiverState::Error);
-  EXPECT_TRUE(logs.Contains("#ndisource: failed to create NDI receiver\n"));
-}
-
-TEST_F(LoopTest, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) {
-  ndi.SetSources({Entry{kName, kUrl}});
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   Make();
   source->HandleShotEvent("TALLY_LIVE_ON");
   source->Start();
@@ -148,6 +133,12 @@ TEST_F(LoopTest, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) 
   EXPECT_NE(gui.find("ndi_state_receiving"), std::string::npos) << gui;
   EXPECT_NE(gui.find("16x4 @ 29.97 fps"), std::string::npos) << gui;
   EXPECT_EQ(source->PublishedMediaInfo().videoWidth, 16);
+  const auto created = ndi.Seen().receivers.at(0);
+  EXPECT_EQ(created.url, kUrl);
+  EXPECT_EQ(created.name, kName);
+  EXPECT_EQ(created.colorFormat, 1);
+  EXPECT_EQ(created.bandwidth, 100);
+  EXPECT_FALSE(created.allowFields);
   source->Stop();
   EXPECT_TRUE(ndi.Seen().freesMatched);
   EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
@@ -164,7 +155,7 @@ TEST_F(LoopTest, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
   ASSERT_EQ(env.clock->AwaitWait(2), 250);
   EXPECT_EQ(ndi.Seen().captures, 0);
   ndi.SetMetadataResult(true);
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   env.clock->AdvanceMs(250);
   UntilState(ReceiverState::Receiving);
 }
@@ -187,7 +178,7 @@ TEST_F(LoopTest, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
 
   // The sender is back: reconnect from Idle, then receive.
   ndi.SetConnections(1);
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   env.clock->AdvanceMs(5000);
   UntilStates({1, 3, 1, 2});
   EXPECT_TRUE(logs.Contains("#ndisource: attempting to reconnect from idle state\n"));
@@ -208,7 +199,7 @@ TEST_F(LoopTest, SenderSlowToAppearSendsTheLoopToIdleOnceItsReceiverExists) {
 
 TEST_F(LoopTest, LostConnectionWhileReceivingGoesIdle) {
   ndi.SetSources({Entry{kName, kUrl}});
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  ndi.Push(AnyVideo());
   Run();
   UntilStates({1, 2});
   ndi.SetConnections(0);
@@ -237,7 +228,7 @@ class ListedUrl : public LoopTest, public ::testing::WithParamInterface<ListedCa
 TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
   const ListedCase& c = GetParam();
   ndi.SetSources({Entry{kName, kUrl}});
-  if (c.receiving) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  if (c.receiving) ndi.Push(AnyVideo());
   Run();
   if (c.receiving) UntilStates({1, 2});
   Until([&] { return ndi.Seen().captures >= 3; });
@@ -250,7 +241,7 @@ TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
     ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().receivers.size() == 2; }));
     EXPECT_EQ(ndi.Seen().receivers[1].url, c.madeAgainFor);
     EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
-    ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+    ndi.Push(AnyVideo());
   } else {
     Until([&] { return ndi.Seen().captures >= captures + 40; });
     EXPECT_EQ(ndi.Seen().receivers.size(), 1u);
@@ -271,7 +262,7 @@ INSTANTIATE_TEST_SUITE_P(
                                  {Entry{kName, kUrl}, Entry{kName, "10.0.0.9:2"}}, nullptr, {1, 2}}),
     [](const ::testing::TestParamInfo<ListedCase>& info) { return std::string(info.param.what); });
 
-TEST_F(LoopTest, StopEndsAWaitingLoopAtOnceAndReleasesEverything) {
+TEST_F(LoopTest, StopOrReleaseEndsAWaitingLoopAtOnceAndReleasesEverything) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);
   Run();
@@ -286,6 +277,11 @@ TEST_F(LoopTest, StopEndsAWaitingLoopAtOnceAndReleasesEverything) {
   NDISource never(callbacks, kId, ndi.Api(), env.Make());
   never.Stop();
   EXPECT_EQ(never.State(), ReceiverState::None);
+  // A source released while its loop runs stops it.
+  source->Start();
+  Until([&] { return ndi.Seen().findersCreated == 2; });
+  source.reset();
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 2);
 }
 
 TEST_F(LoopTest, LoopStuckPastTheStopDeadlineEndsTheProcess) {
@@ -344,21 +340,6 @@ TEST_F(LoopTest, ConcurrentReconnectsNeverRunTwoLoops) {
   source->Stop();
   EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
   EXPECT_EQ(*env.exits, 0);
-}
-
-TEST_F(LoopTest, SourceReleasedWhileRunningStopsItsLoop) {
-  ndi.SetSources({Entry{kName, kUrl}});
-  Run();
-  Until([&] { return ndi.Seen().captures > 0; });
-  source.reset();
-  EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
-}
-
-TEST_F(LoopTest, ShortUniqueIdLooksForAnEmptyNameWithoutFailing) {
-  source = std::make_shared<NDISource>(callbacks, "short", ndi.Api(), env.Make());
-  source->Start();
-  ASSERT_EQ(env.clock->AwaitWait(1), 250);
-  EXPECT_TRUE(logs.Contains("#ndisource: waiting for source to be found\n"));
 }
 
 TEST_F(LoopTest, LoopWithoutCallbacksRunsAndIdlesWithoutSpinning) {

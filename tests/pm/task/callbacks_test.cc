@@ -57,86 +57,76 @@ pm::VideoFormat Video(std::uint32_t code, int width, int height) {
   return pmtest::VideoFormatOf(code, width, height);
 }
 
-TEST(SourceNotifications, CarryExactlyTheirKeysAndTypes) {
+// Each notification carries exactly its keys (a float stays a float); a text
+// that is not JSON goes as null.
+TEST(Notifications, CarryExactlyTheirKeysAndTypes) {
   Fixture f;
-  const std::string id = "NDICaptureDevice~HOST (Cam 1)";
-  f.callbacks->UpdateMaximumLatencySeconds(0.25);
-  EXPECT_EQ(f.Next("pm::tsrc::update_maximum_latency_seconds"),
-            json({{"unique_id", id}, {"maximumLatencySeconds", 0.25}}));
-  f.callbacks->SetFixedLatencySeconds(2);
-  json fixed = f.Next("pm::tsrc::set_fixed_latency_seconds");
-  EXPECT_TRUE(fixed["fixedLatencySeconds"].is_number_float());
-  f.callbacks->UpdateConfiguration("{\"bandwidth\":\"x\"}");
-  EXPECT_EQ(f.Next("pm::tsrc::update_configuration"),
-            json({{"unique_id", id}, {"config", {{"bandwidth", "x"}}}}));
-  f.callbacks->UpdateConfiguration("");
-  EXPECT_EQ(f.Next("pm::tsrc::update_configuration"), json({{"unique_id", id}, {"config", nullptr}}));
-  f.callbacks->UpdateGui("{\"a\":1}", {});
-  EXPECT_EQ(f.Next("pm::tsrc::update_gui"),
-            json({{"unique_id", id}, {"gui", {{"a", 1}}}, {"widgets", json::array()}}));
-  f.callbacks->UpdateGui("not json", {"w1", "w2"});
-  EXPECT_EQ(f.Next("pm::tsrc::update_gui"),
-            json({{"unique_id", id}, {"gui", nullptr}, {"widgets", {"w1", "w2"}}}));
-  f.callbacks->UpdateProduction(3);
-  json production = f.Next("pm::tsrc::update_production");
-  EXPECT_EQ(production["produces"], 3);
-  f.callbacks->UpdateBuildOutDuration(352800000);
-  EXPECT_EQ(f.Next("pm::tsrc::update_build_out_duration"), json({{"unique_id", id}, {"duration", 352800000}}));
-  f.callbacks->UpdatePtzCommandSuite("NDI3", "Model X");
-  EXPECT_EQ(f.Next("pm::tsrc::update_ptz_command_suite"),
-            json({{"unique_id", id}, {"suite", "NDI3"}, {"model", "Model X"}}));
-  f.callbacks->UpdateConnectionState(2);
-  EXPECT_EQ(f.Next("pm::tsrc::update_connection_state"), json({{"unique_id", id}, {"state", 2}}));
-  f.callbacks->TriggerShutdown();
-  EXPECT_EQ(f.Next("pm::tsrc::trigger_shutdown"), json({{"unique_id", id}}));
-  f.callbacks->TimestampReset();
-  EXPECT_EQ(f.Next("pm::tsrc::timestamp_reset"), json({{"unique_id", id}}));
-}
-
-TEST(DiscoveryNotifications, AnnounceAndWithdrawSources) {
-  pmtest::HostLink link;
-  pm::DiscoveryCallbacks callbacks(link.Dispatcher());
+  pm::DiscoveryCallbacks discovery(f.link.Dispatcher());
   pm::SourceInfo info;
   info.uniqueId = "NDICaptureDevice~A (b)";
   info.name = "A (b)";
-  callbacks.SourceAvailable(info);
-  auto available = link.ReadCommand("pm::tsrc::source_available");
-  ASSERT_TRUE(available);
-  json expected = {{"unique_id", "NDICaptureDevice~A (b)"}, {"name", "A (b)"}, {"categories", ""},
-                   {"analyticsSubType", ""}, {"analyticsTertiaryType", ""}, {"produces", 3u},
-                   {"config", nullptr}, {"maximumLatencySeconds", 1.0}};
-  EXPECT_EQ(Payload(*available), expected);
-  EXPECT_TRUE((*available)["produces"].is_number_unsigned());
-  EXPECT_TRUE((*available)["maximumLatencySeconds"].is_number_float());
-  callbacks.SourceUnavailable("NDICaptureDevice~A (b)");
-  auto gone = link.ReadCommand("pm::tsrc::source_unavailable");
-  ASSERT_TRUE(gone);
-  EXPECT_EQ(Payload(*gone), json({{"unique_id", "NDICaptureDevice~A (b)"}}));
-}
-
-TEST_F(QueueTest, AudioRequests_AreSizedFromChannelsSampleCodeAndCount) {
-  auto buffer = callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480);
-  ASSERT_TRUE(buffer);
-  EXPECT_EQ(buffer->ByteSize(), 3840);
-  auto pcm = callbacks->RequestAudioBuffer({pm::kCodeSowt, 48000, 2}, 480);
-  ASSERT_TRUE(pcm);
-  EXPECT_EQ(pcm->ByteSize(), 1920);
-  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::FourCC('a', 'b', 'c', 'd'), 48000, 2}, 480), nullptr);
-  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 0), nullptr);
-  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 100)->ByteSize(), 127 * 100 * 4);
-}
-
-TEST_F(QueueTest, AudioRequests_NegativeOrOverflowingSizesNeverReachThePool) {
-  // A free segment is in the pool: a negative minimum would match it.
-  callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480).reset();
-  for (int channels : {128, 200, 255}) {
-    EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, static_cast<std::uint8_t>(channels)}, 480),
-              nullptr)
-        << channels;
+  const json id = {{"unique_id", "NDICaptureDevice~HOST (Cam 1)"}};
+  const auto with = [&](json more) {
+    more.update(id);
+    return more;
+  };
+  const struct {
+    std::function<void()> call;
+    const char* command;
+    json payload;
+  } cases[] = {
+      {[&] { f.callbacks->UpdateMaximumLatencySeconds(0.25); }, "update_maximum_latency_seconds",
+       with({{"maximumLatencySeconds", 0.25}})},
+      {[&] { f.callbacks->SetFixedLatencySeconds(2); }, "set_fixed_latency_seconds", with({{"fixedLatencySeconds", 2.0}})},
+      {[&] { f.callbacks->UpdateConfiguration("{\"bandwidth\":\"x\"}"); }, "update_configuration",
+       with({{"config", {{"bandwidth", "x"}}}})},
+      {[&] { f.callbacks->UpdateConfiguration(""); }, "update_configuration", with({{"config", nullptr}})},
+      {[&] { f.callbacks->UpdateGui("{\"a\":1}", {}); }, "update_gui",
+       with({{"gui", {{"a", 1}}}, {"widgets", json::array()}})},
+      {[&] { f.callbacks->UpdateGui("not json", {"w1", "w2"}); }, "update_gui",
+       with({{"gui", nullptr}, {"widgets", {"w1", "w2"}}})},
+      {[&] { f.callbacks->UpdateProduction(3); }, "update_production", with({{"produces", 3u}})},
+      {[&] { f.callbacks->UpdateBuildOutDuration(352800000); }, "update_build_out_duration",
+       with({{"duration", 352800000}})},
+      {[&] { f.callbacks->UpdatePtzCommandSuite("NDI3", "Model X"); }, "update_ptz_command_suite",
+       with({{"suite", "NDI3"}, {"model", "Model X"}})},
+      {[&] { f.callbacks->UpdateConnectionState(2); }, "update_connection_state", with({{"state", 2}})},
+      {[&] { f.callbacks->TriggerShutdown(); }, "trigger_shutdown", id},
+      {[&] { f.callbacks->TimestampReset(); }, "timestamp_reset", id},
+      {[&] { discovery.SourceAvailable(info); }, "source_available",
+       {{"unique_id", "NDICaptureDevice~A (b)"}, {"name", "A (b)"}, {"categories", ""}, {"analyticsSubType", ""},
+        {"analyticsTertiaryType", ""}, {"produces", 3u}, {"config", nullptr}, {"maximumLatencySeconds", 1.0}}},
+      {[&] { discovery.SourceUnavailable("NDICaptureDevice~A (b)"); }, "source_unavailable",
+       {{"unique_id", "NDICaptureDevice~A (b)"}}},
+  };
+  for (const auto& c : cases) {
+    c.call();
+    const json payload = f.Next(std::string("pm::tsrc::") + c.command);
+    ASSERT_EQ(payload, c.payload) << c.command;
+    for (const auto& [key, value] : c.payload.items()) EXPECT_EQ(payload.at(key).is_number_float(), value.is_number_float()) << key;
   }
-  // 127 x 4 x 2^31-1 does not fit 32 bits; it is refused, not wrapped.
-  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 0x7FFFFFFF), nullptr);
-  EXPECT_EQ(callbacks->AudioBufferCount(), 1);
+}
+
+// Sized from channels, sample code and count; unknown codes, no samples, a
+// channel byte that reads negative (128 and up) and sizes past 32 bits are
+// refused before the pool (where a negative minimum would match the free
+// segment the first request left).
+TEST_F(QueueTest, AudioRequestsAreSizedOrRefusedBeforeThePool) {
+  const struct {
+    std::uint32_t code;
+    int channels;
+    std::int32_t samples;
+    std::int64_t bytes;  // 0: refused
+  } cases[] = {
+      {pm::kCodeFl32, 2, 480, 3840},      {pm::kCodeSowt, 2, 480, 1920},         {pm::kCodeFl32, 127, 100, 127 * 100 * 4},
+      {pm::FourCC('a', 'b', 'c', 'd'), 2, 480, 0}, {pm::kCodeFl32, 2, 0, 0},    {pm::kCodeFl32, 128, 480, 0},
+      {pm::kCodeFl32, 200, 480, 0},       {pm::kCodeFl32, 255, 480, 0},          {pm::kCodeFl32, 127, 0x7FFFFFFF, 0},
+  };
+  for (const auto& c : cases) {
+    auto buffer = callbacks->RequestAudioBuffer({c.code, 48000, static_cast<std::uint8_t>(c.channels)}, c.samples);
+    EXPECT_EQ(buffer ? buffer->ByteSize() : 0, c.bytes) << c.channels << " x " << c.samples;
+  }
+  EXPECT_EQ(callbacks->AudioBufferCount(), 2);
 }
 
 TEST_F(QueueTest, VideoRequests_JpegNeedsAByteSizeAndGetsStrideOne) {

@@ -33,40 +33,38 @@ class Journal {
     std::lock_guard<std::mutex> guard(mutex_);
     lines_.push_back(std::move(line));
   }
-  std::vector<std::string> Lines() {
+  // The lines so far; with `clear`, forgotten afterwards.
+  std::vector<std::string> Lines(bool clear = false) {
     std::lock_guard<std::mutex> guard(mutex_);
-    return lines_;
+    return clear ? std::exchange(lines_, {}) : lines_;
   }
-  void Clear() {
-    std::lock_guard<std::mutex> guard(mutex_);
-    lines_.clear();
-  }
+  void Clear() { Lines(true); }
 
  private:
   std::mutex mutex_;  // guards lines_
   std::vector<std::string> lines_;
 };
 
+// What the scripted objects made from now on do; read on the dispatcher's thread.
 struct Script {
-  bool throwOnConfiguration = false;
-  bool throwOnStart = false;  // after recording the start
-  bool throwOnDiscoveryStart = false;
-  std::string guiAnswer = "{\"answer\":1}";
+  std::atomic<bool> throwOnConfiguration{false};
+  std::atomic<bool> throwOnStart{false};  // after recording the start
+  std::atomic<bool> throwOnDiscoveryStart{false};
 };
 
 class ScriptedSource : public pm::Source {
  public:
-  ScriptedSource(std::shared_ptr<Callbacks> callbacks, std::string id, int serial, Journal* journal, Script script)
+  ScriptedSource(std::shared_ptr<Callbacks> callbacks, std::string id, int serial, Journal* journal, Script* script)
       : Source(std::move(callbacks), std::move(id)), tag_(UniqueId() + "#" + std::to_string(serial)),
-        journal_(journal), script_(std::move(script)) {}
+        journal_(journal), script_(script) {}
   void Start() override {
     journal_->Add("start " + tag_);
-    if (script_.throwOnStart) throw std::runtime_error("start failed on purpose");
+    if (script_->throwOnStart) throw std::runtime_error("start failed on purpose");
   }
   void Stop() override { journal_->Add("stop " + tag_); }
   void SetConfiguration(std::string text) override {
     journal_->Add("config " + tag_ + " " + text);
-    if (script_.throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
+    if (script_->throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
   }
   const std::string& Tag() const { return tag_; }
   std::string ValidateGui(std::string text) override { return Answer("validate ", text); }
@@ -78,14 +76,15 @@ class ScriptedSource : public pm::Source {
   void SourceHotplugEvent() override { journal_->Add("hotplug " + tag_); }
 
  private:
+  // A source with the id "notjson" answers text that is not JSON.
   std::string Answer(const char* call, const std::string& text) {
     journal_->Add(call + tag_ + " " + text);
-    return script_.guiAnswer;
+    return UniqueId() == "notjson" ? "{not json" : R"({"answer":1})";
   }
 
   std::string tag_;
   Journal* journal_;
-  Script script_;
+  Script* script_;
 };
 
 class ScriptedDiscovery : public pm::SourceDiscovery {
@@ -129,14 +128,13 @@ class TaskSourceTest : public ::testing::Test {
   void SetUp() override {
     task_ = std::make_unique<pm::TaskSource>();
     task_->SetSourceFactory([this](std::shared_ptr<pm::Source::Callbacks> callbacks, std::string id) {
-      return std::make_shared<ScriptedSource>(std::move(callbacks), std::move(id), ++sourceSerial_, &journal_,
-                                              CurrentScript());
+      return std::make_shared<ScriptedSource>(std::move(callbacks), std::move(id), ++sourceSerial_, &journal_, &script_);
     });
     task_->SetDiscoveryFactory([this](std::shared_ptr<pm::SourceDiscovery::Callbacks> callbacks) {
       return std::make_shared<ScriptedDiscovery>(std::move(callbacks), ++discoverySerial_, &journal_, [this] {
         discoveryStarting_ = true;
         pmtest::WaitFor([this] { return discoveryMayStart_.load(); }, 60s);
-        if (CurrentScript().throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
+        if (script_.throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
       });
     });
     host_ = Attach(listener_, &dispatcher_);
@@ -174,22 +172,11 @@ class TaskSourceTest : public ::testing::Test {
     Ask("pm::tsrc::start_source", body);
   }
 
-  // The factory runs on the dispatcher's receive thread.
-  Script CurrentScript() {
-    std::lock_guard<std::mutex> guard(scriptMutex_);
-    return script_;
-  }
-  void EditScript(const std::function<void(Script&)>& edit) {
-    std::lock_guard<std::mutex> guard(scriptMutex_);
-    edit(script_);
-  }
-
   pmtest::HostListener listener_;
   pmtest::HostPeer host_;
   std::shared_ptr<pm::RpcDispatcher> dispatcher_;
   std::unique_ptr<pm::TaskSource> task_;
   Journal journal_;
-  std::mutex scriptMutex_;  // guards script_
   Script script_;
   std::atomic<int> sourceSerial_{0};
   std::atomic<int> discoverySerial_{0};
@@ -228,7 +215,7 @@ TEST_F(TaskSourceTest, EmptyConfigurationsGiveEmptyTextAndOthersStayExact) {
   EXPECT_EQ(task_->SourceCount(), 9u);
 }
 
-TEST_F(TaskSourceTest, SetConfigurationAndGuiCommandsPassNullForAbsentKeys) {
+TEST_F(TaskSourceTest, CommandsPassNullForAbsentKeysAndAnswersThatAreNotJson) {
   StartSource("a");
   journal_.Clear();
   EXPECT_EQ(Ask("pm::tsrc::set_configuration", {{"unique_id", "a"}})["unique_id"], "a");
@@ -242,13 +229,10 @@ TEST_F(TaskSourceTest, SetConfigurationAndGuiCommandsPassNullForAbsentKeys) {
   Ask("pm::tsrc::handle_shot_event", {{"unique_id", "a"}, {"event", 7}});
   EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 null", "validate a#1 null", R"(to_config a#1 {"x":2})",
                                      "to_gui a#1 {}", "action a#1 ", "shot a#1 7"}));
-}
-
-TEST_F(TaskSourceTest, SourceAnswerThatIsNotJsonBecomesNullWithALogLine) {
-  EditScript([](Script& script) { script.guiAnswer = "{not json"; });
-  StartSource("a");
+  // A source's answer that is not JSON becomes null, with a line.
+  StartSource("notjson");
   pmtest::LogCapture log;
-  const Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}, {"gui", "g"}});
+  reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "notjson"}, {"gui", "g"}});
   ASSERT_TRUE(reply.contains("gui"));
   EXPECT_TRUE(reply["gui"].is_null());
   EXPECT_TRUE(log.Contains("pmjson::Parse failed: validate_gui '{not json'"));
@@ -264,37 +248,28 @@ TEST_F(TaskSourceTest, SecondStartForARunningIdStopsTheOldSourceBeforeTheNewStar
   EXPECT_EQ(journal_.Lines(), (Lines{"hotplug a#2"}));
 }
 
-// A start or configuration that throws leaves no source behind (a started
-// one is stopped) and logs the whole request, indented by 4.
+// A start or configuration that throws, or an id that is not text, leaves no
+// source behind (a started one is stopped) and logs the whole request,
+// indented by 4.
 TEST_F(TaskSourceTest, FailedStartOrConfigurationLeavesNothingAndLogsTheRequest) {
   struct Case {
+    Json id;
     bool throwOnConfiguration;
     Lines journal;
-  } cases[] = {{false, {"config a#1 ", "start a#1", "stop a#1"}}, {true, {"config a#2 "}}};
+  } cases[] = {{"a", false, {"config a#1 ", "start a#1", "stop a#1"}}, {"a", true, {"config a#2 "}}, {5, false, {}}};
   for (const Case& c : cases) {
-    EditScript([&](Script& script) {
-      script.throwOnStart = true;
-      script.throwOnConfiguration = c.throwOnConfiguration;
-    });
+    script_.throwOnStart = true;
+    script_.throwOnConfiguration = c.throwOnConfiguration;
     journal_.Clear();
     pmtest::LogCapture log;
-    StartSource("a");
+    const Json reply = Ask("pm::tsrc::start_source", {{"unique_id", c.id}});
+    EXPECT_FALSE(reply.contains("pm::error"));
+    EXPECT_TRUE(c.id.is_string() || !reply.contains("unique_id"));
     EXPECT_EQ(journal_.Lines(), c.journal);
     EXPECT_EQ(task_->SourceCount(), 0u);
     EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
-    EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
+    EXPECT_TRUE(log.Contains("\n    \"unique_id\": " + c.id.dump() + "\n}"));
   }
-}
-
-TEST_F(TaskSourceTest, StartWithANumericOrMissingIdIsLoggedAndChangesNothing) {
-  pmtest::LogCapture log;
-  const Json reply = Ask("pm::tsrc::start_source", {{"unique_id", 5}});
-  EXPECT_FALSE(reply.contains("unique_id"));
-  EXPECT_FALSE(reply.contains("pm::error"));
-  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
-  EXPECT_TRUE(log.Contains("\n    \"unique_id\": 5\n}"));
-  EXPECT_TRUE(journal_.Lines().empty());
-  EXPECT_EQ(task_->SourceCount(), 0u);
 }
 
 TEST_F(TaskSourceTest, SecondStartDiscoveryStopsTheRunningOneFirst) {
@@ -321,18 +296,13 @@ TEST_F(TaskSourceTest, ShutdownStopsDiscoveryThenSourcesInIdOrderAndKeepsTheTabl
   EXPECT_TRUE(task_->FindSource("a"));
 }
 
-TEST_F(TaskSourceTest, StopOfTheLastSourceWhileDiscoveryRunsKeepsTheConnection) {
+// The last stop_source ends the connections only when no discovery runs;
+// stop_discovery never does.
+TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
   StartSource("a");
   Ask("pm::tsrc::start_discovery");
   Ask("pm::tsrc::stop_source", {{"unique_id", "a"}});
-  EXPECT_EQ(task_->SourceCount(), 0u);
   EXPECT_EQ(Ask("pm::tsrc::stop_discovery", {{"unique_id", "x"}})["unique_id"], "x");
-  // stop_discovery does not end the task either.
-  EXPECT_FALSE(dispatcher_->Ended());
-  EXPECT_EQ(task_->DispatcherCount(), 1u);
-}
-
-TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
   StartSource("5");
   StartSource("6");
   Ask("pm::tsrc::stop_source", {{"unique_id", 5}});  // read leniently as "5"
@@ -344,8 +314,7 @@ TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
   EXPECT_TRUE(pmtest::WaitFor([&] { return dispatcher_->Ended(); }));
   EXPECT_EQ(task_->DispatcherCount(), 0u);
   const Lines lines = journal_.Lines();
-  EXPECT_EQ(lines[lines.size() - 2], "stop 5#1");
-  EXPECT_EQ(lines.back(), "stop 6#2");
+  EXPECT_EQ(Lines(lines.end() - 2, lines.end()), (Lines{"stop 5#2", "stop 6#3"}));
 }
 
 TEST_F(TaskSourceTest, PerSourceCommandsForUnknownIdsOnlyEcho) {
@@ -385,7 +354,7 @@ TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut)
   EXPECT_EQ(journal_.Lines(),
             (Lines{"config a#1 ", "start a#1", "start discovery#1", "stop a#1", "hotplug discovery#1"}));
 
-  EditScript([](Script& script) { script.throwOnDiscoveryStart = true; });
+  script_.throwOnDiscoveryStart = true;
   journal_.Clear();
   EXPECT_TRUE(Ask("pm::tsrc::start_discovery").contains("pm::error"));
   EXPECT_EQ(journal_.Lines(), (Lines{"stop discovery#1", "start discovery#2", "stop discovery#2"}));

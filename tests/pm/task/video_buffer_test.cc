@@ -242,31 +242,24 @@ TEST(VideoBufferConvertFrame, PlanarRefusalsStopBeforeWritingPastAnyPlane) {
 // BGRX copies 4 bytes a pixel, BGR0 widens 3 to 4; both set the fourth byte
 // to 0xFF and write nothing past the row, top-down and bottom-up (the first
 // picture row last in memory). 7 pixels: one 4-pixel vector step and a tail.
-struct Packed {
-  std::uint32_t code;
-  int inBytes;    // per pixel
-  int padding;    // source bytes after a row
-  int dstExtra;   // destination bytes after a row
-};
-constexpr Packed kPacked[] = {{pm::kCodeBGRX, 4, 4, 0}, {pm::kCodeBGR0, 3, 0, 8}};
-
-pm::VideoPlanes PackedSource(Bytes& pixels, int h, int stride, bool bottomUp) {
-  pm::VideoPlanes src;
-  src.planeCount = 1;
-  src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                          : pm::Plane{pixels.data.get(), h, stride};
-  return src;
-}
-
 TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
   const int w = 7, h = 5;
-  for (const Packed& k : kPacked) {
+  const struct {
+    std::uint32_t code;
+    int inBytes;   // per pixel
+    int padding;   // source bytes after a row
+    int dstExtra;  // destination bytes after a row
+  } packed[] = {{pm::kCodeBGRX, 4, 4, 0}, {pm::kCodeBGR0, 3, 0, 8}};
+  for (const auto& k : packed) {
     for (bool bottomUp : {false, true}) {
       SCOPED_TRACE(testing::Message() << k.code << (bottomUp ? " bottom-up" : " top-down"));
       const int stride = k.inBytes * w + k.padding;
       Bytes pixels(static_cast<std::size_t>(stride) * h);
       for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i + 9);
-      const pm::VideoPlanes src = PackedSource(pixels, h, stride, bottomUp);
+      pm::VideoPlanes src;
+      src.planeCount = 1;
+      src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
+                              : pm::Plane{pixels.data.get(), h, stride};
       MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
       buffer.ConvertFrame(k.code, src);
       for (int r = 0; r < h; ++r) {
@@ -311,7 +304,7 @@ TEST(VideoBufferConvertFrame, PackedRefusalsWriteNothing) {
   }
 }
 
-TEST(VideoBufferConvertFrame, UnlistedPairsMapNothing) {
+TEST(VideoBufferConvertFrame, UnlistedPairsMapNothingAndUnmappableOnesUnmap) {
   Planar src(16, 4, 16, 8, 2);
   const std::pair<std::uint32_t, std::uint32_t> pairs[] = {
       {pm::kCodeI420, pm::kCodeRgba}, {pm::kCodeYV12, pm::kCode2vuy}, {pm::kCodeBGRX, pm::kCodeNV12},
@@ -324,10 +317,7 @@ TEST(VideoBufferConvertFrame, UnlistedPairsMapNothing) {
     EXPECT_EQ(buffer.unmaps, 0);
     EXPECT_TRUE(buffer.AllUntouched());
   }
-}
-
-TEST(VideoBufferConvertFrame, UnmappableDestinationIsUnmappedAgain) {
-  Planar src(16, 4, 16, 8, 2);
+  // A listed pair whose destination cannot be mapped is unmapped again.
   MemoryVideoBuffer buffer(Format(pm::kCodeNV12, 16, 4), 0);
   buffer.mapless = true;
   buffer.ConvertFrame(pm::kCodeI420, src.planes);

@@ -1,0 +1,537 @@
+#pragma once
+// The harness of the NDI source and discovery tests.
+//
+// ScriptedNdi: an NdiApi table of plain functions that act on the ScriptedNdi
+// currently installed (one per test, reached through a process-wide atomic
+// pointer), so a test decides what the finder lists, what each capture
+// returns, whether tally and metadata sends succeed, and reads back every call
+// the task made. Every member is guarded by its one mutex: the receiver or
+// scan thread calls the table while the test thread scripts and inspects.
+//
+// FakeCallbacks: the host's side of a source, noting every call in order as
+// text ("state 1", "reset", "production 3", "video 1234", "audio 0",
+// "buildout 352800000", "ptz NDI3/Model", "gui"), with buffers over plain
+// memory. TestEnvironment: a loop environment on the manual clock whose exit
+// hook counts instead of ending the process.
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <deque>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <type_traits>
+#include <vector>
+
+#include "pm/task/source.h"
+#include "support/manual_clock.h"
+#include "taskndisource/loop_environment.h"
+#include "taskndisource/ndi_api.h"
+
+namespace nditest {
+
+struct TestEnvironment {
+  std::shared_ptr<pmtest::ManualClock> clock = std::make_shared<pmtest::ManualClock>();
+  std::shared_ptr<std::atomic<int>> exits = std::make_shared<std::atomic<int>>(0);
+  TaskNDISource::LoopEnvironment Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5),
+                                      std::function<void()> onExit = nullptr) const {
+    TaskNDISource::LoopEnvironment env;
+    env.clock = clock;
+    env.stopTimeout = stopTimeout;
+    env.exitProcess = [counter = exits, onExit] {
+      ++*counter;
+      if (onExit) onExit();
+    };
+    return env;
+  }
+};
+
+// One result of recv_capture_v2, with storage for the data it points at.
+struct Capture {
+  std::int32_t type = kNdiFrameNone;
+  ndi_video_frame_v2 video{};
+  ndi_audio_frame_v2 audio{};
+  ndi_metadata_frame metadata{};
+  std::vector<std::uint8_t> bytes;  // what video.data / audio.data / metadata.data point into
+};
+
+// A video frame of `height` lines of `stride` bytes (plus chroma lines for
+// NV12), byte (row * 7 + column) & 0xFF, at 30000/1001.
+inline std::shared_ptr<Capture> VideoCapture(std::uint32_t fourcc, int width, int height, int stride,
+                                             std::int64_t timestamp = 0, bool progressive = true) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = kNdiFrameVideo;
+  const int rows = fourcc == kNdiFourCCNV12 ? height + height / 2 : height;
+  const std::size_t size = stride > 0 && rows > 0 ? static_cast<std::size_t>(stride) * rows : 0;
+  capture->bytes.resize(size);
+  for (std::size_t i = 0; i < size; ++i) {
+    capture->bytes[i] = static_cast<std::uint8_t>(i / static_cast<std::size_t>(stride) * 7 + i % static_cast<std::size_t>(stride));
+  }
+  capture->video.xres = width;
+  capture->video.yres = height;
+  capture->video.FourCC = fourcc;
+  capture->video.frame_rate_N = 30000;
+  capture->video.frame_rate_D = 1001;
+  capture->video.frame_format_type = progressive ? kNdiFrameFormatProgressive : kNdiFrameFormatInterleaved;
+  capture->video.data = size > 0 ? capture->bytes.data() : nullptr;
+  capture->video.line_stride_in_bytes = stride;
+  capture->video.timestamp = timestamp;
+  return capture;
+}
+// The frame every state test delivers.
+inline std::shared_ptr<Capture> AnyVideo() { return VideoCapture(kNdiFourCCUYVY, 16, 4, 32); }
+
+// Planar float audio: sample s of channel c is c * 1000 + s.
+inline std::shared_ptr<Capture> AudioCapture(int rate, int channels, int samples, std::int64_t timestamp = 0) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = kNdiFrameAudio;
+  const std::size_t count = channels > 0 && samples > 0 ? static_cast<std::size_t>(channels) * samples : 0;
+  capture->bytes.resize(count * sizeof(float));
+  for (std::size_t i = 0; i < count; ++i) {
+    const float value = static_cast<float>(i / static_cast<std::size_t>(samples) * 1000 + i % static_cast<std::size_t>(samples));
+    std::memcpy(capture->bytes.data() + i * 4, &value, 4);
+  }
+  capture->audio.sample_rate = rate;
+  capture->audio.no_channels = channels;
+  capture->audio.no_samples = samples;
+  capture->audio.data = count > 0 ? reinterpret_cast<float*>(capture->bytes.data()) : nullptr;
+  capture->audio.channel_stride_in_bytes = samples * 4;
+  capture->audio.timestamp = timestamp;
+  return capture;
+}
+
+// A metadata frame of `text` followed by its terminating zero (length counts
+// it), or a result of `type` without a frame.
+inline std::shared_ptr<Capture> MetadataCapture(const std::string& text, std::int32_t type = kNdiFrameMetadata) {
+  auto capture = std::make_shared<Capture>();
+  capture->type = type;
+  capture->bytes.assign(text.begin(), text.end());
+  capture->bytes.push_back(0);
+  capture->metadata.length = static_cast<int>(capture->bytes.size());
+  capture->metadata.data = reinterpret_cast<char*>(capture->bytes.data());
+  return capture;
+}
+
+struct ReceiverCreated {
+  std::string name;
+  std::string url;
+  std::int32_t colorFormat = 0;
+  std::int32_t bandwidth = 0;
+  bool allowFields = true;
+};
+
+struct Entry {
+  std::optional<std::string> name;
+  std::optional<std::string> url;
+};
+
+// What the task did to the runtime, as one snapshot.
+struct Observed {
+  int findersCreated = 0;
+  int findersDestroyed = 0;
+  int maxLiveFinders = 0;  // most finders alive at one time
+  int listCalls = 0;
+  std::vector<ReceiverCreated> receivers;
+  int receiversDestroyed = 0;
+  int connectionQueries = 0;
+  std::vector<ndi_tally> tallies;
+  std::vector<std::string> metadataSent;  // texts without the terminating zero
+  std::vector<int> metadataLengths;       // the lengths passed
+  std::vector<std::string> ptzCalls;      // "zoom(0.5)", "recall_preset(3,1)", ...
+  int captures = 0;
+  int queued = 0;            // captures pushed and not yet handed out
+  int frees[3] = {0, 0, 0};  // video, audio, metadata
+  bool freesMatched = true;  // every frame handed out was freed, each once
+};
+
+class ScriptedNdi {
+ public:
+  // Installs this object as the one the table's functions act on.
+  ScriptedNdi() {
+    if (Installed().exchange(this) != nullptr) std::abort();  // two at once
+  }
+  ~ScriptedNdi() { Installed().store(nullptr); }
+  ScriptedNdi(const ScriptedNdi&) = delete;
+  ScriptedNdi& operator=(const ScriptedNdi&) = delete;
+
+  // The table; every entry is filled.
+  std::shared_ptr<const TaskNDISource::NdiApi> Api() const;
+  Observed Seen() {
+    std::lock_guard<std::mutex> guard(mutex_);
+    Observed seen = seen_;
+    seen.queued = static_cast<int>(queue_.size());
+    seen.freesMatched = seen_.freesMatched && handedOut_.empty();
+    return seen;
+  }
+
+  // Script.
+  void SetSources(std::vector<Entry> entries) { Edit([&] { entries_ = std::move(entries); }); }
+  void FailFinderCreate(bool fail) { Edit([&] { failFinder_ = fail; }); }
+  void FailReceiverCreate(bool fail) { Edit([&] { failReceiver_ = fail; }); }
+  void SetConnections(int count) { Edit([&] { connections_ = count; }); }
+  void SetTallyResult(bool ok) { Edit([&] { tallyOk_ = ok; }); }
+  void SetMetadataResult(bool ok) { Edit([&] { metadataOk_ = ok; }); }
+  void SetPtzSupported(bool supported) { Edit([&] { ptzSupported_ = supported; }); }
+  // Captures are handed out in order; with none queued a capture waits up to
+  // a millisecond (real time) and returns "none". While blocked, a capture
+  // waits until unblocked.
+  void Push(std::shared_ptr<nditest::Capture> capture) { Edit([&] { queue_.push_back(std::move(capture)); }); }
+  void BlockCapture(bool block) { Edit([&] { block_ = block; }); }
+
+ private:
+  static std::atomic<ScriptedNdi*>& Installed() {
+    static std::atomic<ScriptedNdi*> installed{nullptr};
+    return installed;
+  }
+  // Runs `act` on the installed object under its lock (a table used after its
+  // test ended aborts).
+  template <typename Act>
+  static auto Locked(Act act) {
+    ScriptedNdi* current = Installed().load();
+    if (current == nullptr) std::abort();
+    std::lock_guard<std::mutex> guard(current->mutex_);
+    return act(*current);
+  }
+  template <typename Fn>
+  void Edit(Fn edit) {
+    std::lock_guard<std::mutex> guard(mutex_);
+    edit();
+    changed_.notify_all();
+  }
+  void* NewHandle() { return &handleSpace_[++handles_ % 64]; }
+  static std::int32_t Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata);
+  static void Free(int kind, const void* data) {
+    Locked([&](ScriptedNdi& n) {
+      ++n.seen_.frees[kind];
+      if (n.handedOut_.erase(data) != 1) n.seen_.freesMatched = false;
+    });
+  }
+  template <typename... Args>
+  static bool Ptz(const char* name, Args... args);
+
+  std::mutex mutex_;  // guards everything below
+  std::condition_variable changed_;
+  Observed seen_;
+  std::vector<Entry> entries_;
+  std::vector<ndi_source> list_;  // handed out by the finder, valid until its next list
+  bool failFinder_ = false;
+  bool failReceiver_ = false;
+  int connections_ = 1;
+  bool tallyOk_ = true;
+  bool metadataOk_ = true;
+  bool ptzSupported_ = false;
+  std::deque<std::shared_ptr<nditest::Capture>> queue_;
+  std::map<const void*, std::shared_ptr<nditest::Capture>> handedOut_;
+  bool block_ = false;
+  int handles_ = 0;  // handle values are distinct small addresses within this object
+  char handleSpace_[64] = {};
+};
+
+class FakeVideoBuffer : public pm::VideoBuffer {
+ public:
+  explicit FakeVideoBuffer(const pm::VideoFormat& format)
+      : format_(format), memory(static_cast<std::size_t>(RowBytes()) * static_cast<std::size_t>(Rows())) {}
+  // The intake only copies whole frames.
+  pm::VideoPlanes Planes() override { return {}; }
+  std::pair<std::uint8_t*, std::int32_t> MapData() override { return {nullptr, 0}; }
+  void UnmapData() override {}
+  pm::VideoFormat Format() const override { return format_; }
+  // Copies height rows (and NV12's chroma rows) of one row of the format
+  // each, as the host buffer does, so reading past a short frame shows.
+  void CopyFrame(const std::uint8_t* source, std::int32_t sourceStride) override {
+    copiedStride = sourceStride;
+    for (std::int32_t r = 0; r < Rows(); ++r) {
+      std::memcpy(memory.data() + static_cast<std::ptrdiff_t>(r) * RowBytes(),
+                  source + static_cast<std::ptrdiff_t>(r) * sourceStride, static_cast<std::size_t>(RowBytes()));
+    }
+  }
+  std::int32_t RowBytes() const {
+    if (format_.code == pm::kCodeRgba) return format_.width * 4;
+    if (format_.code == pm::kCode2vuy || format_.code == pm::kCodeYuvs) return format_.width * 2;
+    return format_.code == pm::kCodeNV12 ? format_.width : 0;
+  }
+  std::int32_t Rows() const { return format_.code == pm::kCodeNV12 ? format_.height + format_.height / 2 : format_.height; }
+
+  pm::VideoFormat format_;
+  std::vector<std::uint8_t> memory;
+  std::int32_t copiedStride = 0;
+};
+
+class FakeAudioBuffer : public pm::AudioBuffer {
+ public:
+  FakeAudioBuffer(const pm::AudioFormat& format, std::int32_t samples, std::int64_t bytes)
+      : format_(format), samples_(samples), memory(static_cast<std::size_t>(bytes)) {}
+  pm::AudioFormat Format() const override { return format_; }
+  std::int32_t SampleCount() const override { return samples_; }
+  void Fill(std::function<void(void*, std::int64_t)> fill) override { fill(memory.data(), ByteSize()); }
+  std::int64_t ByteSize() const override { return static_cast<std::int64_t>(memory.size()); }
+  std::vector<float> Samples() const {
+    std::vector<float> samples(memory.size() / sizeof(float));
+    std::memcpy(samples.data(), memory.data(), samples.size() * sizeof(float));
+    return samples;
+  }
+
+  pm::AudioFormat format_;
+  std::int32_t samples_;
+  std::vector<std::uint8_t> memory;
+};
+
+// Every call the source made, in order, and what came with it.
+struct Heard {
+  std::vector<std::string> calls;
+  std::vector<std::int32_t> states;
+  std::vector<std::string> guis;
+  std::vector<pm::VideoFormat> videoRequests;
+  std::vector<std::pair<pm::AudioFormat, std::int32_t>> audioRequests;
+  std::vector<std::shared_ptr<FakeVideoBuffer>> videoSent;
+  std::vector<std::shared_ptr<FakeAudioBuffer>> audioSent;
+};
+
+class FakeCallbacks : public pm::Source::Callbacks {
+  // Notes `call` (unless empty) and runs `with`, under the lock.
+  template <typename With = void (*)(Heard&)>
+  auto Note(const std::string& call, With with = [](Heard&) {}) {
+    std::lock_guard<std::mutex> guard(mutex_);
+    if (!call.empty()) heard_.calls.push_back(call);
+    return with(heard_);
+  }
+
+ public:
+  void SetMaxVideoBuffers(std::int32_t) override {}
+  void SetMaxAudioBuffers(std::int32_t) override {}
+  void UpdateMaximumLatencySeconds(double) override {}
+  void SetFixedLatencySeconds(double) override {}
+  std::shared_ptr<pm::VideoBuffer> RequestVideoBuffer(const pm::VideoFormat& format, std::uint32_t) override {
+    return Note("video request", [&](Heard& h) -> std::shared_ptr<pm::VideoBuffer> {
+      h.videoRequests.push_back(format);
+      if (videoDry_) return nullptr;
+      return std::make_shared<FakeVideoBuffer>(videoOverride_.value_or(format));
+    });
+  }
+  std::shared_ptr<pm::AudioBuffer> RequestAudioBuffer(const pm::AudioFormat& format, std::int32_t count) override {
+    return Note("audio request", [&](Heard& h) -> std::shared_ptr<pm::AudioBuffer> {
+      h.audioRequests.emplace_back(format, count);
+      if (audioDry_) return nullptr;
+      const std::int64_t bytes = audioBytes_ >= 0 ? audioBytes_ : std::int64_t{format.channels} * count * 4;
+      return std::make_shared<FakeAudioBuffer>(format, count, bytes);
+    });
+  }
+  void UpdateConfiguration(const std::string&) override {}
+  void UpdateGui(std::string guiJson, std::vector<std::string> widgets) override {
+    Note(widgets.empty() ? "gui" : "gui with widgets", [&](Heard& h) { h.guis.push_back(guiJson); });
+  }
+  void UpdateProduction(std::uint32_t produces) override { Note("production " + std::to_string(produces)); }
+  void TimestampReset() override { Note("reset"); }
+  void UpdateBuildOutDuration(std::int64_t ticks) override { Note("buildout " + std::to_string(ticks)); }
+  void UpdatePtzCommandSuite(const std::string& suite, const std::string& model) override {
+    Note("ptz " + suite + "/" + model);
+  }
+  std::int64_t CurrentTime() override { return 0; }
+  std::int64_t AudioTime(std::int32_t) override { return 0; }
+  std::pair<std::int64_t, bool> NextVideoTime(std::uint32_t) override { return {0, false}; }
+  void SendAudioBuffer(std::int64_t time, std::shared_ptr<pm::AudioBuffer> buffer) override {
+    Note("audio " + std::to_string(time),
+         [&](Heard& h) { h.audioSent.push_back(std::static_pointer_cast<FakeAudioBuffer>(buffer)); });
+  }
+  void SendVideoBuffer(std::int64_t time, std::shared_ptr<pm::VideoBuffer> buffer) override {
+    Note("video " + std::to_string(time),
+         [&](Heard& h) { h.videoSent.push_back(std::static_pointer_cast<FakeVideoBuffer>(buffer)); });
+  }
+  void UpdateConnectionState(std::int32_t state) override {
+    Note("state " + std::to_string(state), [&](Heard& h) { h.states.push_back(state); });
+  }
+  void TriggerShutdown() override {}
+
+  // Script: no buffers; the next buffers of this format / this byte size.
+  void SetDry(bool video, bool audio) {
+    Note("", [&](Heard&) {
+      videoDry_ = video;
+      audioDry_ = audio;
+    });
+  }
+  void OverrideVideoFormat(const pm::VideoFormat& format) {
+    Note("", [&](Heard&) { videoOverride_ = format; });
+  }
+  void OverrideAudioBytes(std::int64_t bytes) {
+    Note("", [&](Heard&) { audioBytes_ = bytes; });
+  }
+
+  Heard Seen() {
+    return Note("", [&](Heard& h) { return h; });
+  }
+  int Count(const std::string& call) {
+    return Note("", [&](Heard& h) { return static_cast<int>(std::count(h.calls.begin(), h.calls.end(), call)); });
+  }
+
+ private:
+  std::mutex mutex_;  // guards everything below
+  Heard heard_;
+  bool videoDry_ = false;
+  bool audioDry_ = false;
+  std::optional<pm::VideoFormat> videoOverride_;
+  std::int64_t audioBytes_ = -1;
+};
+
+// Discovery announcements in order ("+id name", "-id") and the infos given.
+class FakeDiscoveryCallbacks : public pm::SourceDiscovery::Callbacks {
+ public:
+  void SourceAvailable(const pm::SourceInfo& info) override {
+    std::lock_guard<std::mutex> guard(mutex_);
+    calls_.push_back("+" + info.uniqueId + " " + info.name);
+    infos_.push_back(info);
+  }
+  void SourceUnavailable(const std::string& uniqueId) override {
+    std::lock_guard<std::mutex> guard(mutex_);
+    calls_.push_back("-" + uniqueId);
+  }
+  std::vector<std::string> Calls() {
+    std::lock_guard<std::mutex> guard(mutex_);
+    return calls_;
+  }
+  std::vector<pm::SourceInfo> Infos() {
+    std::lock_guard<std::mutex> guard(mutex_);
+    return infos_;
+  }
+
+ private:
+  std::mutex mutex_;  // guards calls_ and infos_
+  std::vector<std::string> calls_;
+  std::vector<pm::SourceInfo> infos_;
+};
+
+// --- The table ---------------------------------------------------------------
+
+inline std::int32_t ScriptedNdi::Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio,
+                                         ndi_metadata_frame* metadata) {
+  ScriptedNdi* current = Installed().load();
+  if (current == nullptr) std::abort();
+  ScriptedNdi& n = *current;
+  std::unique_lock<std::mutex> lock(n.mutex_);
+  ++n.seen_.captures;
+  n.changed_.notify_all();
+  n.changed_.wait(lock, [&] { return !n.block_; });
+  if (n.queue_.empty()) n.changed_.wait_for(lock, std::chrono::milliseconds(1), [&] { return !n.queue_.empty(); });
+  if (n.queue_.empty()) return kNdiFrameNone;
+  std::shared_ptr<nditest::Capture> capture = n.queue_.front();
+  n.queue_.pop_front();
+  const void* data = nullptr;
+  if (capture->type == kNdiFrameVideo) data = (*video = capture->video).data;
+  if (capture->type == kNdiFrameAudio) data = (*audio = capture->audio).data;
+  if (capture->type == kNdiFrameMetadata) data = (*metadata = capture->metadata).data;
+  if (data != nullptr) n.handedOut_[data] = capture;
+  return capture->type;
+}
+
+// Records "name(a,b)" as a PTZ call.
+template <typename... Args>
+bool ScriptedNdi::Ptz(const char* name, Args... args) {
+  std::string call = std::string(name) + "(";
+  [[maybe_unused]] const char* separator = "";
+  [[maybe_unused]] const auto text = [](auto value) {
+    if constexpr (std::is_integral_v<decltype(value)>) return std::to_string(value);
+    char out[32];
+    std::snprintf(out, sizeof out, "%g", static_cast<double>(value));
+    return std::string(out);
+  };
+  ((call += separator + text(args), separator = ","), ...);
+  return Locked([&](ScriptedNdi& n) {
+    n.seen_.ptzCalls.push_back(call + ")");
+    return true;
+  });
+}
+
+inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
+  auto api = std::make_shared<TaskNDISource::NdiApi>();
+  api->is_supported_CPU = [] { return true; };
+  api->initialize = [] { return true; };
+  api->version = [] { return "scripted"; };
+  api->destroy = [] {};
+  api->find_create_v2 = [](const ndi_find_create* settings) {
+    return Locked([&](ScriptedNdi& n) -> void* {
+      if (n.failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
+      ++n.seen_.findersCreated;
+      n.seen_.maxLiveFinders = std::max(n.seen_.maxLiveFinders, n.seen_.findersCreated - n.seen_.findersDestroyed);
+      return n.NewHandle();
+    });
+  };
+  api->find_get_current_sources = [](void*, std::uint32_t* count) {
+    return Locked([&](ScriptedNdi& n) -> const ndi_source* {
+      ++n.seen_.listCalls;
+      n.list_.clear();
+      for (const Entry& e : n.entries_) n.list_.push_back({e.name ? e.name->c_str() : nullptr, e.url ? e.url->c_str() : nullptr});
+      *count = static_cast<std::uint32_t>(n.list_.size());
+      return n.list_.empty() ? nullptr : n.list_.data();
+    });
+  };
+  api->find_destroy = [](void*) { Locked([](ScriptedNdi& n) { ++n.seen_.findersDestroyed; }); };
+  api->recv_create_v2 = [](const ndi_recv_create* s) {
+    return Locked([&](ScriptedNdi& n) -> void* {
+      if (n.failReceiver_) return nullptr;
+      const ndi_source& to = s->source_to_connect_to;
+      n.seen_.receivers.push_back(ReceiverCreated{to.ndi_name ? to.ndi_name : "", to.url_address ? to.url_address : "",
+                                                  s->color_format, s->bandwidth, s->allow_video_fields});
+      return n.NewHandle();
+    });
+  };
+  api->recv_destroy = [](void*) { Locked([](ScriptedNdi& n) { ++n.seen_.receiversDestroyed; }); };
+  api->recv_get_no_connections = [](void*) {
+    return Locked([](ScriptedNdi& n) {
+      ++n.seen_.connectionQueries;
+      return n.connections_;
+    });
+  };
+  api->recv_capture_v2 = [](void*, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
+                            std::uint32_t) { return Take(v, a, m); };
+  api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Free(0, v->data); };
+  api->recv_free_audio_v2 = [](void*, const ndi_audio_frame_v2* a) { Free(1, a->data); };
+  api->recv_free_metadata = [](void*, const ndi_metadata_frame* m) { Free(2, m->data); };
+  api->recv_set_tally = [](void*, const ndi_tally* t) {
+    return Locked([&](ScriptedNdi& n) {
+      n.seen_.tallies.push_back(*t);
+      return n.tallyOk_;
+    });
+  };
+  api->recv_send_metadata = [](void*, const ndi_metadata_frame* m) {
+    return Locked([&](ScriptedNdi& n) {
+      n.seen_.metadataLengths.push_back(m->length);
+      if (n.metadataOk_) n.seen_.metadataSent.emplace_back(m->data, m->length > 0 ? std::size_t(m->length) - 1 : 0);
+      return n.metadataOk_;
+    });
+  };
+  api->recv_ptz_is_supported = [](void*) { return Locked([](ScriptedNdi& n) { return n.ptzSupported_; }); };
+  api->recv_ptz_recall_preset = [](void*, int preset, float speed) { return Ptz("recall_preset", preset, speed); };
+  api->recv_ptz_store_preset = [](void*, int preset) { return Ptz("store_preset", preset); };
+  api->recv_ptz_pan_tilt = [](void*, float p, float t) { return Ptz("pan_tilt", p, t); };
+  api->recv_ptz_pan_tilt_speed = [](void*, float p, float t) { return Ptz("pan_tilt_speed", p, t); };
+  api->recv_ptz_zoom = [](void*, float z) { return Ptz("zoom", z); };
+  api->recv_ptz_focus = [](void*, float f) { return Ptz("focus", f); };
+  api->recv_ptz_focus_speed = [](void*, float f) { return Ptz("focus_speed", f); };
+  api->recv_ptz_auto_focus = [](void*) { return Ptz("auto_focus"); };
+  api->recv_ptz_exposure_auto = [](void*) { return Ptz("exposure_auto"); };
+  api->recv_ptz_exposure_manual = [](void*, float l) { return Ptz("exposure_manual", l); };
+  api->recv_ptz_white_balance_auto = [](void*) { return Ptz("white_balance_auto"); };
+  api->recv_ptz_white_balance_indoor = [](void*) { return Ptz("white_balance_indoor"); };
+  api->recv_ptz_white_balance_outdoor = [](void*) { return Ptz("white_balance_outdoor"); };
+  api->recv_ptz_white_balance_oneshot = [](void*) { return Ptz("white_balance_oneshot"); };
+  api->recv_ptz_white_balance_manual = [](void*, float r, float b) { return Ptz("white_balance_manual", r, b); };
+  api->util_audio_to_interleaved_32f_v2 = [](const ndi_audio_frame_v2* src, ndi_audio_frame_interleaved_32f* dst) {
+    for (int s = 0; s < src->no_samples; ++s) {
+      for (int c = 0; c < src->no_channels; ++c) {
+        std::memcpy(&dst->data[std::ptrdiff_t{s} * src->no_channels + c],
+                    reinterpret_cast<const std::uint8_t*>(src->data) + std::ptrdiff_t{c} * src->channel_stride_in_bytes + s * 4, 4);
+      }
+    }
+  };
+  return api;
+}
+
+}  // namespace nditest
