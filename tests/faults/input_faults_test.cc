@@ -50,13 +50,15 @@ std::string Id(Sender& sender) { return std::string(pmhost::kSourceIdPrefix) + s
 
 using InputFaults = pmtest::OwnLevelKept;
 
-// Receives the sender's source through the reference host into `sink` until
-// `done` (or the patience runs out); the run then ends in order.
-void ReceiveInto(const Folder& folder, Sender& sender, RampSink& sink, const std::function<bool()>& done) {
-  const pmhost::ReceiveResult result = pmtest::ReceiveUntil(pmtest::ReceiveFrom(folder, Id(sender), &sink), done);
-  EXPECT_TRUE(done()) << folder.ReadRunnerLog();
-  pmtest::ExpectOrderlyEnd(result, folder);
-  EXPECT_EQ(result.memoryBases.size(), 1u);
+// Starts the chain's source and receives until `done` (or the patience runs
+// out); then the source stops and the runner ends in order, having removed
+// its own segments.
+void ReceiveUntil(pmtest::Chain& c, const std::function<bool()>& done) {
+  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  EXPECT_TRUE(pmtest::WaitFor(done, kPatience)) << c.Log();
+  EXPECT_GT(SegmentsOf({c.QueueBase()}), 0) << "nothing in /dev/shm to leave behind";
+  EXPECT_TRUE(c.Session().StopSource(c.id));
+  c.EndDiscoveryAndExpectOrderlyExit();
 }
 
 // --- Channel counts ------------------------------------------------------
@@ -72,17 +74,15 @@ TEST_P(Channels, ArriveIntactUpTo127AndAreRefusedWithOneLineFrom128) {
   const int channels = GetParam();
   const bool fits = channels <= 127;
   const std::string refusal = "#ndisource: too many channels in NDI audio frame (" + std::to_string(channels) + ")";
-  Folder folder;
-  Sender sender;
+  pmtest::Chain c;
   std::vector<std::string> args = kSmallPictures;
   args.insert(args.end(), {"--audio-rate", "48000", "--audio-channels", std::to_string(channels)});
-  ASSERT_TRUE(sender.Start(folder, "Channels", args));
-  RampSink sink;
-  ReceiveInto(folder, sender, sink, [&] {
-    return fits ? sink.Sounds() >= 15
-                : sink.Pictures() >= 15 && folder.ReadRunnerLog().find(refusal) != std::string::npos;
-  });
-  const std::string log = folder.ReadRunnerLog();
+  ASSERT_NO_FATAL_FAILURE(c.Start("Channels", args));
+  RampSink& sink = c.sink;
+  ASSERT_NO_FATAL_FAILURE(ReceiveUntil(c, [&] {
+    return fits ? sink.Sounds() >= 15 : sink.Pictures() >= 15 && c.Log().find(refusal) != std::string::npos;
+  }));
+  const std::string log = c.Log();
   EXPECT_EQ(pmtest::Occurrences(log, refusal), fits ? 0 : 1) << log;
   EXPECT_EQ(log.find("audio well ran dry"), std::string::npos) << log;
   EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
@@ -97,15 +97,14 @@ INSTANTIATE_TEST_SUITE_P(Sound, Channels, ::testing::Values(127, 128),
 // --- Picture size changes ------------------------------------------------
 
 TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
-  Folder folder;
-  Sender sender;
+  pmtest::Chain c;
   // Six frames of each size, round and round, at 15 fps: a 2160p picture is
   // 16 MB, so only a few of them travel.
-  ASSERT_TRUE(sender.Start(folder, "Zoom", {"--pattern", "ramp", "--sizes", "1920x1080,1280x720,3840x2160",
-                                            "--frames-per-size", "6", "--fps", "15", "--no-audio"}));
+  ASSERT_NO_FATAL_FAILURE(c.Start("Zoom", {"--pattern", "ramp", "--sizes", "1920x1080,1280x720,3840x2160",
+                                           "--frames-per-size", "6", "--fps", "15", "--no-audio"}));
   using Size = RampSink::Size;
   const Size hd{1920, 1080}, small{1280, 720}, uhd{3840, 2160};
-  RampSink sink;
+  RampSink& sink = c.sink;
   // Done once the host has seen 1080p shrink to 720p, 720p grow to 2160p
   // and 2160p shrink back to 1080p (into the pool's larger segments), with
   // two pictures of the last.
@@ -119,7 +118,7 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
     }
     return false;
   };
-  ReceiveInto(folder, sender, sink, sawTheSequence);
+  ASSERT_NO_FATAL_FAILURE(ReceiveUntil(c, sawTheSequence));
   EXPECT_TRUE(sawTheSequence()) << ::testing::PrintToString(sink.SizeRuns());
   EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
   // A picture never goes past its segment: the host refuses a record whose
