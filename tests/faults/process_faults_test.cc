@@ -11,7 +11,6 @@
 // discovery cycles keep a source running) to hold the runner up.
 #include <gtest/gtest.h>
 
-#include <dirent.h>
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
@@ -20,30 +19,19 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <functional>
 #include <cstdio>
-#include <fstream>
-#include <iterator>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <random>
-#include <set>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "e2e_support.h"
-#include "faults/ramp_sink.h"
-#include "pm-host/checks.h"
-#include "pm-host/host.h"
-#include "pm-host/receive.h"
 #include "pm/ipc/connection.h"
 #include "pm/runtime/ids.h"
-#include "pm/runtime/json.h"
 #include "pm/runtime/proc_stat.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "support/wait.h"
@@ -52,8 +40,8 @@ namespace {
 
 using nlohmann::json;
 using namespace std::chrono_literals;
+using pmtest::Chain;
 using pmtest::Folder;
-using pmtest::RampSink;
 using pmtest::ProcessUsage;
 using pmtest::Sender;
 using pmtest::SegmentsOf;
@@ -76,183 +64,32 @@ constexpr bool kWithoutSanitizer = true;
 
 double SecondsSince(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
-// What the task reported to the host, by source id. Record runs on the
-// dispatcher's receive thread; the rest on the test's thread.
-class Reports {
- public:
-  void Record(const std::string& command, const json& message) {
-    const std::string id = pmjson::FieldAsString(message, "unique_id", "");
-    std::lock_guard<std::mutex> guard(lock_);
-    if (command == "pm::tsrc::update_connection_state") {
-      states_[id].push_back(static_cast<int>(pmjson::FieldAsInteger(message, "state", 0)));
-    } else if (command == "pm::tsrc::source_available") {
-      ++announced_[id];
-    }
-  }
-  // How many connection states `id` has reported so far.
-  std::size_t StateCount(const std::string& id) const {
-    std::lock_guard<std::mutex> guard(lock_);
-    auto found = states_.find(id);
-    return found == states_.end() ? 0 : found->second.size();
-  }
-  // Whether `id` reported `state` after its first `from` reports.
-  bool ReportedSince(const std::string& id, std::size_t from, int state) const {
-    std::lock_guard<std::mutex> guard(lock_);
-    auto found = states_.find(id);
-    if (found == states_.end() || found->second.size() <= from) return false;
-    return std::find(found->second.begin() + static_cast<long>(from), found->second.end(), state) !=
-           found->second.end();
-  }
-  std::vector<int> States(const std::string& id) const {
-    std::lock_guard<std::mutex> guard(lock_);
-    auto found = states_.find(id);
-    return found == states_.end() ? std::vector<int>{} : found->second;
-  }
-  // How often discovery announced `id`.
-  int Announced(const std::string& id) const {
-    std::lock_guard<std::mutex> guard(lock_);
-    auto found = announced_.find(id);
-    return found == announced_.end() ? 0 : found->second;
-  }
-
- private:
-  mutable std::mutex lock_;  // guards states_, announced_
-  std::map<std::string, std::vector<int>> states_;
-  std::map<std::string, int> announced_;
-};
-
-// Opens the gate when a case leaves its scope, before the tree stops: a
-// failed assertion must not leave a reader thread waiting in it while the
-// host joins that thread.
-struct OpenAtExit {
-  RampSink& sink;
-  ~OpenAtExit() { sink.Open(); }
-};
-
-// One case's process tree: a registry folder, the host in this process with
-// its runner, and what the task reported. Senders made afterwards (in the
-// folder) go first. The sink must outlive the tree.
-struct Tree {
-  explicit Tree(pmhost::FrameSink* sink)
-      : host(pmtest::HostOptionsFor(folder), [this](const std::string& c, const json& m) { reports.Record(c, m); },
-             sink) {}
-  pmhost::Session& Session() { return host.GetSession(); }
-  pid_t Runner() const { return host.RunnerPid(); }
-  std::string Log() const { return folder.ReadRunnerLog(); }
-
-  Folder folder;
-  Reports reports;
-  pmhost::Host host;
-};
-
-// This process's level before a case. A thread is started and joined first:
-// ThreadSanitizer starts a background thread of its own with the first one,
-// and that thread stays.
-std::optional<ProcessUsage> OwnLevel() {
-  std::thread([] {}).join();
-  return pmtest::OwnUsage();
-}
-
-void ExpectOwnUsageBackTo(const ProcessUsage& before) {
-  std::optional<ProcessUsage> now;
-  pmtest::WaitFor([&] {
-    now = pmtest::OwnUsage();
-    return now && now->descriptors == before.descriptors && now->threads == before.threads;
-  }, kPatience);
-  ASSERT_TRUE(now.has_value());
-  EXPECT_EQ(now->descriptors, before.descriptors) << "descriptors of the test process";
-  EXPECT_EQ(now->threads, before.threads) << "threads of the test process";
-}
-
-// Every case: this process's own descriptors (the queue readers'
-// connections, the children's pipes) and threads (readers, child watchers)
-// come back to where they were before it.
-class ProcessFaults : public ::testing::Test {
- protected:
-  void SetUp() override {
-    own_ = OwnLevel();
-    ASSERT_TRUE(own_);
-  }
-  void TearDown() override {
-    if (own_) ExpectOwnUsageBackTo(*own_);
-  }
-
- private:
-  std::optional<ProcessUsage> own_;
-};
-
-int CountInText(const std::string& text, const std::string& what) {
-  int count = 0;
-  for (std::size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++count;
-  return count;
-}
-
 // Small silent pictures at `fps`.
 std::vector<std::string> Small(const char* fps) {
   return {"--width", "64", "--height", "16", "--fps", fps, "--no-audio"};
 }
 
-// Starts `sender` as `name` in the tree's folder, then the host and
-// discovery, and waits until the sender is announced; *id is its source id.
-void StartWithDiscovery(Tree& tree, Sender& sender, const std::string& name, const std::vector<std::string>& args,
-                        std::string* id) {
-  ASSERT_TRUE(sender.Start(tree.folder, name, args));
-  *id = pmhost::kSourceIdPrefix + sender.Name();
-  ASSERT_TRUE(tree.host.Start());
-  ASSERT_TRUE(tree.Session().StartDiscovery());
-  ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(*id) > 0; }, kPatience)) << *id << " never announced";
-}
-
-// Starts the source until a picture arrives, then stops it: whatever the
-// runtime makes once and keeps is then made before the level is taken.
-void WarmUp(Tree& tree, RampSink& sink, const std::string& id) {
-  const int before = sink.Videos(id);
-  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > before; }, kPatience)) << tree.Log();
-  ASSERT_TRUE(tree.Session().StopSource(id));
-}
-
-// The orderly end of a tree whose only remaining task work is discovery
-// (stop_discovery alone does not end the task): stop it, close the
-// connection, and the runner exits 0 having removed every segment of every
-// memory base of the run itself.
-void EndDiscoveryAndExpectOrderlyExit(Tree& tree) {
-  const std::vector<std::string> bases = tree.Session().MemoryBases();
-  EXPECT_TRUE(tree.Session().StopDiscovery());
-  EXPECT_EQ(tree.host.Stop(), 0) << tree.Log();
-  EXPECT_EQ(SegmentsOf(bases), 0);
-  EXPECT_EQ(tree.host.RemovedSegments(), 0) << "an orderly runner removes its own segments";
-}
-
-std::string QueueBase(Tree& tree, const std::string& id) {
-  std::string base;
-  pmtest::WaitFor([&] {
-    const auto queue = tree.Session().Queue(id);
-    if (queue) base = queue->MemoryBase();
-    return !base.empty();
-  }, kPatience);
-  return base;
-}
+using ProcessFaults = pmtest::OwnLevelKept;
 
 // Runs `cycle` `count` times; the runner's level taken after the first
 // `warmUp` cycles (this process's too) must come back after the last, and
 // (optimised build only) its resident memory grow by less than `limitKiB`.
-void ExpectCyclesLeaveNothing(Tree& tree, const char* what, int count, int warmUp, long limitKiB,
+void ExpectCyclesLeaveNothing(Chain& c, const char* what, int count, int warmUp, long limitKiB,
                               const std::function<bool()>& cycle) {
   std::optional<ProcessUsage> level, ownLevel;
   const auto start = Clock::now();
   for (int n = 0; n < count; ++n) {
-    ASSERT_TRUE(cycle()) << what << " cycle " << n << "\n" << tree.Log();
+    ASSERT_TRUE(cycle()) << what << " cycle " << n << "\n" << c.Log();
     if (n + 1 == warmUp) {
-      level = LevelOf(tree.Runner());
+      level = LevelOf(c.Runner());
       ownLevel = pmtest::OwnUsage();
       ASSERT_TRUE(level && ownLevel);
     }
   }
   const double seconds = SecondsSince(start);
   std::printf("%d %s cycles: %.1f s (%.1f ms each)\n", count, what, seconds, 1000 * seconds / count);
-  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after the cycles"));
-  const std::optional<ProcessUsage> after = pmtest::UsageOf(tree.Runner());
+  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(c.Runner(), *level, "after the cycles"));
+  const std::optional<ProcessUsage> after = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(after);
   std::printf("runner resident KiB: %ld after %d cycles, %ld after %d\n", level->residentKiB, warmUp,
               after->residentKiB, count);
@@ -260,43 +97,38 @@ void ExpectCyclesLeaveNothing(Tree& tree, const char* what, int count, int warmU
     EXPECT_LT(after->residentKiB - level->residentKiB, limitKiB)
         << "resident KiB " << level->residentKiB << " -> " << after->residentKiB;
   }
-  ExpectOwnUsageBackTo(*ownLevel);
+  pmtest::ExpectOwnUsageBackTo(*ownLevel);
 }
 
 TEST_F(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegmentsUntilItReadsAgain) {
   // 256x144 UYVY: 72 KiB a picture, so that a copy kept per refused frame
   // would show in the runner's resident memory within a second.
   constexpr long kPictureKiB = 256 * 144 * 2 / 1024;
-  RampSink sink;
-  Tree tree(&sink);
-  OpenAtExit opener{sink};
-  Sender sender;
-  std::string id;
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Stall", {"--width", "256", "--height", "144", "--fps", "120",
-                                                                     "--pattern", "ramp", "--no-audio"}, &id));
-  ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
-  const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
-  ASSERT_TRUE(level);
-  const int warmUpVideos = sink.Videos(id);
+  Chain c(/*ramp=*/true);
+  ASSERT_NO_FATAL_FAILURE(c.Start("Stall", {"--width", "256", "--height", "144", "--fps", "120", "--pattern", "ramp",
+                                            "--no-audio"}));
+  std::optional<ProcessUsage> level;
+  ASSERT_NO_FATAL_FAILURE(c.WarmUp(&level));
+  const int warmUpVideos = c.sink.Videos(c.id);
 
-  sink.Shut();
-  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  const std::string base = QueueBase(tree, id);
+  c.sink.Shut();
+  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  const std::string base = c.QueueBase();
   ASSERT_FALSE(base.empty());
   ASSERT_TRUE(pmtest::WaitFor([&] {
-    return SegmentsOf({base}) >= 240 && tree.Log().find("video well ran dry") != std::string::npos;
-  }, kPatience)) << SegmentsOf({base}) << " segments\n" << tree.Log();
-  EXPECT_TRUE(sink.Holding());
-  const std::optional<ProcessUsage> dry = pmtest::UsageOf(tree.Runner());
+    return SegmentsOf({base}) >= 240 && c.Log().find("video well ran dry") != std::string::npos;
+  }, kPatience)) << SegmentsOf({base}) << " segments\n" << c.Log();
+  EXPECT_TRUE(c.sink.Holding());
+  const std::optional<ProcessUsage> dry = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(dry);
 
   // A further second of pictures, every one refused: no new segment, and
   // nothing of them kept.
-  const int refused = CountInText(tree.Log(), "video well ran dry");
+  const int refused = pmtest::Occurrences(c.Log(), "video well ran dry");
   ASSERT_TRUE(
-      pmtest::WaitFor([&] { return CountInText(tree.Log(), "video well ran dry") >= refused + 120; }, kPatience));
+      pmtest::WaitFor([&] { return pmtest::Occurrences(c.Log(), "video well ran dry") >= refused + 120; }, kPatience));
   EXPECT_EQ(SegmentsOf({base}), 240);
-  const std::optional<ProcessUsage> later = pmtest::UsageOf(tree.Runner());
+  const std::optional<ProcessUsage> later = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(later);
   std::printf("runner resident KiB: %ld at its level, %ld when dry, %ld after 120 refused pictures\n",
               level->residentKiB, dry->residentKiB, later->residentKiB);
@@ -307,57 +139,49 @@ TEST_F(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegment
     // MiB for the runtime's bounded frame queues and the allocator.
     EXPECT_LT(later->residentKiB, level->residentKiB + 240 * kPictureKiB + 16 * 1024);
   }
-  EXPECT_EQ(sink.Videos(id), warmUpVideos + 1) << "only the held picture reached the host";
+  EXPECT_EQ(c.sink.Videos(c.id), warmUpVideos + 1) << "only the held picture reached the host";
 
   // Reading again: the 240 queued pictures, then new ones through the same
   // pool, intact and in order.
-  sink.Open();
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= warmUpVideos + 240 + 60; }, kPatience))
-      << sink.Videos(id) - warmUpVideos << " pictures after the release";
-  const int dryAfterRecovery = CountInText(tree.Log(), "video well ran dry");
-  const int recovered = sink.Videos(id);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) >= recovered + 60; }, kPatience));
-  EXPECT_EQ(CountInText(tree.Log(), "video well ran dry"), dryAfterRecovery) << "still dry while the host reads";
+  c.sink.Open();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) >= warmUpVideos + 240 + 60; }, kPatience))
+      << c.sink.Videos(c.id) - warmUpVideos << " pictures after the release";
+  const int dryAfterRecovery = pmtest::Occurrences(c.Log(), "video well ran dry");
+  const int recovered = c.sink.Videos(c.id);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) >= recovered + 60; }, kPatience));
+  EXPECT_EQ(pmtest::Occurrences(c.Log(), "video well ran dry"), dryAfterRecovery) << "still dry while the host reads";
   EXPECT_EQ(SegmentsOf({base}), 240) << "segments are reused, not made anew";
-  EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
+  EXPECT_EQ(c.sink.Problems(), std::vector<std::string>{});
 
-  ASSERT_TRUE(tree.Session().StopSource(id));
-  EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
-  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
-  EndDiscoveryAndExpectOrderlyExit(tree);
+  c.StopAndExpectBackAt(base, *level);
 }
 
 TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedAreReleased) {
-  RampSink sink(/*ramp=*/false);
-  Tree tree(&sink);
-  OpenAtExit opener{sink};
-  Sender sender;
-  std::string id;
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Drop", Small("60"), &id));
-  ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
-  const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
-  ASSERT_TRUE(level);
+  Chain c(/*ramp=*/false);
+  ASSERT_NO_FATAL_FAILURE(c.Start("Drop", Small("60")));
+  std::optional<ProcessUsage> level;
+  ASSERT_NO_FATAL_FAILURE(c.WarmUp(&level));
 
   // The host holds one picture and reads nothing more: every record sent
   // from now on is owed.
-  sink.Shut();
-  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  const std::string base = QueueBase(tree, id);
+  c.sink.Shut();
+  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  const std::string base = c.QueueBase();
   ASSERT_FALSE(base.empty());
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Holding() && SegmentsOf({base}) >= 6; }, kPatience)) << tree.Log();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Holding() && SegmentsOf({base}) >= 6; }, kPatience)) << c.Log();
   const int heldSegments = SegmentsOf({base});
 
   // The host closes its end while the reader thread still holds the
   // picture (Stop joins that thread, so it runs beside the test).
-  const std::shared_ptr<pmhost::QueueReader> queue = tree.Session().Queue(id);
+  const std::shared_ptr<pmhost::QueueReader> queue = c.Session().Queue(c.id);
   ASSERT_TRUE(queue);
   std::thread closer([queue] { queue->Stop(); });
   const bool dropped = pmtest::WaitFor(
-      [&] { return tree.Log().find("pm::ipc:queue::Producer : Reader gone") != std::string::npos; }, kPatience);
-  sink.Open();
+      [&] { return c.Log().find("pm::ipc:queue::Producer : Reader gone") != std::string::npos; }, kPatience);
+  c.sink.Open();
   closer.join();
-  ASSERT_TRUE(dropped) << tree.Log();
-  const std::string log = tree.Log();
+  ASSERT_TRUE(dropped) << c.Log();
+  const std::string log = c.Log();
   std::size_t owed = 0, released = 0;
   const std::size_t line = log.find("pm::ipc:queue::Producer : Reader gone");
   ASSERT_EQ(std::sscanf(log.c_str() + line, "pm::ipc:queue::Producer : Reader gone, %zu owed tokens given up, %zu released.",
@@ -372,18 +196,15 @@ TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwe
   const int pool = SegmentsOf({base});
   std::this_thread::sleep_for(500ms);
   EXPECT_EQ(SegmentsOf({base}), pool);
-  EXPECT_EQ(tree.Log().find("video well ran dry"), std::string::npos);
+  EXPECT_EQ(c.Log().find("video well ran dry"), std::string::npos);
 
   // The runner still answers, and the source's loop still runs: the tally
-  // reaches the sender.
-  EXPECT_TRUE(tree.Session().ShotEvent(id, "TALLY_PREVIEW_ON").has_value());
-  EXPECT_TRUE(sender.WaitFor("tally", [](const json& e) { return e.value("preview", false); }));
-  EXPECT_EQ(tree.reports.States(id).back(), 2);
+  // reaches the c.sender->
+  EXPECT_TRUE(c.Session().ShotEvent(c.id, "TALLY_PREVIEW_ON").has_value());
+  EXPECT_TRUE(c.sender->WaitFor("tally", [](const json& e) { return e.value("preview", false); }));
+  EXPECT_EQ(c.reports.States(c.id).back(), 2);
 
-  ASSERT_TRUE(tree.Session().StopSource(id));
-  EXPECT_TRUE(pmtest::WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
-  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "after stop_source"));
-  EndDiscoveryAndExpectOrderlyExit(tree);
+  c.StopAndExpectBackAt(base, *level);
 }
 
 // Makes this process the reaper of orphaned descendants for its life, so
@@ -497,30 +318,29 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
   std::mt19937 random(seed);
   std::uniform_int_distribution<int> offsetUs(0, 33'333);
 
-  RampSink sink(/*ramp=*/false);
-  Tree tree(&sink);
+  Chain c(/*ramp=*/false);
   std::vector<std::unique_ptr<Sender>> senders(kSenders);
   std::vector<std::string> names, ids;
   for (int i = 0; i < kSenders; ++i) {
     senders[i] = std::make_unique<Sender>();
-    ASSERT_TRUE(senders[i]->Start(tree.folder, "Phoenix " + std::to_string(i), args));
+    ASSERT_TRUE(senders[i]->Start(c.folder, "Phoenix " + std::to_string(i), args));
     names.push_back("Phoenix " + std::to_string(i));
     ids.push_back(pmhost::kSourceIdPrefix + senders[i]->Name());
   }
-  ASSERT_TRUE(tree.host.Start());
-  const std::optional<ProcessUsage> idle = pmtest::UsageOf(tree.Runner());
+  ASSERT_TRUE(c.host.Start());
+  const std::optional<ProcessUsage> idle = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(idle);
-  for (const std::string& id : ids) ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
+  for (const std::string& id : ids) ASSERT_TRUE(c.Session().StartSource(id, json::object()));
   auto allReceivingSince = [&](const std::vector<std::size_t>& marks, const std::vector<int>& videos) {
     for (int i = 0; i < kSenders; ++i) {
-      if (!tree.reports.ReportedSince(ids[i], marks[i], 2) || sink.Videos(ids[i]) <= videos[i]) return false;
+      if (!c.reports.ReportedSince(ids[i], marks[i], 2) || c.sink.Videos(ids[i]) <= videos[i]) return false;
     }
     return true;
   };
   std::vector<std::size_t> marks(kSenders, 0);
   std::vector<int> videos(kSenders, 0);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience)) << tree.Log();
-  const std::optional<ProcessUsage> level = LevelOf(tree.Runner());
+  ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience)) << c.Log();
+  const std::optional<ProcessUsage> level = LevelOf(c.Runner());
   ASSERT_TRUE(level);
 
   double goneCpu = 0, goneWall = 0;
@@ -529,7 +349,7 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
   std::vector<long> privateByRound;
   for (int round = 0; round < kRounds; ++round) {
     SCOPED_TRACE("round " + std::to_string(round));
-    for (int i = 0; i < kSenders; ++i) marks[i] = tree.reports.StateCount(ids[i]);
+    for (int i = 0; i < kSenders; ++i) marks[i] = c.reports.States(ids[i]).size();
     for (auto& sender : senders) {
       std::this_thread::sleep_for(std::chrono::microseconds(offsetUs(random)));
       sender->Process().Signal(SIGKILL);
@@ -537,32 +357,32 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
     for (auto& sender : senders) ASSERT_TRUE(sender->Process().Wait(kPatience).has_value());
     ASSERT_TRUE(pmtest::WaitFor([&] {
       for (int i = 0; i < kSenders; ++i) {
-        if (!tree.reports.ReportedSince(ids[i], marks[i], 3)) return false;
+        if (!c.reports.ReportedSince(ids[i], marks[i], 3)) return false;
       }
       return true;
     }, kPatience)) << "a source did not notice its sender's end";
 
     // Every sender gone, every source idle: the runner must sleep. (Time
     // must pass to measure it.)
-    const double cpuBefore = pm::ProcessCpuSeconds(tree.Runner());
+    const double cpuBefore = pm::ProcessCpuSeconds(c.Runner());
     const auto start = Clock::now();
     std::this_thread::sleep_for(800ms);
-    const double cpu = pm::ProcessCpuSeconds(tree.Runner()) - cpuBefore;
+    const double cpu = pm::ProcessCpuSeconds(c.Runner()) - cpuBefore;
     const double wall = SecondsSince(start);
-    if (const auto gone = pmtest::UsageOf(tree.Runner())) highestPrivate = std::max(highestPrivate, gone->privateKiB);
+    if (const auto gone = pmtest::UsageOf(c.Runner())) highestPrivate = std::max(highestPrivate, gone->privateKiB);
     goneCpu += cpu;
     goneWall += wall;
     perRound.push_back(cpu / wall);
 
     for (int i = 0; i < kSenders; ++i) {
-      marks[i] = tree.reports.StateCount(ids[i]);
-      videos[i] = sink.Videos(ids[i]);
+      marks[i] = c.reports.States(ids[i]).size();
+      videos[i] = c.sink.Videos(ids[i]);
       senders[i] = std::make_unique<Sender>();
-      ASSERT_TRUE(senders[i]->Start(tree.folder, names[i], args));
+      ASSERT_TRUE(senders[i]->Start(c.folder, names[i], args));
     }
     ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience))
-        << "not every source came back\n" << tree.Log();
-    const std::optional<ProcessUsage> now = pmtest::UsageOf(tree.Runner());
+        << "not every source came back\n" << c.Log();
+    const std::optional<ProcessUsage> now = pmtest::UsageOf(c.Runner());
     ASSERT_TRUE(now);
     highestPrivate = std::max(highestPrivate, now->privateKiB);
     privateByRound.push_back(now->privateKiB);
@@ -576,7 +396,7 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
   }
   std::printf("runner CPU while the senders were gone: %.2f%% of a core over %.1f s\n", 100 * goneCpu / goneWall,
               goneWall);
-  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(tree.Runner(), *level, "receiving again after the last round"));
+  ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(c.Runner(), *level, "receiving again after the last round"));
   std::printf("runner private KiB: %ld before the sources, %ld receiving, then after each round %s\n",
               idle->privateKiB, level->privateKiB, ::testing::PrintToString(privateByRound).c_str());
   if (kWithoutSanitizer) {
@@ -593,11 +413,11 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
     EXPECT_LT(highestPrivate, idle->privateKiB + kSenders * 13 * kPictureKiB + 32 * 1024)
         << "private KiB after each round: " << ::testing::PrintToString(privateByRound);
   }
-  const std::vector<std::string> bases = tree.Session().MemoryBases();
+  const std::vector<std::string> bases = c.Session().MemoryBases();
   EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));
-  for (const std::string& id : ids) tree.Session().StopSource(id);
-  EXPECT_EQ(tree.host.WaitRunner(kPatience), std::optional<int>(0)) << tree.Log();
-  EXPECT_EQ(tree.host.Stop(), 0);
+  for (const std::string& id : ids) c.Session().StopSource(id);
+  EXPECT_EQ(c.host.WaitRunner(kPatience), std::optional<int>(0)) << c.Log();
+  EXPECT_EQ(c.host.Stop(), 0);
   EXPECT_EQ(SegmentsOf(bases), 0);
   senders.clear();
 }
@@ -610,62 +430,56 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
 TEST_F(ProcessFaults, ASenderStartedAgainSoonAfterItWentIsReceivedFromItsFirstReceivingReport) {
   const std::vector<std::chrono::milliseconds> delays = {200ms, 500ms, 1000ms, 2000ms, 6000ms};
   const std::vector<std::string> args = {"--width", "64", "--height", "16", "--fps", "30"};
-  RampSink sink(/*ramp=*/false);
-  Tree tree(&sink);
-  auto sender = std::make_unique<Sender>();
-  std::string id;
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, *sender, "Return", args, &id));
-  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0 && tree.reports.ReportedSince(id, 0, 2); }, kPatience))
-      << tree.Log();
+  Chain c(/*ramp=*/false);
+  ASSERT_NO_FATAL_FAILURE(c.Start("Return", args));
+  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > 0 && c.reports.ReportedSince(c.id, 0, 2); }, kPatience))
+      << c.Log();
   for (const auto delay : delays) {
     SCOPED_TRACE("started again " + std::to_string(delay.count()) + " ms after state 3");
-    const std::size_t mark = tree.reports.StateCount(id);
-    sender->Process().Signal(SIGKILL);
-    ASSERT_TRUE(sender->Process().Wait(kPatience).has_value());
-    ASSERT_TRUE(pmtest::WaitFor([&] { return tree.reports.ReportedSince(id, mark, 3); }, kPatience)) << tree.Log();
+    const std::size_t mark = c.reports.States(c.id).size();
+    c.sender->Process().Signal(SIGKILL);
+    ASSERT_TRUE(c.sender->Process().Wait(kPatience).has_value());
+    ASSERT_TRUE(pmtest::WaitFor([&] { return c.reports.ReportedSince(c.id, mark, 3); }, kPatience)) << c.Log();
     std::this_thread::sleep_for(delay);
-    const int videos = sink.Videos(id);
+    const int videos = c.sink.Videos(c.id);
     const auto restarted = Clock::now();
-    sender = std::make_unique<Sender>();
-    ASSERT_TRUE(sender->Start(tree.folder, "Return", args));
+    c.sender = std::make_unique<Sender>();
+    ASSERT_TRUE(c.sender->Start(c.folder, "Return", args));
     // The source looks for its sender every 5 s while idle. A picture may
     // overtake the report it came with.
-    ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > videos && tree.reports.ReportedSince(id, mark, 2); },
+    ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > videos && c.reports.ReportedSince(c.id, mark, 2); },
                                 kPatience))
-        << tree.Log();
+        << c.Log();
     std::printf("started again %lld ms after state 3: pictures %.2f s later\n",
                 static_cast<long long>(delay.count()), SecondsSince(restarted));
-    const std::vector<int> all = tree.reports.States(id);
+    const std::vector<int> all = c.reports.States(c.id);
     EXPECT_EQ(std::vector<int>(all.begin() + static_cast<long>(mark), all.end()), (std::vector<int>{3, 1, 2}))
         << "states since the kill, when pictures came again";
   }
-  ASSERT_TRUE(tree.Session().StopSource(id));
-  EndDiscoveryAndExpectOrderlyExit(tree);
+  ASSERT_TRUE(c.Session().StopSource(c.id));
+  c.EndDiscoveryAndExpectOrderlyExit();
 }
 
 TEST_F(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryOrSegmentBehind) {
   constexpr int kCycles = 1000;
-  RampSink sink(/*ramp=*/false);
-  Tree tree(&sink);
-  Sender sender;
+  Chain c(/*ramp=*/false);
   // Pictures often enough that some cycles stop a source that has started
   // delivering.
-  std::string id;
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Cycle", Small("120"), &id));
-  ASSERT_NO_FATAL_FAILURE(WarmUp(tree, sink, id));
+  ASSERT_NO_FATAL_FAILURE(c.Start("Cycle", Small("120")));
+  ASSERT_NO_FATAL_FAILURE(c.WarmUp());
 
   // 4 MiB over 990 cycles is under one page (4 KiB) a cycle: a leaked
   // thread stack page, picture or segment mapping per cycle shows; the
   // allocator's own slack does not.
-  ASSERT_NO_FATAL_FAILURE(ExpectCyclesLeaveNothing(tree, "start_source/stop_source", kCycles, 10, 4 * 1024, [&] {
-    return tree.Session().StartSource(id, json::object()) && tree.Session().StopSource(id);
+  ASSERT_NO_FATAL_FAILURE(ExpectCyclesLeaveNothing(c, "start_source/stop_source", kCycles, 10, 4 * 1024, [&] {
+    return c.Session().StartSource(c.id, json::object()) && c.Session().StopSource(c.id);
   }));
-  std::printf("%d pictures along the way\n", sink.Videos(id));
-  const std::vector<std::string> bases = tree.Session().MemoryBases();
+  std::printf("%d pictures along the way\n", c.sink.Videos(c.id));
+  const std::vector<std::string> bases = c.Session().MemoryBases();
   EXPECT_EQ(bases.size(), static_cast<std::size_t>(kCycles + 1));
   EXPECT_EQ(SegmentsOf(bases), 0);
-  EndDiscoveryAndExpectOrderlyExit(tree);
+  c.EndDiscoveryAndExpectOrderlyExit();
 }
 
 // stop_source may destroy a source's queue at the very moment its listener
@@ -705,32 +519,29 @@ TEST_F(ProcessFaults, AQueueDestroyedWhileItsHostConnectionIsAcceptedDoesNotEndT
 }
 
 TEST_F(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadOrMemoryBehind) {
-  RampSink sink(/*ramp=*/false);
-  Tree tree(&sink);
-  Sender sender;
-  std::string id;
-  ASSERT_NO_FATAL_FAILURE(StartWithDiscovery(tree, sender, "Scan", Small("30"), &id));
+  Chain c(/*ramp=*/false);
+  ASSERT_NO_FATAL_FAILURE(c.Start("Scan", Small("30")));
   // The source keeps the runner up while discovery comes and goes.
-  ASSERT_TRUE(tree.Session().StartSource(id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return sink.Videos(id) > 0; }, kPatience));
-  ASSERT_TRUE(tree.Session().StopDiscovery());
+  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > 0; }, kPatience));
+  ASSERT_TRUE(c.Session().StopDiscovery());
 
   // Under 5 KiB a cycle: a leaked finder, or a scan thread's stack page,
   // per cycle shows.
-  ASSERT_NO_FATAL_FAILURE(ExpectCyclesLeaveNothing(tree, "discovery", 200, 5, 1024, [&] {
-    return tree.Session().StartDiscovery() && tree.Session().StopDiscovery();
+  ASSERT_NO_FATAL_FAILURE(ExpectCyclesLeaveNothing(c, "discovery", 200, 5, 1024, [&] {
+    return c.Session().StartDiscovery() && c.Session().StopDiscovery();
   }));
 
   // A discovery started after all those cycles still finds the sender.
-  const int announced = tree.reports.Announced(id);
-  ASSERT_TRUE(tree.Session().StartDiscovery());
-  EXPECT_TRUE(pmtest::WaitFor([&] { return tree.reports.Announced(id) > announced; }, kPatience));
-  ASSERT_TRUE(tree.Session().StopDiscovery());
-  const std::vector<std::string> bases = tree.Session().MemoryBases();
+  const int announced = c.reports.Announced(c.id);
+  ASSERT_TRUE(c.Session().StartDiscovery());
+  EXPECT_TRUE(pmtest::WaitFor([&] { return c.reports.Announced(c.id) > announced; }, kPatience));
+  ASSERT_TRUE(c.Session().StopDiscovery());
+  const std::vector<std::string> bases = c.Session().MemoryBases();
   // The last stop_source ends the task (its reply may not leave first).
-  tree.Session().StopSource(id);
-  EXPECT_EQ(tree.host.WaitRunner(kPatience), std::optional<int>(0)) << tree.Log();
-  EXPECT_EQ(tree.host.Stop(), 0);
+  c.Session().StopSource(c.id);
+  EXPECT_EQ(c.host.WaitRunner(kPatience), std::optional<int>(0)) << c.Log();
+  EXPECT_EQ(c.host.Stop(), 0);
   EXPECT_EQ(SegmentsOf(bases), 0);
 }
 

@@ -87,11 +87,15 @@ pmhost::HostOptions HostOptionsFor(const Folder& folder) {
   return o;
 }
 
-pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source, RampSink* sink) {
   pmhost::ReceiveOptions o;
   o.host = HostOptionsFor(folder);
   o.source = source;
   o.out = stderr;
+  if (sink != nullptr) {
+    o.onVideo = [sink](const pmhost::VideoFrame& frame) { sink->OnVideo({}, frame); };
+    o.onAudio = [sink](const pmhost::AudioFrame& frame) { sink->OnAudio({}, frame); };
+  }
   return o;
 }
 
@@ -210,6 +214,28 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
 }
 
 std::optional<ProcessUsage> OwnUsage() { return UsageAt("/proc/self"); }
+
+std::optional<ProcessUsage> OwnLevel() {
+  std::thread([] {}).join();
+  return OwnUsage();
+}
+
+void ExpectOwnUsageBackTo(const ProcessUsage& before) {
+  std::optional<ProcessUsage> now;
+  pmtest::WaitFor([&] {
+    now = OwnUsage();
+    return now && now->descriptors == before.descriptors && now->threads == before.threads;
+  }, kPatience);
+  ASSERT_TRUE(now.has_value());
+  EXPECT_EQ(now->descriptors, before.descriptors) << "descriptors of the test process";
+  EXPECT_EQ(now->threads, before.threads) << "threads of the test process";
+}
+
+int Occurrences(const std::string& text, const std::string& what) {
+  int n = 0;
+  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
+  return n;
+}
 
 std::optional<ProcessUsage> LevelOf(pid_t pid) {
   std::optional<ProcessUsage> level = UsageOf(pid);

@@ -1,9 +1,11 @@
 #pragma once
 // What the tests that drive real processes share: a private registry folder
 // per case, ndi-testsrc with its event lines, host options pointing at the
-// built runner and module, and probes of a process's and /dev/shm's state.
+// built runner and module, one case's whole chain (sender, host and runner),
+// and probes of a process's and /dev/shm's state.
 #include <sys/types.h>
 
+#include <algorithm>
 #include <chrono>
 #include <functional>
 #include <map>
@@ -13,11 +15,15 @@
 #include <string>
 #include <vector>
 
+#include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include "pm-host/host.h"
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
+#include "pm/runtime/json.h"
+#include "ramp_sink.h"
+#include "support/wait.h"
 
 namespace pmtest {
 
@@ -73,7 +79,9 @@ class Sender {
 
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
-pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source);
+// Receiving `source` from the folder's registry; what arrives goes to `sink`
+// as well when one is given (it must outlive the run).
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source, RampSink* sink = nullptr);
 // Receives until `done` holds (looked at every few milliseconds from the
 // start) or `limit` passes, instead of for a fixed time that a loaded machine
 // may not give the chain to get going. `o.seconds` and `o.interrupted` are
@@ -117,6 +125,142 @@ std::optional<ProcessUsage> LevelOf(pid_t pid);
 // them: waits for the level, then expects it exactly (no growth, and nothing
 // closed that should still be open).
 void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what);
+
+// What the task reported to the host, by source id. Record runs on the
+// dispatcher's receive thread; the rest on the test's thread.
+class Reports {
+ public:
+  void Record(const std::string& command, const nlohmann::json& message) {
+    const std::string id = pmjson::FieldAsString(message, "unique_id", "");
+    std::lock_guard<std::mutex> guard(lock_);
+    if (command == "pm::tsrc::update_connection_state") {
+      states_[id].push_back(static_cast<int>(pmjson::FieldAsInteger(message, "state", 0)));
+    } else if (command == "pm::tsrc::source_available") {
+      ++announced_[id];
+    }
+  }
+  std::vector<int> States(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = states_.find(id);
+    return found == states_.end() ? std::vector<int>{} : found->second;
+  }
+  // Whether `id` reported `state` after its first `from` reports.
+  bool ReportedSince(const std::string& id, std::size_t from, int state) const {
+    const std::vector<int> s = States(id);
+    return s.size() > from && std::find(s.begin() + static_cast<long>(from), s.end(), state) != s.end();
+  }
+  // How often discovery announced `id`.
+  int Announced(const std::string& id) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    auto found = announced_.find(id);
+    return found == announced_.end() ? 0 : found->second;
+  }
+
+ private:
+  mutable std::mutex lock_;  // guards states_, announced_
+  std::map<std::string, std::vector<int>> states_;
+  std::map<std::string, int> announced_;
+};
+
+// One case's process tree: the sink, a registry folder, the host in this
+// process with its runner, what the task reported, and the case's sender
+// (made in the folder, so it goes first). The gate opens when the chain
+// goes, before the host stops: a failed assertion must not leave a reader
+// thread waiting in it while the host joins that thread.
+struct Chain {
+  explicit Chain(bool ramp = true) : sink(ramp) {}
+  ~Chain() { sink.Open(); }
+  Chain(const Chain&) = delete;
+  Chain& operator=(const Chain&) = delete;
+  pmhost::Session& Session() { return host.GetSession(); }
+  pid_t Runner() const { return host.RunnerPid(); }
+  std::string Log() const { return folder.ReadRunnerLog(); }
+
+  // Starts the sender as `name`, then the host and discovery, and waits
+  // until the sender is announced.
+  void Start(const std::string& name, const std::vector<std::string>& args) {
+    ASSERT_TRUE(sender->Start(folder, name, args));
+    id = pmhost::kSourceIdPrefix + sender->Name();
+    ASSERT_TRUE(host.Start());
+    ASSERT_TRUE(Session().StartDiscovery());
+    ASSERT_TRUE(WaitFor([&] { return reports.Announced(id) > 0; }, kPatience)) << id << " never announced";
+  }
+  // Starts the source until a picture arrives, then stops it: whatever the
+  // runtime makes once and keeps is then made before `level` is taken.
+  void WarmUp(std::optional<ProcessUsage>* level = nullptr) {
+    const int before = sink.Videos(id);
+    ASSERT_TRUE(Session().StartSource(id, nlohmann::json::object()));
+    ASSERT_TRUE(WaitFor([&] { return sink.Videos(id) > before; }, kPatience)) << Log();
+    ASSERT_TRUE(Session().StopSource(id));
+    if (level == nullptr) return;
+    *level = LevelOf(Runner());
+    ASSERT_TRUE(*level);
+  }
+  std::string QueueBase() {
+    std::string base;
+    WaitFor([&] {
+      const auto queue = Session().Queue(id);
+      if (queue) base = queue->MemoryBase();
+      return !base.empty();
+    }, kPatience);
+    return base;
+  }
+  // The orderly end of a tree whose only remaining task work is discovery
+  // (stop_discovery alone does not end the task): stop it, close the
+  // connection, and the runner exits 0 having removed every segment of
+  // every memory base of the run itself.
+  void EndDiscoveryAndExpectOrderlyExit() {
+    const std::vector<std::string> bases = Session().MemoryBases();
+    EXPECT_TRUE(Session().StopDiscovery());
+    EXPECT_EQ(host.Stop(), 0) << Log();
+    EXPECT_EQ(SegmentsOf(bases), 0);
+    EXPECT_EQ(host.RemovedSegments(), 0) << "an orderly runner removes its own segments";
+  }
+  // A source that stops and gives back its segments leaves the runner at
+  // `level`.
+  void StopAndExpectBackAt(const std::string& base, const ProcessUsage& level) {
+    ASSERT_TRUE(Session().StopSource(id));
+    EXPECT_TRUE(WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
+    ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(Runner(), level, "after stop_source"));
+    EndDiscoveryAndExpectOrderlyExit();
+  }
+
+  RampSink sink;  // first: outlives the host's readers
+  Folder folder;
+  Reports reports;
+  pmhost::Host host{HostOptionsFor(folder),
+                    [this](const std::string& c, const nlohmann::json& m) { reports.Record(c, m); }, &sink};
+  std::unique_ptr<Sender> sender = std::make_unique<Sender>();
+  std::string id;
+};
+
+// This process's level before a case. A thread is started and joined first:
+// ThreadSanitizer starts a background thread of its own with the first one,
+// and that thread stays.
+std::optional<ProcessUsage> OwnLevel();
+// This process's descriptors (connections, mappings, children's pipes) and
+// threads (readers, child watchers) come back to `before`; they close a
+// moment after the objects that held them go.
+void ExpectOwnUsageBackTo(const ProcessUsage& before);
+
+// For cases that run programs: whatever the case did, this process holds
+// what it held before it.
+class OwnLevelKept : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    own_ = OwnLevel();
+    ASSERT_TRUE(own_);
+  }
+  void TearDown() override {
+    if (own_) ExpectOwnUsageBackTo(*own_);
+  }
+
+ private:
+  std::optional<ProcessUsage> own_;
+};
+
+// How often `what` occurs in `text`.
+int Occurrences(const std::string& text, const std::string& what);
 
 // The /dev/shm entries a live process has mapped (names without the folder,
 // each once), from /proc/PID/maps; entries already unlinked are included.
