@@ -1,41 +1,21 @@
 #include "ndi-loopback/registry.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cctype>
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <system_error>
 
+#include "ndi-loopback/registry_system.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 
 namespace ndilb {
 namespace {
 
 constexpr const char* kSuffix = ".ndi";
 constexpr std::size_t kMaxEntryBytes = 4096;
-
-bool ReadSmallFile(const std::string& path, std::string* out) {
-  const int fd = pm::RetryEintr([&] { return ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW); });
-  if (fd < 0) return false;
-  char buffer[kMaxEntryBytes + 1];
-  std::size_t have = 0;
-  while (have < sizeof buffer) {
-    const ssize_t n = pm::RetryEintr([&] { return ::read(fd, buffer + have, sizeof buffer - have); });
-    if (n <= 0) break;
-    have += static_cast<std::size_t>(n);
-  }
-  ::close(fd);
-  if (have > kMaxEntryBytes) return false;  // not one of ours
-  out->assign(buffer, have);
-  return true;
-}
 
 std::string Clean(const std::string& text) {
   std::string s = text;
@@ -51,14 +31,13 @@ std::string RegistryDir() {
   std::string dir;
   if (const char* env = std::getenv("NDI_LOOPBACK_DIR"); env != nullptr && env[0] != '\0') {
     dir = env;
-  } else if (const char* xdg = std::getenv("XDG_RUNTIME_DIR"); xdg != nullptr && xdg[0] != '\0') {
-    dir = std::string(xdg) + "/ndi-loopback";
   } else {
-    dir = "/tmp/ndi-loopback-" + std::to_string(::getuid());
+    dir = sys::DefaultRegistryDir();
   }
-  if (::mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
+  int error = 0;
+  if (!sys::MakePrivateDir(dir, &error)) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot create registry folder %s: %s", dir.c_str(),
-            pm::ErrnoText(errno).c_str());
+            pm::SystemErrorText(error).c_str());
   }
   return dir;
 }
@@ -72,35 +51,24 @@ std::string WriteRegistryEntry(const RegistryEntry& entry) {
   const std::string temp = dir + "/." + base + ".tmp";
   const std::string text = "ndi-loopback 1\nname=" + Clean(entry.name) + "\nurl=" + Clean(entry.url) +
                            "\npid=" + std::to_string(entry.pid) + "\n";
-  const int fd = pm::RetryEintr(
-      [&] { return ::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600); });
-  if (fd < 0) {
+  int error = 0;
+  if (!sys::WriteNewFile(temp, text, &error)) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot write registry entry %s: %s", temp.c_str(),
-            pm::ErrnoText(errno).c_str());
+            pm::SystemErrorText(error).c_str());
+    sys::RemoveFile(temp);
     return {};
   }
-  std::size_t done = 0;
-  bool ok = true;
-  while (done < text.size()) {
-    const ssize_t n = pm::RetryEintr([&] { return ::write(fd, text.data() + done, text.size() - done); });
-    if (n <= 0) {
-      ok = false;
-      break;
-    }
-    done += static_cast<std::size_t>(n);
-  }
-  ::close(fd);
-  if (!ok || ::rename(temp.c_str(), path.c_str()) != 0) {
+  if (!sys::RenameFile(temp, path, &error)) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot publish registry entry %s: %s", path.c_str(),
-            pm::ErrnoText(errno).c_str());
-    ::unlink(temp.c_str());
+            pm::SystemErrorText(error).c_str());
+    sys::RemoveFile(temp);
     return {};
   }
   return path;
 }
 
 void RemoveRegistryEntry(const std::string& path) {
-  if (!path.empty()) ::unlink(path.c_str());
+  if (!path.empty()) sys::RemoveFile(path);
 }
 
 bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
@@ -138,38 +106,27 @@ bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
   return true;
 }
 
-bool ProcessAlive(int pid) {
-  if (pid <= 0) return false;
-  if (::kill(pid, 0) != 0 && errno == ESRCH) return false;
-  // A killed child that its parent has not reaped yet still answers kill().
-  std::string stat;
-  if (ReadSmallFile("/proc/" + std::to_string(pid) + "/stat", &stat)) {
-    const std::size_t paren = stat.rfind(')');
-    if (paren != std::string::npos && paren + 2 < stat.size() && (stat[paren + 2] == 'Z' || stat[paren + 2] == 'X')) {
-      return false;
-    }
-  }
-  return true;
-}
+bool ProcessAlive(int pid) { return pid > 0 && sys::ProcessAlive(pid); }
 
 std::vector<RegistryEntry> ListRegistry() {
   std::vector<RegistryEntry> entries;
   const std::string dir = RegistryDir();
-  DIR* d = ::opendir(dir.c_str());
-  if (d == nullptr) return entries;
-  while (dirent* ent = ::readdir(d)) {
-    const std::string file = ent->d_name;
+  std::error_code error;
+  for (std::filesystem::directory_iterator it(dir, error), end; !error && it != end; it.increment(error)) {
+    const std::string file = it->path().filename().string();
     if (file.size() <= std::strlen(kSuffix) || file[0] == '.' ||
         file.compare(file.size() - std::strlen(kSuffix), std::string::npos, kSuffix) != 0) {
       continue;
     }
     std::string text;
     RegistryEntry e;
-    if (!ReadSmallFile(dir + "/" + file, &text) || !ParseRegistryEntry(text, &e)) continue;
+    if (!sys::ReadSmallFile(dir + "/" + file, kMaxEntryBytes, &text) || text.size() > kMaxEntryBytes ||
+        !ParseRegistryEntry(text, &e)) {
+      continue;
+    }
     if (!ProcessAlive(e.pid)) continue;
     entries.push_back(std::move(e));
   }
-  ::closedir(d);
   std::sort(entries.begin(), entries.end(), [](const RegistryEntry& a, const RegistryEntry& b) {
     return a.name != b.name ? a.name < b.name : a.url < b.url;
   });
@@ -177,9 +134,7 @@ std::vector<RegistryEntry> ListRegistry() {
 }
 
 std::string FullSourceName(const std::string& name) {
-  char host[256] = {};
-  if (::gethostname(host, sizeof host - 1) != 0 || host[0] == '\0') std::strcpy(host, "localhost");
-  std::string upper = host;
+  std::string upper = pm::HostName();
   for (char& c : upper) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
   return upper + " (" + name + ")";
 }

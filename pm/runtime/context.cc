@@ -1,21 +1,15 @@
 #include "pm/runtime/context.h"
 
-#include <dlfcn.h>
-#include <unistd.h>
-
 #include <atomic>
-#include <cstring>
+
+#include "pm/runtime/system.h"
 
 namespace pm {
 namespace {
 
 std::atomic<Context*> g_context{nullptr};
 
-void DefaultSink(LogType, const char* line) {
-  // One write, so lines from several threads do not mix.
-  const std::size_t n = std::strlen(line);
-  [[maybe_unused]] ssize_t written = ::write(STDERR_FILENO, line, n);
-}
+void DefaultSink(LogType, const char* line) { WriteDefaultLogLine(line); }
 
 }  // namespace
 
@@ -26,7 +20,7 @@ Context* GetContext() {
   if (Context* cached = g_context.load(std::memory_order_acquire)) return cached;
 
   Context* context = nullptr;
-  if (void* symbol = ::dlsym(RTLD_DEFAULT, kContextExportName)) {
+  if (void* symbol = FindProgramExport(kContextExportName)) {
     auto exported = reinterpret_cast<ContextExport>(symbol);
     context = exported();
     if (context == nullptr) context = new Context();

@@ -1,13 +1,12 @@
 #include "pm/runtime/syscall.h"
 
-#include <cstring>
+#include <system_error>
 
 namespace pm {
 
 std::string ErrnoText(int err) {
-  char buffer[128];
-  const char* text = ::strerror_r(err, buffer, sizeof buffer);  // GNU form
-  return std::string(text) + " (errno " + std::to_string(err) + ")";
+  // The C library's text (strerror), safely from any thread.
+  return std::generic_category().message(err) + " (errno " + std::to_string(err) + ")";
 }
 
 }  // namespace pm

@@ -3,7 +3,9 @@
 // and that a vanished peer never raises SIGPIPE.
 #include "pm/ip/socket.h"
 
+#include <arpa/inet.h>
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <signal.h>
 #include <sys/socket.h>

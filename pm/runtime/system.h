@@ -1,0 +1,32 @@
+#pragma once
+// Process-level services of the operating system that the runtime needs:
+// the main program's exports, the default log output and the process id.
+// One implementation per platform (system_posix.cc, system_win.cc).
+#include <string>
+
+namespace pm {
+
+// The address of `name` exported by the main program of this process, or
+// null when it exports no such name (dlsym(RTLD_DEFAULT) on POSIX;
+// GetModuleHandleW(nullptr) + GetProcAddress on Windows).
+void* FindProgramExport(const char* name);
+
+// The default log sink's output: the line to stderr in one write (POSIX), to
+// the debugger with OutputDebugStringA (Windows).
+void WriteDefaultLogLine(const char* line);
+
+// Every byte of `text` to the process's standard error (the runner's and the
+// host's log sinks).
+void WriteToStderr(const char* text);
+
+// The system's text for an error number of its own calls, with the number:
+// ErrnoText (POSIX); FormatMessage of a GetLastError number (Windows).
+std::string SystemErrorText(int code);
+
+// This process's id, as the system's tools show it.
+int CurrentProcessId();
+
+// The computer's name as the system reports it; "localhost" when it cannot.
+std::string HostName();
+
+}  // namespace pm

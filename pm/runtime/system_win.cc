@@ -1,0 +1,50 @@
+#include <windows.h>
+
+#include <cstring>
+
+#include "pm/runtime/system.h"
+
+namespace pm {
+
+void* FindProgramExport(const char* name) {
+  HMODULE program = ::GetModuleHandleW(nullptr);
+  if (program == nullptr) return nullptr;
+  return reinterpret_cast<void*>(::GetProcAddress(program, name));
+}
+
+void WriteDefaultLogLine(const char* line) { ::OutputDebugStringA(line); }
+
+void WriteToStderr(const char* text) {
+  HANDLE err = ::GetStdHandle(STD_ERROR_HANDLE);
+  if (err == nullptr || err == INVALID_HANDLE_VALUE) return;
+  std::size_t length = std::strlen(text);
+  while (length > 0) {
+    const DWORD chunk = length > 0x40000000 ? 0x40000000 : static_cast<DWORD>(length);
+    DWORD written = 0;
+    if (!::WriteFile(err, text, chunk, &written, nullptr) || written == 0) return;
+    text += written;
+    length -= written;
+  }
+}
+
+std::string SystemErrorText(int code) {
+  char text[512] = {};
+  const DWORD n = ::FormatMessageA(FORMAT_MESSAGE_FROM_SYSTEM | FORMAT_MESSAGE_IGNORE_INSERTS, nullptr,
+                                   static_cast<DWORD>(code), 0, text, sizeof text, nullptr);
+  std::string message(text, n);
+  while (!message.empty() && (message.back() == '\n' || message.back() == '\r' || message.back() == ' ')) {
+    message.pop_back();
+  }
+  return (message.empty() ? std::string("Windows error") : message) + " (" + std::to_string(code) + ")";
+}
+
+int CurrentProcessId() { return static_cast<int>(::GetCurrentProcessId()); }
+
+std::string HostName() {
+  char host[MAX_COMPUTERNAME_LENGTH + 1] = {};
+  DWORD size = sizeof host;
+  if (!::GetComputerNameA(host, &size) || host[0] == '\0') return "localhost";
+  return host;
+}
+
+}  // namespace pm
