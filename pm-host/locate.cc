@@ -1,9 +1,8 @@
 #include "pm-host/locate.h"
 
-#include <sys/stat.h>
-
 #include <algorithm>
 #include <filesystem>
+#include <system_error>
 
 #include "pm-host/process.h"
 #include "pm/runtime/log.h"
@@ -12,9 +11,9 @@ namespace pmhost {
 
 const char* CompanionName(Companion companion) {
   switch (companion) {
-    case Companion::Runner: return "pm-runner";
-    case Companion::Module: return "libtaskndisource.so";
-    case Companion::Sender: return "ndi-testsrc";
+    case Companion::Runner: return "pm-runner" PM_EXECUTABLE_SUFFIX;
+    case Companion::Module: return PM_MODULE_FILE;
+    case Companion::Sender: return "ndi-testsrc" PM_EXECUTABLE_SUFFIX;
   }
   return "";
 }
@@ -38,9 +37,9 @@ std::vector<std::string> CompanionCandidates(Companion companion) {
 
 std::string LocateIn(Companion companion, const std::string& folder) {
   for (const std::string& candidate : CompanionCandidates(companion)) {
-    struct stat info {};
     const std::string path = folder + candidate;
-    if (::stat(path.c_str(), &info) == 0 && S_ISREG(info.st_mode)) return std::filesystem::path(path).lexically_normal();
+    std::error_code error;
+    if (std::filesystem::is_regular_file(path, error)) return std::filesystem::path(path).lexically_normal().string();
   }
   return {};
 }

@@ -13,7 +13,8 @@ namespace pmhost {
 
 enum class Companion { Runner, Module, Sender };
 
-// "pm-runner", "libtaskndisource.so", "ndi-testsrc".
+// "pm-runner", "libtaskndisource.so", "ndi-testsrc" (on Windows
+// "pm-runner.exe", "taskndisource.dll", "ndi-testsrc.exe", all in one folder).
 const char* CompanionName(Companion companion);
 
 // The paths tried, relative to the program's folder, in order.
