@@ -12,37 +12,24 @@
 // Exit status: 0 success; 1 the job failed; 2 a usage error. Standard output
 // carries the results (with --json exactly one JSON document); log lines and
 // errors go to standard error.
-#include <signal.h>
-#include <unistd.h>
-
 #include <atomic>
 #include <cstdio>
 
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
 
+#include "pm-host/console.h"
 #include "pm-host/locate.h"
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/context.h"
+#include "pm/runtime/system.h"
 
 namespace {
 
 constexpr int kExitUsage = 2;
 
 std::atomic<bool> g_interrupted{false};
-
-void OnInterrupt(int) { g_interrupted = true; }
-
-void WriteToStderr(const char* line) {
-  std::size_t length = std::strlen(line);
-  while (length > 0) {
-    const ssize_t n = ::write(STDERR_FILENO, line, length);
-    if (n <= 0) return;
-    line += n;
-    length -= static_cast<std::size_t>(n);
-  }
-}
 
 // The default of --runner, --module or --sender as help shows it.
 std::string DefaultPath(pmhost::Companion companion) {
@@ -124,14 +111,9 @@ int main(int argc, char** argv) {
     return app.exit(e) == 0 ? 0 : kExitUsage;
   }
 
-  pm::GetContext()->logSink = [](pm::LogType, const char* line) { WriteToStderr(line); };
-  struct sigaction action {};
-  action.sa_handler = OnInterrupt;
-  sigemptyset(&action.sa_mask);
-  ::sigaction(SIGINT, &action, nullptr);
-  ::sigaction(SIGTERM, &action, nullptr);
-  ::signal(SIGPIPE, SIG_IGN);
-  const pmhost::Progress progress = ::isatty(STDOUT_FILENO) ? pmhost::Progress::Terminal : pmhost::Progress::Lines;
+  pm::GetContext()->logSink = [](pm::LogType, const char* line) { pm::WriteToStderr(line); };
+  pmhost::OnInterrupt(&g_interrupted);
+  const pmhost::Progress progress = pmhost::StdoutIsTerminal() ? pmhost::Progress::Terminal : pmhost::Progress::Lines;
 
   if (*listCommand) {
     list.host = host;
