@@ -21,9 +21,11 @@ const char* CompanionName(Companion companion) {
 std::vector<std::string> CompanionCandidates(Companion companion) {
   const std::string name = CompanionName(companion);
   if (companion != Companion::Module) return {name, "../" + name + "/" + name};
-  // The install's own module folder first (from the configured layout), then
-  // the usual library folders, then the build tree's lib/.
-  std::vector<std::string> candidates{PM_MODULEDIR_FROM_BINDIR "/" + name};
+  // Beside the program first (a Windows build or install: one folder holds
+  // the programs, the module and the DLLs), then the install's own module
+  // folder (from the configured layout), the usual library folders, and the
+  // build tree's lib/.
+  std::vector<std::string> candidates{name, PM_MODULEDIR_FROM_BINDIR "/" + name};
   const std::string arch = PM_LIBRARY_ARCHITECTURE;
   if (!arch.empty()) candidates.push_back("../lib/" + arch + "/" PM_PACKAGE_NAME "/" + name);
   candidates.push_back("../lib/" PM_PACKAGE_NAME "/" + name);

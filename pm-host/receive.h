@@ -78,10 +78,6 @@ struct ReceiveResult {
 
 ReceiveResult Receive(const ReceiveOptions& options);
 
-// User + system CPU seconds a live process has used (/proc/PID/stat); 0
-// when it cannot be read.
-double ProcessCpuSeconds(pid_t pid);
-
 // A one-line human summary; empty when no source was resolved.
 std::string SummaryText(const ReceiveResult& result);
 

@@ -5,6 +5,7 @@
 
 #include "pm/runtime/context.h"
 #include "pm/runtime/load_function.h"
+#include "support/platform.h"
 
 namespace {
 
@@ -41,9 +42,9 @@ TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
 }
 
 TEST(LoadFunction, FindsALibraryFunctionAndReportsMissingOnes) {
-  EXPECT_NE(pm::LoadFunction("libc.so.6", "strlen"), nullptr);
-  EXPECT_EQ(pm::LoadFunction("libc.so.6", "no_such_function_here"), nullptr);
-  EXPECT_EQ(pm::LoadFunction("libno-such-library.so", "strlen"), nullptr);
+  EXPECT_NE(pm::LoadFunction(pmtest::kSystemLibrary, pmtest::kSystemFunction), nullptr);
+  EXPECT_EQ(pm::LoadFunction(pmtest::kSystemLibrary, "no_such_function_here"), nullptr);
+  EXPECT_EQ(pm::LoadFunction(pmtest::kMissingLibrary, pmtest::kSystemFunction), nullptr);
 }
 
 }  // namespace
