@@ -1,5 +1,5 @@
 // The runner's message path: bytes of a connection in pieces chosen by the
-// input go through pm::FrameReader (alternating Feed and the zero-copy
+// input go through pm::ipc::FrameReader (alternating Feed and the zero-copy
 // Wanted/WritePointer/Commit path), and every complete message is routed by a
 // pm::RpcDispatcher without a connection: requests reach an echo handler, a
 // handler that throws and one that leaves a non-object response; replies meet
@@ -17,8 +17,9 @@
 #include <utility>
 
 #include "fuzz_support.h"
-#include "pm/runtime/dispatcher.h"
-#include "pm/runtime/frame_reader.h"
+#include "pm/ipc/dispatcher.h"
+#include "pm/ipc/framing.h"
+#include "support/manual_clock.h"
 
 namespace pm {
 struct RpcDispatcherTestAccess {
@@ -38,10 +39,9 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-  // Stop's grace period is for replies still being written; there are none.
-  pm::DispatcherTiming timing = pm::DispatcherTiming::Steady();
-  timing.sleep = [](std::int64_t) {};
-  pm::RpcDispatcher dispatcher(nullptr, std::move(timing));
+  // Stop's grace period is for replies still being written; there are none,
+  // and on the tests' manual clock it takes no time.
+  pm::RpcDispatcher dispatcher(nullptr, std::make_shared<pmtest::ManualClock>());
   dispatcher.RegisterHandler("echo", [](const nlohmann::json& request, nlohmann::json& response) {
     response["echo"] = request;
   });
@@ -58,7 +58,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   dispatcher.RpcRequest("ping", second, 60000,
                         [](const nlohmann::json&) { throw std::runtime_error("callback failed"); });
 
-  pm::FrameReader reader;
+  pm::ipc::FrameReader reader;
   pmfuzz::Chunker chunker(data, size);
   const std::uint8_t* piece = nullptr;
   std::size_t length = 0;
@@ -82,11 +82,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
       Check(taken == length || reader.Oversize(), "Feed stopped short without being oversize");
     }
     while (reader.Next(&message)) {
-      Check(message.size() <= pm::FrameReader::kMaxFrameBytes, "message over the frame limit");
+      Check(message.size() <= pm::ipc::kMaxFrameBytes, "message over the frame limit");
       pm::RpcDispatcherTestAccess::Handle(dispatcher, message);
     }
   }
-  if (reader.Oversize()) Check(reader.OversizeLength() > pm::FrameReader::kMaxFrameBytes, "oversize length");
+  if (reader.Oversize()) Check(reader.OversizeLength() > pm::ipc::kMaxFrameBytes, "oversize length");
   dispatcher.Stop();
   return 0;
 }

@@ -90,19 +90,12 @@ write("wire_fuzzer", "audio_split", RECEIVER_SMALL +
       head(7, 32, 2, 24) + audio + b"<a" + struct.pack("<6f", 0, 1, 2, 1000, 1001, 1002))
 write("wire_fuzzer", "bad_magic", SENDER + b"XXXX" + head(1, 8, 0, 0)[4:] + bytes(8))
 
-# --- record_fuzzer: mode (odd: the target seals the check bytes) + 64 bytes --
-def fletcher_seal(rec58):
-    s1 = s2 = 0
-    for b in rec58:
-        s1 = (s1 + b) % 255
-        s2 = (s2 + s1) % 255
-    c0 = 255 - (s1 + s2) % 255
-    c1 = 255 - (s1 + c0) % 255
-    return rec58 + bytes([c0, c1])
-
+# --- record_fuzzer: mode (odd: the target writes the check bytes) + 64 bytes --
+# Every whole record is left to the target to seal, so that the check-byte
+# arithmetic lives in one place (pm/shm/queue_record.h).
 def record(token, seg_size, stride, payload34):
     desc = struct.pack("<IQQI", 0x4350552E, 0, seg_size, stride)
-    return struct.pack("<I", token) + fletcher_seal(desc + payload34)
+    return struct.pack("<I", token) + desc + payload34 + bytes(2)
 
 def vid(code, w, h):  # media time, then the packed VideoFormat (22 bytes), zero-padded to 34
     fmt = struct.pack("<IhhIBBHHhh", code, w, h, 0, 0, ord("P"), 0, 0, 0, 0)
@@ -112,8 +105,8 @@ def aud(code, samples, rate, channels):
     return (struct.pack("<qIiIB", 0, code, samples, rate, channels)).ljust(34, b"\0")
 
 CODE_2VUY, CODE_NV12, CODE_FL32 = 0x32767579, 0x4E563132, 0x666C3332
-write("record_fuzzer", "video_2vuy", b"\0" + record(5, 1920 * 2 * 1080, 3840, vid(CODE_2VUY, 1920, 1080)))
+write("record_fuzzer", "video_2vuy", b"\1" + record(5, 1920 * 2 * 1080, 3840, vid(CODE_2VUY, 1920, 1080)))
 write("record_fuzzer", "video_nv12_sealed", b"\1" + record(6, 4096, 0, vid(CODE_NV12, 64, 32)))
-write("record_fuzzer", "audio_fl32", b"\0" + record(7, 8192, 1, aud(CODE_FL32, 1024, 48000, 2)))
+write("record_fuzzer", "audio_fl32", b"\1" + record(7, 8192, 1, aud(CODE_FL32, 1024, 48000, 2)))
 write("record_fuzzer", "audio_128ch", b"\1" + record(8, 1 << 20, 1, aud(CODE_FL32, 16, 48000, 128)))
 write("record_fuzzer", "short", b"\0" + struct.pack("<I", 9) + bytes(10))

@@ -24,11 +24,9 @@ using pmfuzz::Check;
 // Check bytes for the last two of the record's 60 bytes so that both running
 // sums over all 60 come out 0 (mod 255).
 void SealRecord(std::uint8_t* record) {
-  const pmhost::FletcherSums sums = pmhost::Fletcher16(record, pmhost::kRecordBytes - 2);
-  const unsigned c0 = 255 - (sums.sum1 + sums.sum2) % 255;
-  const unsigned c1 = 255 - (sums.sum1 + c0) % 255;
-  record[pmhost::kRecordBytes - 2] = static_cast<std::uint8_t>(c0);
-  record[pmhost::kRecordBytes - 1] = static_cast<std::uint8_t>(c1);
+  const auto check = pm::FletcherCheckBytes(record, pm::kQueueRecordBytes - 2);
+  record[pm::kQueueRecordBytes - 2] = check[0];
+  record[pm::kQueueRecordBytes - 1] = check[1];
 }
 
 }  // namespace
@@ -45,9 +43,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   // Exactly `length` bytes, so that a read past the record is caught.
   std::unique_ptr<std::uint8_t[]> wire(new std::uint8_t[length == 0 ? 1 : length]);
   if (length > 0) std::memcpy(wire.get(), data + 1, length);
-  if (seal && length == pmhost::kWireRecordBytes) {
+  if (seal && length == pm::kQueueWireRecordBytes) {
     SealRecord(wire.get() + 4);
-    const pmhost::FletcherSums sums = pmhost::Fletcher16(wire.get() + 4, pmhost::kRecordBytes);
+    const pm::FletcherSums sums = pm::Fletcher16(wire.get() + 4, pm::kQueueRecordBytes);
     Check(sums.sum1 == 0 && sums.sum2 == 0, "sealed record does not sum to 0");
   }
 
@@ -55,7 +53,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   std::string reason;
   const bool ok = pmhost::ParseRecord(length == 0 ? nullptr : wire.get(), length, &record, &reason);
   if (ok) {
-    Check(length == pmhost::kWireRecordBytes, "accepted a record of the wrong length");
+    Check(length == pm::kQueueWireRecordBytes, "accepted a record of the wrong length");
     Check(record.descriptor.size > 0 && record.descriptor.size <= pmhost::kMaxSegmentBytes, "segment size");
     Check(record.frameBytes <= record.descriptor.size, "frame larger than its segment");
     if (record.kind == pmhost::RecordKind::Video) {

@@ -12,7 +12,7 @@
 #include "ndi-loopback/sender.h"
 #include "pm/runtime/export.h"
 #include "pm/runtime/log.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 #define NDILB_EXPORT extern "C" PM_EXPORT
 

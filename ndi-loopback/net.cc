@@ -33,7 +33,16 @@ SocketHandle ListenLoopback(int* port) {
             pm::ip::ErrorText(LastSocketError::Read()).c_str());
     return kNoSocket;
   }
-  const int bound = sys::BindLoopback(fd, 0) && sys::Listen(fd, 32) ? sys::LocalPort(fd) : -1;
+  // The lowest free port from NDI_LOOPBACK_FIRST_PORT on, as the vendor
+  // runtime's senders take the lowest free one from 5961 (a port that a
+  // dead sender left is taken again at once); else any port.
+  const char* first = std::getenv("NDI_LOOPBACK_FIRST_PORT");
+  const long from = first != nullptr ? std::strtol(first, nullptr, 10) : 0;
+  bool taken = false;
+  for (long p = from; !taken && p > 0 && p < from + kFirstPortTries && p <= 65535; ++p) {
+    taken = sys::BindLoopback(fd, static_cast<int>(p));
+  }
+  const int bound = (taken || sys::BindLoopback(fd, 0)) && sys::Listen(fd, 32) ? sys::LocalPort(fd) : -1;
   if (bound <= 0) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot listen on 127.0.0.1: %s",
             pm::ip::ErrorText(LastSocketError::Read()).c_str());

@@ -14,8 +14,11 @@ inline constexpr SocketHandle kNoSocket = pm::ip::kNoSocket;
 // One piece of a gather write.
 using Piece = pm::ip::sys::Chunk;
 
-// A listening socket on 127.0.0.1 with a port chosen by the system;
-// kNoSocket on failure (logged).
+// A listening socket on 127.0.0.1; kNoSocket on failure (logged). The port is
+// the lowest free one of the kFirstPortTries from $NDI_LOOPBACK_FIRST_PORT on
+// when that is set (as the vendor runtime's senders take theirs from 5961),
+// else one chosen by the system.
+inline constexpr long kFirstPortTries = 64;
 SocketHandle ListenLoopback(int* port);
 // Accepts a pending connection of a listening socket; kNoSocket when none.
 SocketHandle AcceptFrom(SocketHandle listener);

@@ -4,7 +4,7 @@
 #include <cmath>
 #include <cstring>
 
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndilb {
 

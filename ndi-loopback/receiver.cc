@@ -74,22 +74,25 @@ Receiver::~Receiver() {
   if (thread_.joinable()) thread_.join();
 }
 
-std::string Receiver::ResolveUrl() const {
-  // The name wins: a sender that comes back may listen on a new port.
-  if (!name_.empty()) {
-    for (const RegistryEntry& e : ListRegistry()) {
-      if (e.name == name_) return e.url;
-    }
-    return {};
+std::string Receiver::ListedUrl() const {
+  if (name_.empty()) return {};
+  for (const RegistryEntry& e : ListRegistry()) {
+    if (e.name == name_) return e.url;
   }
-  return url_;
+  return {};
 }
 
 void Receiver::Run() {
   pm::SetThreadName("ndi-lb receiver");
   while (!stop_) {
-    const std::string url = ResolveUrl();
-    const SocketHandle fd = url.empty() ? kNoSocket : ConnectTo(url, kConnectTimeoutMs);
+    // As with the vendor runtime: the URL first, whoever listens there; when
+    // nothing answers, the URL listed for the name (a sender that came back
+    // may listen on a new port).
+    SocketHandle fd = url_.empty() ? kNoSocket : ConnectTo(url_, kConnectTimeoutMs);
+    if (fd == kNoSocket) {
+      const std::string listed = ListedUrl();
+      if (!listed.empty() && listed != url_) fd = ConnectTo(listed, kConnectTimeoutMs);
+    }
     if (fd != kNoSocket) {
       Serve(fd);
       connected_ = false;

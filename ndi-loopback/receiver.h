@@ -1,11 +1,14 @@
 #pragma once
 // The receiving side of the loopback runtime. One network thread per
-// receiver ("ndi-lb receiver") finds the sender by name in the registry,
-// connects, and reads frames straight into pooled buffers; whole frames go
-// into a bounded queue (the oldest frame of a kind is dropped when full) from
-// which Capture hands them out, in the FourCC and stride the vendor runtime
-// would deliver for the receiver's colour format (picture.h). When the sender goes, the thread looks the
-// name up again every 150 ms and reconnects, also to a new URL.
+// receiver ("ndi-lb receiver") connects and reads frames straight into pooled
+// buffers; whole frames go into a bounded queue (the oldest frame of a kind is
+// dropped when full) from which Capture hands them out, in the FourCC and
+// stride the vendor runtime would deliver for the receiver's colour format
+// (picture.h). As with the
+// vendor runtime, it connects to the URL it was made for, whichever sender
+// listens there, and when nothing answers there to the URL the registry lists
+// for its name; after a lost connection it tries again every 150 ms, so a
+// sender that comes back at a new URL is found once that URL is listed.
 //
 // Threads: any thread may call the public operations; the network thread is
 // started by the constructor and joined by the destructor.
@@ -22,7 +25,7 @@
 
 #include "ndi-loopback/net.h"
 #include "ndi-loopback/wire.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndilb {
 
@@ -60,7 +63,8 @@ class Receiver {
   };
 
   void Run();
-  std::string ResolveUrl() const;
+  // The URL the registry lists for the name (empty without one).
+  std::string ListedUrl() const;
   // Reads until the connection ends or the receiver stops.
   void Serve(SocketHandle fd);
   void Enqueue(std::unique_ptr<Item> item);

@@ -62,7 +62,7 @@ std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
 }
 
 Sender::~Sender() {
-  RemoveRegistryEntry(registry_path_);
+  RetireRegistryEntry(registry_path_);
   stop_ = true;
   wake_.Wake();
   if (thread_.joinable()) thread_.join();

@@ -22,7 +22,7 @@
 
 #include "ndi-loopback/net.h"
 #include "ndi-loopback/wire.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndilb {
 

@@ -3,43 +3,30 @@
 #include <cstring>
 
 #include "ndi-loopback/picture.h"
+#include "pm/runtime/little_endian.h"
 
 namespace ndilb {
 namespace {
 
-void Put32(std::uint8_t* p, std::uint32_t v) {
-  for (int i = 0; i < 4; ++i) p[i] = static_cast<std::uint8_t>(v >> (8 * i));
-}
-void Put16(std::uint8_t* p, std::uint16_t v) {
-  p[0] = static_cast<std::uint8_t>(v);
-  p[1] = static_cast<std::uint8_t>(v >> 8);
-}
-void Put64(std::uint8_t* p, std::uint64_t v) {
-  for (int i = 0; i < 8; ++i) p[i] = static_cast<std::uint8_t>(v >> (8 * i));
-}
-std::uint32_t Get32(const std::uint8_t* p) {
-  std::uint32_t v = 0;
-  for (int i = 3; i >= 0; --i) v = (v << 8) | p[i];
-  return v;
-}
-std::uint16_t Get16(const std::uint8_t* p) { return static_cast<std::uint16_t>(p[0] | p[1] << 8); }
-std::uint64_t Get64(const std::uint8_t* p) {
-  std::uint64_t v = 0;
-  for (int i = 7; i >= 0; --i) v = (v << 8) | p[i];
-  return v;
-}
-std::int32_t GetI32(const std::uint8_t* p) { return static_cast<std::int32_t>(Get32(p)); }
-std::int64_t GetI64(const std::uint8_t* p) { return static_cast<std::int64_t>(Get64(p)); }
+using pm::LoadLe16;
+using pm::LoadLe32;
+using pm::LoadLe64;
+using pm::StoreLe16;
+using pm::StoreLe32;
+using pm::StoreLe64;
+
+std::int32_t LoadLeI32(const std::uint8_t* p) { return static_cast<std::int32_t>(LoadLe32(p)); }
+std::int64_t LoadLeI64(const std::uint8_t* p) { return static_cast<std::int64_t>(LoadLe64(p)); }
 
 EncodedHead Head(MessageType type, std::uint32_t text_size, std::uint64_t payload_size) {
   EncodedHead h;
   const std::size_t info = InfoSize(type);
-  Put32(h.bytes, kWireMagic);
-  Put16(h.bytes + 4, static_cast<std::uint16_t>(type));
-  Put16(h.bytes + 6, static_cast<std::uint16_t>(info));
-  Put32(h.bytes + 8, text_size);
-  Put32(h.bytes + 12, 0);
-  Put64(h.bytes + 16, payload_size);
+  StoreLe32(h.bytes, kWireMagic);
+  StoreLe16(h.bytes + 4, static_cast<std::uint16_t>(type));
+  StoreLe16(h.bytes + 6, static_cast<std::uint16_t>(info));
+  StoreLe32(h.bytes + 8, text_size);
+  StoreLe32(h.bytes + 12, 0);
+  StoreLe64(h.bytes + 16, payload_size);
   std::memset(h.bytes + kHeaderSize, 0, info);
   h.size = kHeaderSize + info;
   return h;
@@ -155,18 +142,18 @@ bool Decoder::Feed(const void* data, std::size_t size) {
 }
 
 bool Decoder::HeaderDone() {
-  if (Get32(header_) != kWireMagic) return Fail("bad magic");
-  const std::uint16_t type = Get16(header_ + 4);
+  if (LoadLe32(header_) != kWireMagic) return Fail("bad magic");
+  const std::uint16_t type = LoadLe16(header_ + 4);
   if (type >= 32 || (limits_.allowed_types & (1u << type)) == 0) {
     return Fail("unexpected message type " + std::to_string(type));
   }
   type_ = static_cast<MessageType>(type);
-  info_size_ = Get16(header_ + 6);
+  info_size_ = LoadLe16(header_ + 6);
   if (info_size_ != InfoSize(type_)) return Fail("bad info size " + std::to_string(info_size_));
-  if (Get32(header_ + 12) != 0) return Fail("reserved field not zero");
-  text_size_ = Get32(header_ + 8);
+  if (LoadLe32(header_ + 12) != 0) return Fail("reserved field not zero");
+  text_size_ = LoadLe32(header_ + 8);
   if (text_size_ > limits_.max_text) return Fail("text of " + std::to_string(text_size_) + " bytes is too long");
-  payload_size_ = Get64(header_ + 16);
+  payload_size_ = LoadLe64(header_ + 16);
   const bool has_payload = type_ == MessageType::Video || type_ == MessageType::Audio;
   if (!has_payload && payload_size_ != 0) return Fail("payload on a message that has none");
   if (payload_size_ > limits_.max_payload) {
@@ -186,7 +173,7 @@ bool Decoder::BodyDone() {
   Message& m = current_;
   switch (type_) {
     case MessageType::Hello:
-      m.bandwidth = GetI32(b);
+      m.bandwidth = LoadLeI32(b);
       m.on_program = b[4] != 0;
       m.on_preview = b[5] != 0;
       break;
@@ -196,24 +183,24 @@ bool Decoder::BodyDone() {
       break;
     case MessageType::Metadata:
     case MessageType::ConnMetadata:
-      m.timecode = GetI64(b);
+      m.timecode = LoadLeI64(b);
       break;
     case MessageType::Ready:
       m.ptz_supported = b[0] != 0;
       break;
     case MessageType::Video: {
       VideoInfo& v = m.video;
-      v.xres = GetI32(b);
-      v.yres = GetI32(b + 4);
-      v.fourcc = Get32(b + 8);
-      v.frame_rate_N = GetI32(b + 12);
-      v.frame_rate_D = GetI32(b + 16);
-      const std::uint32_t aspect_bits = Get32(b + 20);
+      v.xres = LoadLeI32(b);
+      v.yres = LoadLeI32(b + 4);
+      v.fourcc = LoadLe32(b + 8);
+      v.frame_rate_N = LoadLeI32(b + 12);
+      v.frame_rate_D = LoadLeI32(b + 16);
+      const std::uint32_t aspect_bits = LoadLe32(b + 20);
       std::memcpy(&v.aspect, &aspect_bits, 4);
-      v.frame_format = GetI32(b + 24);
-      v.line_stride = GetI32(b + 28);
-      v.timecode = GetI64(b + 32);
-      v.timestamp = GetI64(b + 40);
+      v.frame_format = LoadLeI32(b + 24);
+      v.line_stride = LoadLeI32(b + 28);
+      v.timecode = LoadLeI64(b + 32);
+      v.timestamp = LoadLeI64(b + 40);
       const std::uint64_t expected = PictureBytes(v.fourcc, v.xres, v.yres, v.line_stride);
       if (expected == 0) return Fail("video frame with an impossible picture");
       if (expected != payload_size_) return Fail("video payload does not match its picture");
@@ -221,12 +208,12 @@ bool Decoder::BodyDone() {
     }
     case MessageType::Audio: {
       AudioInfo& a = m.audio;
-      a.sample_rate = GetI32(b);
-      a.channels = GetI32(b + 4);
-      a.samples = GetI32(b + 8);
-      if (GetI32(b + 12) != 0) return Fail("reserved field not zero");
-      a.timecode = GetI64(b + 16);
-      a.timestamp = GetI64(b + 24);
+      a.sample_rate = LoadLeI32(b);
+      a.channels = LoadLeI32(b + 4);
+      a.samples = LoadLeI32(b + 8);
+      if (LoadLeI32(b + 12) != 0) return Fail("reserved field not zero");
+      a.timecode = LoadLeI64(b + 16);
+      a.timestamp = LoadLeI64(b + 24);
       if (a.sample_rate <= 0 || a.channels <= 0 || a.channels > kMaxAudioChannels || a.samples <= 0) {
         return Fail("audio frame with impossible values");
       }
@@ -264,7 +251,7 @@ std::optional<Message> Decoder::Pop() {
 
 EncodedHead EncodeHello(std::int32_t bandwidth, bool program, bool preview) {
   EncodedHead h = Head(MessageType::Hello, 0, 0);
-  Put32(h.bytes + kHeaderSize, static_cast<std::uint32_t>(bandwidth));
+  StoreLe32(h.bytes + kHeaderSize, static_cast<std::uint32_t>(bandwidth));
   h.bytes[kHeaderSize + 4] = program ? 1 : 0;
   h.bytes[kHeaderSize + 5] = preview ? 1 : 0;
   return h;
@@ -279,7 +266,7 @@ EncodedHead EncodeTally(bool program, bool preview) {
 
 EncodedHead EncodeMetadata(MessageType type, std::int64_t timecode, std::uint32_t text_size) {
   EncodedHead h = Head(type, text_size, 0);
-  Put64(h.bytes + kHeaderSize, static_cast<std::uint64_t>(timecode));
+  StoreLe64(h.bytes + kHeaderSize, static_cast<std::uint64_t>(timecode));
   return h;
 }
 
@@ -292,30 +279,30 @@ EncodedHead EncodeReady(bool ptz_supported) {
 EncodedHead EncodeVideo(const VideoInfo& v, std::uint32_t text_size, std::uint64_t payload_size) {
   EncodedHead h = Head(MessageType::Video, text_size, payload_size);
   std::uint8_t* b = h.bytes + kHeaderSize;
-  Put32(b, static_cast<std::uint32_t>(v.xres));
-  Put32(b + 4, static_cast<std::uint32_t>(v.yres));
-  Put32(b + 8, v.fourcc);
-  Put32(b + 12, static_cast<std::uint32_t>(v.frame_rate_N));
-  Put32(b + 16, static_cast<std::uint32_t>(v.frame_rate_D));
+  StoreLe32(b, static_cast<std::uint32_t>(v.xres));
+  StoreLe32(b + 4, static_cast<std::uint32_t>(v.yres));
+  StoreLe32(b + 8, v.fourcc);
+  StoreLe32(b + 12, static_cast<std::uint32_t>(v.frame_rate_N));
+  StoreLe32(b + 16, static_cast<std::uint32_t>(v.frame_rate_D));
   std::uint32_t aspect_bits = 0;
   std::memcpy(&aspect_bits, &v.aspect, 4);
-  Put32(b + 20, aspect_bits);
-  Put32(b + 24, static_cast<std::uint32_t>(v.frame_format));
-  Put32(b + 28, static_cast<std::uint32_t>(v.line_stride));
-  Put64(b + 32, static_cast<std::uint64_t>(v.timecode));
-  Put64(b + 40, static_cast<std::uint64_t>(v.timestamp));
+  StoreLe32(b + 20, aspect_bits);
+  StoreLe32(b + 24, static_cast<std::uint32_t>(v.frame_format));
+  StoreLe32(b + 28, static_cast<std::uint32_t>(v.line_stride));
+  StoreLe64(b + 32, static_cast<std::uint64_t>(v.timecode));
+  StoreLe64(b + 40, static_cast<std::uint64_t>(v.timestamp));
   return h;
 }
 
 EncodedHead EncodeAudio(const AudioInfo& a, std::uint32_t text_size, std::uint64_t payload_size) {
   EncodedHead h = Head(MessageType::Audio, text_size, payload_size);
   std::uint8_t* b = h.bytes + kHeaderSize;
-  Put32(b, static_cast<std::uint32_t>(a.sample_rate));
-  Put32(b + 4, static_cast<std::uint32_t>(a.channels));
-  Put32(b + 8, static_cast<std::uint32_t>(a.samples));
-  Put32(b + 12, 0);
-  Put64(b + 16, static_cast<std::uint64_t>(a.timecode));
-  Put64(b + 24, static_cast<std::uint64_t>(a.timestamp));
+  StoreLe32(b, static_cast<std::uint32_t>(a.sample_rate));
+  StoreLe32(b + 4, static_cast<std::uint32_t>(a.channels));
+  StoreLe32(b + 8, static_cast<std::uint32_t>(a.samples));
+  StoreLe32(b + 12, 0);
+  StoreLe64(b + 16, static_cast<std::uint64_t>(a.timecode));
+  StoreLe64(b + 24, static_cast<std::uint64_t>(a.timestamp));
   return h;
 }
 

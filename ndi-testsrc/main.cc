@@ -1,5 +1,5 @@
 // ndi-testsrc: an NDI sender of test pictures and sound, written only against
-// the NDI C interface (taskndisource/ndi_abi.h), so that it runs unchanged on
+// the NDI C interface (ndi/ndi_abi.h), so that it runs unchanged on
 // any runtime that exports it. Every event it sees is one JSON line on stdout.
 // With --sizes the picture size changes every --frames-per-size frames (round
 // and round through the list), each change announced as
@@ -24,8 +24,8 @@
 #include <vector>
 
 #include "ndi-testsrc/pattern.h"
+#include "ndi/ndi_abi.h"
 #include "pm/runtime/system.h"
-#include "taskndisource/ndi_abi.h"
 
 namespace {
 

@@ -3,7 +3,8 @@
 #include <algorithm>
 #include <cstring>
 
-#include "taskndisource/ndi_abi.h"
+#include "pm/runtime/little_endian.h"
+#include "ndi/ndi_abi.h"
 
 namespace ndits {
 
@@ -78,15 +79,12 @@ void FillRamp(const std::vector<Plane>& planes, std::int64_t n, std::uint8_t* pi
     }
   }
   if (!planes.empty() && planes[0].row_bytes >= 8) {
-    const std::uint64_t v = static_cast<std::uint64_t>(n);
-    for (int i = 0; i < 8; ++i) picture[i] = static_cast<std::uint8_t>(v >> (8 * i));
+    pm::StoreLe64(picture, static_cast<std::uint64_t>(n));
   }
 }
 
 std::int64_t RampFrameNumber(const std::uint8_t* picture) {
-  std::uint64_t v = 0;
-  for (int i = 7; i >= 0; --i) v = (v << 8) | picture[i];
-  return static_cast<std::int64_t>(v);
+  return static_cast<std::int64_t>(pm::LoadLe64(picture));
 }
 
 std::string CheckRamp(std::uint32_t fourcc, int width, int height, int stride, const std::uint8_t* picture,

@@ -12,8 +12,8 @@
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/picture.h"
 #include "pm-host/record.h"
-#include "pm/task/formats.h"
-#include "taskndisource/ndi_abi.h"
+#include "pm/shm/formats.h"
+#include "ndi/ndi_abi.h"
 
 namespace pmhost {
 

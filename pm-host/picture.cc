@@ -9,7 +9,7 @@
 
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 namespace pmhost {
 

@@ -89,7 +89,7 @@ bool QueueReader::Handle(const std::uint8_t* wire, std::size_t length, std::uint
 
 void QueueReader::ReadLoop() {
   pm::SetThreadName("pm-host queue");
-  std::uint8_t wire[kWireRecordBytes];
+  std::uint8_t wire[pm::kQueueWireRecordBytes];
   while (running_) {
     if (!connection_->ReadFromSocket(wire, sizeof wire, kReadTimeoutMs)) {
       if (!connection_->IsConnected()) break;

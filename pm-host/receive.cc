@@ -22,7 +22,7 @@
 #include "pm/runtime/ids.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 namespace pmhost {
 

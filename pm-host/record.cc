@@ -2,16 +2,11 @@
 
 #include <cstring>
 
+#include "pm/runtime/little_endian.h"
+
 namespace pmhost {
 
 namespace {
-
-template <class T>
-T GetLE(const std::uint8_t* p) {
-  T value{};
-  std::memcpy(&value, p, sizeof value);  // the wire and this host are little-endian
-  return value;
-}
 
 bool IsPictureCode(std::uint32_t code) {
   return code == pm::kCode2vuy || code == pm::kCodeYuvs || code == pm::kCodeNV12 || code == pm::kCodeRgba;
@@ -20,15 +15,6 @@ bool IsPictureCode(std::uint32_t code) {
 bool IsSampleCode(std::uint32_t code) { return code == pm::kCodeFl32 || code == pm::kCodeSowt; }
 
 }  // namespace
-
-FletcherSums Fletcher16(const std::uint8_t* bytes, std::size_t length) {
-  FletcherSums sums;
-  for (std::size_t i = 0; i < length; ++i) {
-    sums.sum1 = (sums.sum1 + bytes[i]) % 255;
-    sums.sum2 = (sums.sum2 + sums.sum1) % 255;
-  }
-  return sums;
-}
 
 std::string CodeText(std::uint32_t code) {
   std::string text(4, '?');
@@ -41,22 +27,24 @@ std::string CodeText(std::uint32_t code) {
 
 bool ParseRecord(const std::uint8_t* wire, std::size_t length, QueueRecord* out, std::string* reason) {
   *out = QueueRecord{};
-  if (wire == nullptr || length < 4) {
+  if (wire == nullptr || length < pm::kQueueTokenBytes) {
     *reason = "record of " + std::to_string(length) + " bytes has no token";
     return false;
   }
-  out->token = GetLE<std::uint32_t>(wire);
-  if (length != kWireRecordBytes) {
+  out->token = pm::LoadLe32(wire);
+  if (length != pm::kQueueWireRecordBytes) {
     *reason = "record of " + std::to_string(length) + " bytes instead of 64";
     return false;
   }
-  const std::uint8_t* record = wire + 4;
-  const FletcherSums sums = Fletcher16(record, kRecordBytes);
+  const std::uint8_t* recordBytes = wire + pm::kQueueTokenBytes;
+  const pm::FletcherSums sums = pm::Fletcher16(recordBytes, pm::kQueueRecordBytes);
   if (sums.sum1 != 0 || sums.sum2 != 0) {
     *reason = "check sums " + std::to_string(sums.sum1) + "/" + std::to_string(sums.sum2) + " instead of 0/0";
     return false;
   }
-  std::memcpy(&out->descriptor, record, sizeof(pm::BufferDescriptor));
+  pm::PackedQueueRecord record;
+  std::memcpy(&record, recordBytes, sizeof record);
+  out->descriptor = record.descriptor;
   const pm::BufferDescriptor& d = out->descriptor;
   if (d.type != pm::kCpuMemoryType) {
     *reason = "segment type " + CodeText(d.type) + " is not a CPU segment";
@@ -66,13 +54,13 @@ bool ParseRecord(const std::uint8_t* wire, std::size_t length, QueueRecord* out,
     *reason = "segment size " + std::to_string(d.size) + " out of range";
     return false;
   }
-  const std::uint8_t* payload = record + 24;
-  out->mediaTime = GetLE<std::int64_t>(payload);
-  const auto code = GetLE<std::uint32_t>(payload + 8);
+  const auto head = pm::PayloadAs<pm::PayloadHead>(record);
+  out->mediaTime = head.mediaTime;
+  const std::uint32_t code = head.code;
 
   if (IsPictureCode(code)) {
     out->kind = RecordKind::Video;
-    std::memcpy(&out->video, payload + 8, sizeof(pm::VideoFormat));
+    out->video = pm::PayloadAs<pm::VideoPayload>(record).format;
     const pm::VideoFormat& f = out->video;
     if (f.width <= 0 || f.height <= 0) {
       *reason = "picture of " + std::to_string(f.width) + "x" + std::to_string(f.height);
@@ -97,11 +85,12 @@ bool ParseRecord(const std::uint8_t* wire, std::size_t length, QueueRecord* out,
   }
   if (IsSampleCode(code)) {
     out->kind = RecordKind::Audio;
+    const auto audio = pm::PayloadAs<pm::AudioPayload>(record);
     out->audio.code = code;
-    out->samples = GetLE<std::int32_t>(payload + 12);
-    out->audio.sampleRate = GetLE<std::uint32_t>(payload + 16);
-    out->audio.channels = payload[20];
-    const auto channels = static_cast<std::int8_t>(payload[20]);
+    out->samples = audio.samples;
+    out->audio.sampleRate = audio.sampleRate;
+    out->audio.channels = audio.channels;
+    const auto channels = static_cast<std::int8_t>(audio.channels);
     if (out->samples <= 0 || out->audio.sampleRate == 0 || channels <= 0) {
       *reason = "sound of " + std::to_string(out->samples) + " samples, " + std::to_string(channels) +
                 " channels at " + std::to_string(out->audio.sampleRate) + " Hz";

@@ -1,6 +1,6 @@
 #pragma once
-// The host's reading of one queue record (token + 60 bytes, see
-// pm/shm/shared_memory_queue.h for the layout). Pure functions over bytes:
+// The host's reading of one queue record (token + 60 bytes, laid out in
+// pm/shm/queue_record.h). Pure functions over bytes:
 // nothing here touches a socket or a segment, so tests feed it any bytes.
 //
 // A record is accepted only when
@@ -20,22 +20,14 @@
 #include <cstdint>
 #include <string>
 
+#include "pm/shm/formats.h"
+#include "pm/shm/queue_record.h"
 #include "pm/shm/shared_memory.h"
-#include "pm/task/formats.h"
 
 namespace pmhost {
 
-inline constexpr std::size_t kRecordBytes = 60;
-inline constexpr std::size_t kWireRecordBytes = 64;  // with the token in front
 // Larger segments are refused rather than mapped (a 16K RGBA picture is 2 GiB).
 inline constexpr std::uint64_t kMaxSegmentBytes = std::uint64_t{4} << 30;
-
-// The Fletcher-16 sums (sum1, sum2) of `length` bytes.
-struct FletcherSums {
-  unsigned sum1 = 0;
-  unsigned sum2 = 0;
-};
-FletcherSums Fletcher16(const std::uint8_t* bytes, std::size_t length);
 
 enum class RecordKind { Video, Audio };
 
@@ -53,7 +45,7 @@ struct QueueRecord {
   std::int32_t samples = 0;  // per channel
 };
 
-// Reads `wire` (kWireRecordBytes: the 4-byte token, then the record). True
+// Reads `wire` (pm::kQueueWireRecordBytes: the 4-byte token, then the record). True
 // with `out` filled when the record is sound; false with `reason` set
 // otherwise (out->token is filled whenever the token bytes were there, so the
 // caller can return it).

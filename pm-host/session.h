@@ -28,7 +28,7 @@
 
 #include "pm-host/queue_reader.h"
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 
 namespace pmhost {
 

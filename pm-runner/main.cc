@@ -35,10 +35,10 @@
 
 #include "pm/ipc/connection.h"
 #include "pm-runner/stop_signal.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/context.h"
 #include "pm/runtime/export.h"
 #include "pm/runtime/library.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/system.h"
 #include "pm/task/task.h"

@@ -86,7 +86,7 @@ void Discovery::ScanLoop() {
     }
   } owner{*api_, finder};
   std::uint32_t interval = firstInterval_;
-  LoopClock& clock = *env_.clock;
+  pm::Clock& clock = *env_.clock;
   while (!clock.WaitUntil(clock.NowNs() + std::int64_t{interval} * 1'000'000)) {
     if (!ScanOnce(finder)) {
       pm::LogText(kLogTag, "failed to update the NDI source list. exiting scan loop");

@@ -27,7 +27,7 @@
 #include <unordered_map>
 
 #include "pm/task/source.h"
-#include "taskndisource/loop_clock.h"
+#include "taskndisource/loop_environment.h"
 #include "taskndisource/ndi_api.h"
 
 namespace TaskNDISource {

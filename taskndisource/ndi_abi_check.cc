@@ -1,4 +1,4 @@
-// Compile-time proof that our NDI declarations (taskndisource/ndi_abi.h and
+// Compile-time proof that our NDI declarations (ndi/ndi_abi.h and
 // the NdiApi table) match the vendor runtime's C headers: the size, alignment
 // and every field offset and type of each structure we use, the value of each
 // constant, and the type of each function we call or load. Built only when
@@ -120,7 +120,7 @@
 #undef NDIlib_send_add_connection_metadata
 #undef NDIlib_send_clear_connection_metadata
 
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 #include "taskndisource/ndi_api.h"
 
 namespace {

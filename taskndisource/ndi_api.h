@@ -6,7 +6,7 @@
 
 #include <string>
 
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace TaskNDISource {
 

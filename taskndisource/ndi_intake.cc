@@ -21,7 +21,7 @@
 #include <limits>
 
 #include "pm/runtime/log.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 #include "taskndisource/ndi_source.h"
 
 namespace TaskNDISource {

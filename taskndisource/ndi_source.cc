@@ -33,6 +33,8 @@ class Defer {
 struct NDISource::LoopState {
   void* receiver = nullptr;
   void* finder = nullptr;
+  std::string url;                 // the receiver was made for it
+  std::int64_t nextListLookNs = 0;  // when a receiver's URL is next compared with the list
   bool tallyLive = false;
   bool tallyPreview = false;
   bool tallyDirty = false;
@@ -272,9 +274,9 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
   switch (s) {
     case ReceiverState::Connecting: {
       loop.toReport = 1;
+      if (loop.receiver != nullptr && ListedElsewhere(loop)) return;
       if (loop.receiver == nullptr) {
-        const std::string& id = UniqueId();
-        const std::string name = id.size() >= kSourceIdPrefixLength ? id.substr(kSourceIdPrefixLength) : std::string();
+        const std::string name = SenderName();
         std::string url;
         if (!FindSourceUrl(loop, name, &url)) {
           loop.wanted = ReceiverState::Error;
@@ -298,6 +300,8 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
           loop.wanted = ReceiverState::Error;
           return;
         }
+        loop.url = url;
+        loop.nextListLookNs = env_.clock->NowNs() + kRetryWaitMs * 1'000'000;
       }
       if (loop.attempts * kRetryWaitMs >= kConnectLimitMs) {
         loop.wanted = ReceiverState::Idle;
@@ -331,6 +335,10 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
       if (loop.receiver == nullptr) {
         pm::LogText(kLogTag, "expected receiver in receiving state");
         loop.wanted = ReceiverState::Error;
+        return;
+      }
+      if (ListedElsewhere(loop)) {
+        loop.wanted = ReceiverState::Connecting;
         return;
       }
       if (loop.tallyDirty) {
@@ -377,6 +385,38 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
   }
 }
 
+std::string NDISource::SenderName() const {
+  const std::string& id = UniqueId();
+  return id.size() >= kSourceIdPrefixLength ? id.substr(kSourceIdPrefixLength) : std::string();
+}
+
+const ndi_source* NDISource::ListedSource(void* finder, const std::string& name) {
+  std::uint32_t count = 0;
+  const ndi_source* list = api_->find_get_current_sources(finder, &count);
+  if (list == nullptr) return nullptr;
+  for (std::uint32_t i = 0; i < count; ++i) {
+    if (list[i].ndi_name != nullptr && name == list[i].ndi_name) return &list[i];
+  }
+  return nullptr;
+}
+
+bool NDISource::ListedElsewhere(LoopState& loop) {
+  const std::int64_t now = env_.clock->NowNs();
+  if (now < loop.nextListLookNs) return false;
+  loop.nextListLookNs = now + kRetryWaitMs * 1'000'000;
+  const ndi_source* listed = ListedSource(loop.finder, SenderName());
+  // A sender that is not listed at all (or without a URL) for a moment keeps
+  // its receiver.
+  if (listed == nullptr || listed->url_address == nullptr || listed->url_address[0] == '\0' ||
+      loop.url == listed->url_address) {
+    return false;
+  }
+  pm::Log(pm::LogType::Normal, kLogTag, "source listed at a new url (%s): making its receiver again", listed->url_address);
+  api_->recv_destroy(loop.receiver);
+  loop.receiver = nullptr;
+  return true;
+}
+
 bool NDISource::FindSourceUrl(LoopState& loop, const std::string& name, std::string* url) {
   url->clear();
   if (loop.finder == nullptr) {
@@ -390,17 +430,12 @@ bool NDISource::FindSourceUrl(LoopState& loop, const std::string& name, std::str
       return false;
     }
   }
-  std::uint32_t count = 0;
-  const ndi_source* list = api_->find_get_current_sources(loop.finder, &count);
-  if (list == nullptr || count == 0) return true;
-  for (std::uint32_t i = 0; i < count; ++i) {
-    if (list[i].ndi_name == nullptr || name != list[i].ndi_name) continue;
-    if (list[i].url_address != nullptr) *url = list[i].url_address;
-    if (url->empty()) {
-      pm::LogText(kLogTag, "source has no url\n");
-      return false;
-    }
-    return true;
+  const ndi_source* listed = ListedSource(loop.finder, name);
+  if (listed == nullptr) return true;
+  if (listed->url_address != nullptr) *url = listed->url_address;
+  if (url->empty()) {
+    pm::LogText(kLogTag, "source has no url\n");
+    return false;
   }
   return true;
 }

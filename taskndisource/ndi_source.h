@@ -10,6 +10,12 @@
 //   Connecting -> Idle        120 attempts (30 s at 250 ms) with a receiver
 //   Connecting -> Error       no finder, sender listed without URL, no receiver
 //   Receiving  -> Idle        nothing captured and 0 connections
+//   Receiving  -> Connecting  the finder lists the sender at another URL than
+//                             its receiver was made for (looked at every
+//                             250 ms, also while connecting): the receiver is
+//                             made again for the listed URL. A dead sender's
+//                             URL stays listed for a while, and a receiver
+//                             takes whichever sender listens at its URL.
 //   Idle       -> Connecting  the receiver has a connection again (polled every 5 s)
 //   Error                     stays (polled every 5 s) until Stop or a reconnect
 //   any        -> Exiting     Stop; the loop ends at its next pass
@@ -39,7 +45,7 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/task/source.h"
-#include "taskndisource/loop_clock.h"
+#include "taskndisource/loop_environment.h"
 #include "taskndisource/ndi_api.h"
 
 namespace tinyxml2 {
@@ -154,6 +160,14 @@ class NDISource : public pm::Source {
   void RunLoop();
   void LoopPass(LoopState& loop, bool& leave);
   bool FindSourceUrl(LoopState& loop, const std::string& name, std::string* url);
+  // The NDI name in the unique id (empty when the id is too short).
+  std::string SenderName() const;
+  // The first entry of the finder's current list with this name, or null.
+  const ndi_source* ListedSource(void* finder, const std::string& name);
+  // At most every kRetryWaitMs: when the finder lists the sender at another
+  // URL than its receiver was made for, destroys the receiver and returns
+  // true (the next Connecting pass makes it for the listed URL).
+  bool ListedElsewhere(LoopState& loop);
   // Returns true when a frame was delivered.
   bool CaptureOnce(void* receiver, MediaInfo* info);
   // "receiver_info" then "media_settings"; false when either is not sent.

@@ -46,7 +46,7 @@
 #include "pm-host/checks.h"
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 

@@ -35,10 +35,12 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
+#include "pm/ipc/framing.h"
 #include "pm/ipc/server.h"
 #include "pm/runtime/clock.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/json.h"
+#include "pm/runtime/little_endian.h"
 
 namespace {
 
@@ -54,13 +56,6 @@ std::string RequestText() {
 std::string ReplyText() {
   return pmjson::Dump(
       {{"pm::command", kCommand}, {"pm::response", true}, {"pm::unique_id", 1000}, {"value", 12345}});
-}
-
-std::string Frame(const std::string& text) {
-  const auto n = static_cast<std::uint32_t>(text.size());
-  std::string out(4, '\0');
-  for (int i = 0; i < 4; ++i) out[static_cast<std::size_t>(i)] = static_cast<char>((n >> (8 * i)) & 0xFF);
-  return out + text;
 }
 
 bool SendAll(int fd, const std::string& bytes) {
@@ -89,8 +84,7 @@ bool RecvExact(int fd, char* out, std::size_t n) {
 bool RecvFrame(int fd, std::string& body) {
   unsigned char header[4];
   if (!RecvExact(fd, reinterpret_cast<char*>(header), 4)) return false;
-  const std::uint32_t n = header[0] | header[1] << 8 | header[2] << 16 |
-                          static_cast<std::uint32_t>(header[3]) << 24;
+  const std::uint32_t n = pm::LoadLe32(header);
   body.resize(n);
   return RecvExact(fd, body.data(), n);
 }
@@ -136,7 +130,7 @@ int ConnectTo(int port) {
 // frame with the reply frame.
 class RawPair {
  public:
-  RawPair() : request_(Frame(RequestText())), reply_(Frame(ReplyText())) {
+  RawPair() : request_(pm::ipc::EncodeFrame(RequestText())), reply_(pm::ipc::EncodeFrame(ReplyText())) {
     client_ = ConnectTo(listener_.port);
     server_ = listener_.Accept();
     echo_ = std::thread([this] {
@@ -173,7 +167,7 @@ void InstallPingHandler(pm::RpcDispatcher& dispatcher) {
 // A plain-socket host sending requests to a dispatcher's handler.
 class HostToDispatcher {
  public:
-  HostToDispatcher() : request_(Frame(RequestText())) {
+  HostToDispatcher() : request_(pm::ipc::EncodeFrame(RequestText())) {
     std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.port);
     host_ = listener_.Accept();
     if (!connection || host_ < 0) return;

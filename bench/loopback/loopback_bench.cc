@@ -23,7 +23,8 @@
 #include <vector>
 
 #include "ndi-testsrc/pattern.h"
-#include "taskndisource/ndi_abi.h"
+#include "pm/runtime/little_endian.h"
+#include "ndi/ndi_abi.h"
 
 extern char** environ;
 
@@ -42,7 +43,7 @@ int RunSender(const std::string& name, int width, int height, int fps, double se
   NDIlib_send_get_no_connections(sender, 10000);
   const auto end = std::chrono::steady_clock::now() + std::chrono::duration<double>(seconds);
   for (std::int64_t n = 0; std::chrono::steady_clock::now() < end; ++n) {
-    for (int i = 0; i < 8; ++i) picture[i] = static_cast<std::uint8_t>(static_cast<std::uint64_t>(n) >> (8 * i));
+    pm::StoreLe64(picture.data(), static_cast<std::uint64_t>(n));
     ndi_video_frame_v2 f{};
     f.xres = width;
     f.yres = height;

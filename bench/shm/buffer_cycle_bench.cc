@@ -17,8 +17,8 @@
 #include <vector>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "pm/task/callbacks.h"
 

@@ -12,9 +12,9 @@
 #include <string>
 #include <vector>
 
+#include "pm/shm/formats.h"
 #include "pm/shm/shared_cpu_memory_posix.h"
 #include "pm/task/buffers.h"
-#include "pm/task/formats.h"
 
 namespace {
 

@@ -58,15 +58,14 @@ bool Connection::Send(BufferList buffers) {
 
 bool Connection::SendMessage(std::shared_ptr<Connection> connection, const std::string& text) {
   if (!connection) return false;
-  if (text.size() > kMaxMessageBytes) {
+  if (text.size() > kMaxFrameBytes) {
     Log(LogType::Normal, "", "Connection::SendMessage: message of %zu bytes is over the limit of %u\n", text.size(),
-        kMaxMessageBytes);
+        kMaxFrameBytes);
     return false;
   }
   const auto length = static_cast<std::uint32_t>(text.size());
-  const std::uint8_t prefix[4] = {static_cast<std::uint8_t>(length), static_cast<std::uint8_t>(length >> 8),
-                                  static_cast<std::uint8_t>(length >> 16), static_cast<std::uint8_t>(length >> 24)};
-  return connection->Send(BufferList{{prefix, 4}, {text.data(), length}});
+  const auto prefix = FramePrefix(length);
+  return connection->Send(BufferList{{prefix.data(), kFrameHeaderBytes}, {text.data(), length}});
 }
 
 bool Connection::ReadFromSocket(void* destination, std::size_t length, std::int64_t timeoutMs) {

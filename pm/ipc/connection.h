@@ -3,8 +3,7 @@
 //
 // Wire formats carried on a connection (all integers little-endian):
 //  1. Message frame (request dispatcher): 4-byte length N, then N bytes of
-//     JSON text. N <= kMaxMessageBytes (524,288); a longer message is never
-//     sent, and a receiver closes a connection that announces one.
+//     JSON text, N <= kMaxFrameBytes (pm/ipc/framing.h).
 //  2. Queue record, task to host: 4-byte token, then exactly R record bytes
 //     (R fixed when the queue producer starts; 60 for the shared-memory queue).
 //  3. Token return, host to task: 4 bytes.
@@ -36,10 +35,9 @@
 #include <vector>
 
 #include "pm/ip/socket.h"
+#include "pm/ipc/framing.h"
 
 namespace pm::ipc {
-
-inline constexpr std::uint32_t kMaxMessageBytes = 524288;
 
 class Connection {
  public:
@@ -57,7 +55,7 @@ class Connection {
   // Sends the buffers back to back as one write, atomically with respect to
   // other senders. False when not connected or when the write failed.
   bool Send(BufferList buffers);
-  // Message frame: false (nothing written) for texts over kMaxMessageBytes.
+  // Message frame: false (nothing written) for texts over kMaxFrameBytes.
   static bool SendMessage(std::shared_ptr<Connection> connection, const std::string& text);
   // Reads exactly `length` bytes. False when not connected, on timeout (the
   // connection stays usable) or when the peer has gone (connected turns false).

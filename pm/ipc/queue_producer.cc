@@ -2,17 +2,13 @@
 
 #include <algorithm>
 
+#include "pm/runtime/little_endian.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/thread_name.h"
 
 namespace pm::ipc::queue {
 
 namespace {
-
-std::uint32_t FromLittleEndian(const std::uint8_t* b) {
-  return std::uint32_t(b[0]) | (std::uint32_t(b[1]) << 8) | (std::uint32_t(b[2]) << 16) |
-         (std::uint32_t(b[3]) << 24);
-}
 
 // Reads and discards 4-byte blocks until none arrives within a millisecond.
 void Drain(Connection& connection) {
@@ -132,9 +128,8 @@ bool Producer::Send(std::uint32_t token, const BufferList& record) {
   // (its socket buffer full) then blocks only this sender, never Stop, the
   // other senders' accounting or the producer thread's token returns. Each
   // Connection's own lock keeps concurrent records whole on its wire.
-  const std::uint8_t tokenBytes[4] = {static_cast<std::uint8_t>(token), static_cast<std::uint8_t>(token >> 8),
-                                      static_cast<std::uint8_t>(token >> 16),
-                                      static_cast<std::uint8_t>(token >> 24)};
+  std::uint8_t tokenBytes[4];
+  StoreLe32(tokenBytes, token);
   BufferList list;
   list.reserve(record.size() + 1);
   list.emplace_back(tokenBytes, 4);
@@ -229,7 +224,7 @@ void Producer::ThreadMain(const std::weak_ptr<Semaphore>& started) {
       const bool read = connection->ReadFromSocket(block, sizeof block, kTokenReadTimeoutMs);
       if (connection == wakeReader) continue;  // the wake word only ends the wait
       if (read) {
-        const std::uint32_t token = FromLittleEndian(block);
+        const std::uint32_t token = LoadLe32(block);
         if (Release(connection, token) && releaseCallback_) releaseCallback_(token);
       } else if (!connection->IsConnected()) {
         for (std::uint32_t token : DropReader(connection)) {

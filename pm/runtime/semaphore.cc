@@ -20,11 +20,13 @@ void Semaphore::Wait() {
 
 bool Semaphore::WaitUntil(std::int64_t deadlineNs) {
   std::unique_lock<std::mutex> lock(mutex_);
-  while (count_ < 1) {
-    const std::int64_t now = SteadyNowNs();
-    if (now >= deadlineNs) break;
-    cv_.wait_for(lock, std::chrono::nanoseconds(deadlineNs - now));
+  if (deadlineNs == INT64_MAX) {
+    cv_.wait(lock, [this] { return count_ >= 1; });
   }
+  // An absolute time point on the steady clock (the time base of SteadyNowNs),
+  // so that far deadlines cannot overflow a relative wait.
+  const std::chrono::steady_clock::time_point deadline{std::chrono::nanoseconds(deadlineNs)};
+  while (count_ < 1 && SteadyNowNs() < deadlineNs) cv_.wait_until(lock, deadline);
   if (count_ >= 1) {
     --count_;
     return true;

@@ -21,7 +21,8 @@ class Semaphore {
   // Waits until the count is at least 1, then takes one.
   void Wait();
   // Waits until the count is at least 1 or the steady clock (SteadyNowNs)
-  // reaches deadlineNs. Returns true and takes one when the count allowed it.
+  // reaches deadlineNs (INT64_MAX: no time limit). Returns true and takes one
+  // when the count allowed it.
   bool WaitUntil(std::int64_t deadlineNs);
 
  private:

@@ -9,8 +9,8 @@
 #include <memory>
 
 #include "pm/runtime/context.h"
+#include "pm/shm/formats.h"
 #include "pm/shm/shared_memory.h"
-#include "pm/task/formats.h"
 
 namespace pm {
 

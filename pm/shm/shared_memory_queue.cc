@@ -6,8 +6,8 @@
 #include <utility>
 
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/runtime/log.h"
 #include "pm/shm/shared_gpu_memory.h"
 
@@ -51,19 +51,6 @@ SharedMemoryQueueProducer::~SharedMemoryQueueProducer() {
   gpuManager_.reset();
 }
 
-void SharedMemoryQueueProducer::CheckBytes(const std::uint8_t* bytes, std::size_t length, std::uint8_t out[2]) {
-  unsigned sum1 = 0;
-  unsigned sum2 = 0;
-  for (std::size_t i = 0; i < length; ++i) {
-    sum1 = (sum1 + bytes[i]) % 255;
-    sum2 = (sum2 + sum1) % 255;
-  }
-  const unsigned c0 = 255 - ((sum1 + sum2) % 255);
-  const unsigned c1 = 255 - ((sum1 + c0) % 255);
-  out[0] = static_cast<std::uint8_t>(c0);
-  out[1] = static_cast<std::uint8_t>(c1);
-}
-
 int SharedMemoryQueueProducer::Port() const {
   std::lock_guard<std::mutex> guard(const_cast<std::mutex&>(serverLock_));
   return server_ ? server_->GetPort() : 0;
@@ -75,8 +62,8 @@ void SharedMemoryQueueProducer::StartQueue(std::shared_ptr<RpcDispatcher> dispat
   memoryBase_ = std::move(memoryBase);
   dispatcher_ = std::move(dispatcher);
   commandPrefix_ = std::move(commandPrefix);
-  payloadSize_ = kPayloadSize;
-  recordSize_ = kRecordSize;
+  payloadSize_ = kQueuePayloadBytes;
+  recordSize_ = kQueueRecordBytes;
 
   int port = 0;
   {
@@ -123,20 +110,21 @@ bool SharedMemoryQueueProducer::SendBuffer(const std::shared_ptr<SharedMemory>& 
     std::lock_guard<std::mutex> guard(lock_);
     auto it = buffers_.find(segment->id);
     inPool = it != buffers_.end() && it->second == segment;
-    if (inPool && payloadSize_ != kPayloadSize) return false;  // not started
+    if (inPool && payloadSize_ != kQueuePayloadBytes) return false;  // not started
   }
   if (!inPool) {
     LogText("", "SharedMemoryQueueProducer: Attempt to use deleted buffer\n");
     return false;
   }
-  std::uint8_t record[kRecordSize];
-  std::memcpy(record, &segment->descriptor, sizeof(BufferDescriptor));
-  std::memcpy(record + sizeof(BufferDescriptor), payload, kPayloadSize);
-  CheckBytes(record, kRecordSize - 2, record + kRecordSize - 2);
+  PackedQueueRecord record;
+  record.descriptor = segment->descriptor;
+  std::memcpy(record.payload, payload, kQueuePayloadBytes);
+  SealQueueRecord(record);
+  const auto* bytes = reinterpret_cast<const std::uint8_t*>(&record);
   BufferList list;
-  list.emplace_back(record, static_cast<std::uint32_t>(sizeof(BufferDescriptor)));
-  list.emplace_back(record + sizeof(BufferDescriptor), kPayloadSize);
-  list.emplace_back(record + kRecordSize - 2, 2u);
+  list.emplace_back(bytes + offsetof(PackedQueueRecord, descriptor), std::uint32_t{sizeof record.descriptor});
+  list.emplace_back(bytes + offsetof(PackedQueueRecord, payload), std::uint32_t{sizeof record.payload});
+  list.emplace_back(bytes + offsetof(PackedQueueRecord, check), std::uint32_t{sizeof record.check});
   return producer_.Send(segment->id, std::move(list));
 }
 

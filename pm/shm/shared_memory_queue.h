@@ -7,12 +7,8 @@
 // the request "<commandPrefix>::start_queue" {"port", "memoryBase"}; the host
 // connects to that port once (the server stops listening after the first
 // connection) and then receives, for every sent buffer, the segment id as a
-// 4-byte token followed by a 60-byte record:
-//
-//   offset 0   24 bytes  the segment's BufferDescriptor (type, reserved, size, stride)
-//   offset 24  34 bytes  payload (video or audio, written by the frame buffers)
-//   offset 58   2 bytes  Fletcher-16 check bytes: the sums over all 60 bytes are 0
-//
+// 4-byte token followed by the 60-byte queue record (pm/shm/queue_record.h:
+// the segment's descriptor, the payload the frame buffers fill, check bytes),
 // and returns the token when it has read the segment. Segments that go away
 // are announced with "<commandPrefix>::delete_memory" {"unique_id": id}.
 //
@@ -38,8 +34,9 @@
 #include <string>
 
 #include "pm/ipc/queue_producer.h"
+#include "pm/shm/formats.h"
+#include "pm/shm/queue_record.h"
 #include "pm/shm/shared_memory.h"
-#include "pm/task/formats.h"
 
 namespace pm {
 
@@ -70,8 +67,6 @@ class SharedMemoryQueue : public std::enable_shared_from_this<SharedMemoryQueue>
 
 class SharedMemoryQueueProducer : public SharedMemoryQueue {
  public:
-  static constexpr std::uint32_t kPayloadSize = 34;
-  static constexpr std::uint32_t kRecordSize = 60;
   static constexpr std::uint64_t kSegmentAlignment = 4096;
   static constexpr std::int64_t kControlTimeoutMs = 100;
 
@@ -85,11 +80,17 @@ class SharedMemoryQueueProducer : public SharedMemoryQueue {
   void StartQueue(std::shared_ptr<RpcDispatcher> dispatcher, std::string commandPrefix, std::string memoryBase,
                   std::function<void()> onHostConnected);
 
-  // Sends the record of `segment` with `payload` (kPayloadSize bytes). On true
-  // the segment's hold travels with the record; on false (queue not started,
-  // segment no longer in the pool, record refused) nothing was sent and the
-  // hold stays with the caller.
+  // Sends the record of `segment` with `payload` (kQueuePayloadBytes bytes).
+  // On true the segment's hold travels with the record; on false (queue not
+  // started, segment no longer in the pool, record refused) nothing was sent
+  // and the hold stays with the caller.
   bool SendBuffer(const std::shared_ptr<SharedMemory>& segment, const std::uint8_t* payload);
+  bool SendBuffer(const std::shared_ptr<SharedMemory>& segment, const VideoPayload& payload) {
+    return SendBuffer(segment, reinterpret_cast<const std::uint8_t*>(&payload));
+  }
+  bool SendBuffer(const std::shared_ptr<SharedMemory>& segment, const AudioPayload& payload) {
+    return SendBuffer(segment, reinterpret_cast<const std::uint8_t*>(&payload));
+  }
 
   // A free segment of the pool that fits `format` (at least the format's frame
   // size at the larger of its default stride and `minimumStride`), with one
@@ -119,10 +120,6 @@ class SharedMemoryQueueProducer : public SharedMemoryQueue {
 
   // The port the host connects to; 0 before StartQueue.
   int Port() const;
-
-  // The Fletcher-16 check bytes of bytes[0, length): appended to the data,
-  // both running sums over the whole come out 0.
-  static void CheckBytes(const std::uint8_t* bytes, std::size_t length, std::uint8_t out[2]);
 
  private:
   std::uint32_t NextBufferId();  // lock_ held

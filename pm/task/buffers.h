@@ -9,7 +9,7 @@
 #include <functional>
 #include <utility>
 
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 namespace pm {
 

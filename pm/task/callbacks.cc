@@ -1,12 +1,12 @@
 #include "pm/task/callbacks.h"
 
-#include <cstring>
 #include <utility>
 
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/ids.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
+#include "pm/shm/queue_record.h"
 #include "pm/shm/shared_memory.h"
 #include "pm/shm/shared_memory_queue.h"
 
@@ -67,19 +67,14 @@ class SourceAudioBuffer final : public AudioBuffer {
   bool sent = false;
 };
 
-template <class T>
-void PutLE(std::uint8_t* at, T value) {
-  std::memcpy(at, &value, sizeof value);  // little-endian host
-}
-
 }  // namespace
 
 SourceCallbacks::SourceCallbacks(std::shared_ptr<RpcDispatcher> dispatcher, std::string sourceId,
-                                 MediaClock::NowFn now)
+                                 std::shared_ptr<Clock> clock)
     : producer_(std::make_shared<SharedMemoryQueueProducer>()),
       dispatcher_(std::move(dispatcher)),
       sourceId_(std::move(sourceId)),
-      clock_(std::move(now)) {}
+      clock_(std::move(clock)) {}
 
 SourceCallbacks::~SourceCallbacks() = default;
 
@@ -196,9 +191,9 @@ void SourceCallbacks::SendVideoBuffer(std::int64_t mediaTime, std::shared_ptr<Vi
   auto* video = dynamic_cast<SourceVideoBuffer*>(buffer.get());
   if (video == nullptr) return;
   if (video->segment->IsLocked()) LogText("", "Source has outstanding mapping while sending buffer\n");
-  std::uint8_t payload[SharedMemoryQueueProducer::kPayloadSize] = {};
-  PutLE(payload, mediaTime);
-  std::memcpy(payload + 8, &video->format, sizeof(VideoFormat));
+  VideoPayload payload;
+  payload.mediaTime = mediaTime;
+  payload.format = video->format;
   video->sent = true;
   // A refused record keeps its hold with the buffer, which gives it back.
   if (!producer_->SendBuffer(video->segment, payload)) video->sent = false;
@@ -207,12 +202,12 @@ void SourceCallbacks::SendVideoBuffer(std::int64_t mediaTime, std::shared_ptr<Vi
 void SourceCallbacks::SendAudioBuffer(std::int64_t mediaTime, std::shared_ptr<AudioBuffer> buffer) {
   auto* audio = dynamic_cast<SourceAudioBuffer*>(buffer.get());
   if (audio == nullptr) return;
-  std::uint8_t payload[SharedMemoryQueueProducer::kPayloadSize] = {};
-  PutLE(payload, mediaTime);
-  PutLE(payload + 8, audio->format.code);
-  PutLE(payload + 12, audio->sampleCount);
-  PutLE(payload + 16, audio->format.sampleRate);
-  payload[20] = audio->format.channels;
+  AudioPayload payload;
+  payload.mediaTime = mediaTime;
+  payload.code = audio->format.code;
+  payload.samples = audio->sampleCount;
+  payload.sampleRate = audio->format.sampleRate;
+  payload.channels = audio->format.channels;
   clock_.AudioSent(audio->sampleCount);
   audio->sent = true;
   if (!producer_->SendBuffer(audio->segment, payload)) audio->sent = false;

@@ -34,9 +34,9 @@ class SourceCallbacks : public Source::Callbacks {
   static constexpr std::int32_t kDefaultMaxVideoBuffers = 240;
   static constexpr std::int32_t kDefaultMaxAudioBuffers = 3840;
 
-  // `now` (steady nanoseconds) drives the media clock; tests pass their own.
+  // `clock` drives the media clock (the steady clock when none is given).
   SourceCallbacks(std::shared_ptr<RpcDispatcher> dispatcher, std::string sourceId,
-                  MediaClock::NowFn now = {});
+                  std::shared_ptr<Clock> clock = nullptr);
   ~SourceCallbacks() override;
 
   void SetMaxVideoBuffers(std::int32_t count) override { maxVideoBuffers_ = count; }

@@ -2,15 +2,14 @@
 
 #include <algorithm>
 
-#include "pm/runtime/clock.h"
-
 namespace pm {
 
-MediaClock::MediaClock(NowFn now) : now_(now ? std::move(now) : NowFn(SteadyNowNs)), epoch_(now_()) {}
+MediaClock::MediaClock(std::shared_ptr<Clock> clock)
+    : clock_(clock ? std::move(clock) : MakeSteadyClock()), epoch_(clock_->NowNs()) {}
 
 std::int64_t MediaClock::CurrentTimeLocked() const {
   // 441/625 = 705,600,000 / 1,000,000,000, truncating toward zero.
-  return (now_() - epoch_) * 441 / 625;
+  return (clock_->NowNs() - epoch_) * 441 / 625;
 }
 
 std::int64_t MediaClock::CurrentTime() {
@@ -74,7 +73,7 @@ void MediaClock::AudioSent(std::int32_t samples) {
 
 void MediaClock::Reset() {
   std::lock_guard<std::mutex> guard(mutex_);
-  epoch_ = now_();
+  epoch_ = clock_->NowNs();
   audioSamplesSent_ = 0;
   audioBuffersSent_ = 0;
   lastAudioTime_ = -1;

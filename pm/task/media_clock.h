@@ -7,9 +7,11 @@
 // A source normally calls all of them from its frame thread.
 
 #include <cstdint>
-#include <functional>
+#include <memory>
 #include <mutex>
 #include <utility>
+
+#include "pm/runtime/clock.h"
 
 namespace pm {
 
@@ -17,10 +19,9 @@ inline constexpr std::int64_t kTicksPerSecond = 705600000;
 
 class MediaClock {
  public:
-  // Steady time in nanoseconds; tests pass their own.
-  using NowFn = std::function<std::int64_t()>;
-
-  explicit MediaClock(NowFn now = {});
+  // Reads the time of `clock` (a steady clock of its own when none is given;
+  // tests pass one they move by hand).
+  explicit MediaClock(std::shared_ptr<Clock> clock = nullptr);
 
   // Ticks since the epoch (construction or the last Reset).
   std::int64_t CurrentTime();
@@ -39,7 +40,7 @@ class MediaClock {
  private:
   std::int64_t CurrentTimeLocked() const;
 
-  NowFn now_;
+  const std::shared_ptr<Clock> clock_;
   std::mutex mutex_;  // guards every field below
   std::int64_t epoch_;
   std::int64_t audioSamplesSent_ = 0;

@@ -11,8 +11,8 @@
 
 #include <nlohmann/json.hpp>
 
+#include "pm/shm/formats.h"
 #include "pm/task/buffers.h"
-#include "pm/task/formats.h"
 
 namespace pm {
 

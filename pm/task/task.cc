@@ -3,8 +3,8 @@
 
 #include <utility>
 
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 
 namespace pm {
 

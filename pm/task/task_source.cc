@@ -4,7 +4,7 @@
 #include <exception>
 #include <utility>
 
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
 #include "pm/task/callbacks.h"

@@ -15,7 +15,7 @@
 #include <nlohmann/json.hpp>
 
 #include "pm-runner/runner_process.h"
-#include "pm/runtime/host_socket.h"
+#include "support/host_socket.h"
 
 namespace e2e {
 

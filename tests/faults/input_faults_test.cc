@@ -31,8 +31,9 @@
 #include "pm-host/queue_reader.h"
 #include "pm-host/session.h"
 #include "pm/ipc/connection.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/runtime/little_endian.h"
 #include "support/wait.h"
 
 namespace {
@@ -394,7 +395,7 @@ class RawHost {
   }
   static std::string Prefix(std::uint32_t length) {
     std::string bytes(4, '\0');
-    for (int i = 0; i < 4; ++i) bytes[static_cast<std::size_t>(i)] = static_cast<char>((length >> (8 * i)) & 0xFF);
+    pm::StoreLe32(bytes.data(), length);
     return bytes;
   }
   static std::string Frame(const std::string& text) {
@@ -407,7 +408,8 @@ class RawHost {
   bool WriteTokens(const std::vector<std::uint32_t>& tokens) {
     std::vector<std::uint8_t> bytes;
     for (std::uint32_t t : tokens) {
-      for (int i = 0; i < 4; ++i) bytes.push_back(static_cast<std::uint8_t>(t >> (8 * i)));
+      bytes.resize(bytes.size() + 4);
+      pm::StoreLe32(bytes.data() + bytes.size() - 4, t);
     }
     pm::BufferList list;
     list.emplace_back(bytes.data(), static_cast<std::uint32_t>(bytes.size()));
@@ -444,7 +446,7 @@ class RawHost {
 
  private:
   void Tap() {
-    std::uint8_t wire[pmhost::kWireRecordBytes];
+    std::uint8_t wire[pm::kQueueWireRecordBytes];
     while (tapRunning_) {
       if (!queue_->ReadFromSocket(wire, sizeof wire, 250)) {
         if (!queue_->IsConnected()) break;
@@ -513,8 +515,8 @@ TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTh
                             RawHost::Frame("{\"pm::command\":42,\"pm::unique_id\":\"x\"}")));
   // A frame of exactly the largest length is taken in whole.
   const std::string filler = "{\"pm::command\":\"pm::tsrc::no_such\",\"pm::unique_id\":4000000000,\"pad\":\"";
-  std::string largest = filler + std::string(pm::ipc::kMaxMessageBytes - filler.size() - 2, 'x') + "\"}";
-  ASSERT_EQ(largest.size(), pm::ipc::kMaxMessageBytes);
+  std::string largest = filler + std::string(pm::ipc::kMaxFrameBytes - filler.size() - 2, 'x') + "\"}";
+  ASSERT_EQ(largest.size(), pm::ipc::kMaxFrameBytes);
   ASSERT_TRUE(host.WriteRaw(RawHost::Frame(largest)));
   // The connection still carries requests, and the source still runs.
   const auto answer = host.Request("pm::tsrc::handle_shot_event", {{"unique_id", Id(sender)}, {"event", "X"}});
@@ -524,7 +526,7 @@ TEST_F(InputFaults, GarbageMessagesMidStreamAreSkippedThenAnOversizeLengthEndsTh
 
   // A length over the limit: the runner drops the connection and, with no
   // other connection left, ends in order, its segments gone.
-  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxMessageBytes + 1) + "{}"));
+  ASSERT_TRUE(host.WriteRaw(RawHost::Prefix(pm::ipc::kMaxFrameBytes + 1) + "{}"));
   EXPECT_EQ(host.WaitRunner(kExitLimit), std::optional<int>(0)) << folder.ReadRunnerLog();
   EXPECT_TRUE(pmtest::WaitFor([&] { return host.QueueEnded(); }, kExitLimit));
   EXPECT_EQ(SegmentsOf({base}), 0);
@@ -624,7 +626,7 @@ TEST_F(InputFaults, ASecondQueueConnectionIsRefusedAndTheFirstKeepsItsPictures) 
   for (int attempt = 0; attempt < 5; ++attempt) {
     std::unique_ptr<pm::ipc::Connection> second = pm::ipc::Connection::Open(host.Port());
     if (!second) continue;
-    std::uint8_t wire[pmhost::kWireRecordBytes];
+    std::uint8_t wire[pm::kQueueWireRecordBytes];
     EXPECT_FALSE(second->ReadFromSocket(wire, sizeof wire, 300)) << "a second reader was given a record";
     second->Close();
   }

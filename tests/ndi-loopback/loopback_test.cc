@@ -23,7 +23,7 @@
 #include "ndi-loopback/wire.h"
 #include "ndi-testsrc/pattern.h"
 #include "support/wait.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 
@@ -39,13 +39,6 @@ std::vector<std::string> SourceNames() {
   for (std::uint32_t i = 0; i < count; ++i) names.push_back(std::string(sources[i].ndi_name) + "@" + sources[i].url_address);
   NDIlib_find_destroy(finder);
   return names;
-}
-
-bool Listed(const std::string& name) {
-  for (const std::string& n : SourceNames()) {
-    if (n.rfind(name + "@", 0) == 0) return true;
-  }
-  return false;
 }
 
 // A receiver that frees what it captures unless told to keep it.
@@ -113,47 +106,90 @@ class Loopback : public ::testing::Test {
 
 // --- discovery ------------------------------------------------------------
 
-TEST_F(Loopback, DiscoveryShowsASenderAndLosesItWithinOneSecondOfItsExit) {
-  TestSource src(Args("Disc", {"--width", "16", "--height", "8", "--fps", "10"}));
-  ASSERT_TRUE(src.WaitReady());
-  EXPECT_NE(src.name().find(" (Disc)"), std::string::npos);
-  EXPECT_EQ(src.url().rfind("127.0.0.1:", 0), 0u) << src.url();
-  EXPECT_TRUE(pmtest::WaitFor([&] { return Listed(src.name()); }, 1s));
-  src.Signal(SIGTERM);
-  EXPECT_TRUE(pmtest::WaitFor([&] { return !Listed(src.name()); }, 1s));
-  EXPECT_EQ(src.Wait(), 0) << "SIGTERM ends the sender cleanly";
+// As with the vendor runtime, a sender that went stays listed for about a
+// second, whether it ended in order or was killed (and not yet reaped); the
+// finder's wait sees the change when it is listed no more.
+TEST_F(Loopback, DiscoveryListsASenderThatWentForASecondMore) {
+  for (const int sig : {SIGTERM, SIGKILL}) {
+    SCOPED_TRACE(sig == SIGTERM ? "ended in order" : "killed");
+    TestSource src(Args("Went", {"--width", "16", "--height", "8", "--fps", "10"}));
+    ASSERT_TRUE(src.WaitReady());
+    EXPECT_NE(src.name().find(" (Went)"), std::string::npos);
+    EXPECT_EQ(src.url().rfind("127.0.0.1:", 0), 0u) << src.url();
+    void* finder = NDIlib_find_create_v2(nullptr);
+    std::uint32_t count = 0;
+    NDIlib_find_get_current_sources(finder, &count);
+    EXPECT_EQ(count, 1u);
+    const auto went = std::chrono::steady_clock::now();
+    src.Signal(sig);
+    EXPECT_TRUE(NDIlib_find_wait_for_sources(finder, 5000)) << "the change is seen";
+    EXPECT_GE(std::chrono::steady_clock::now() - went, std::chrono::milliseconds(ndilb::kListedAfterGoneMs));
+    NDIlib_find_get_current_sources(finder, &count);
+    EXPECT_EQ(count, 0u);
+    EXPECT_FALSE(NDIlib_find_wait_for_sources(finder, 100)) << "no change, no wake-up";
+    NDIlib_find_destroy(finder);
+    if (sig == SIGTERM) {
+      EXPECT_EQ(src.Wait(), 0) << "SIGTERM ends the sender cleanly";
+    }
+  }
 }
 
-TEST_F(Loopback, DiscoveryLosesAKilledSenderWithinOneSecondEvenBeforeItIsReaped) {
-  TestSource src(Args("Killed", {"--width", "16", "--height", "8", "--fps", "10"}));
-  ASSERT_TRUE(src.WaitReady());
-  void* finder = NDIlib_find_create_v2(nullptr);
-  std::uint32_t count = 0;
-  NDIlib_find_get_current_sources(finder, &count);
-  EXPECT_EQ(count, 1u);
-  src.Signal(SIGKILL);  // leaves its entry behind, and a zombie until reaped
-  EXPECT_TRUE(NDIlib_find_wait_for_sources(finder, 1000)) << "the change is seen within a second";
-  NDIlib_find_get_current_sources(finder, &count);
-  EXPECT_EQ(count, 0u);
-  EXPECT_FALSE(NDIlib_find_wait_for_sources(finder, 100)) << "no change, no wake-up";
-  NDIlib_find_destroy(finder);
-}
-
-TEST_F(Loopback, DiscoverySkipsMalformedEntriesAndEntriesOfDeadProcesses) {
+TEST_F(Loopback, DiscoverySkipsMalformedEntriesAndListsEachNameOnceAsTheVendorRuntimeDoes) {
   pid_t dead = fork();
   if (dead == 0) _exit(0);
   ASSERT_GT(dead, 0);
   waitpid(dead, nullptr, 0);
+  const std::string alive = std::to_string(getpid());
+  const auto now = std::chrono::duration_cast<std::chrono::nanoseconds>(
+                       std::chrono::system_clock::now().time_since_epoch()).count();
   auto write = [&](const std::string& file, const std::string& text) {
-    std::ofstream(dir_.path() + "/" + file) << text;
+    std::ofstream(dir_.path() + "/" + file) << "ndi-loopback 1\n" << text;
   };
-  write("1-1.ndi", "garbage\n");
-  write("2-2.ndi", "ndi-loopback 1\nname=NO PID\nurl=127.0.0.1:1\n");
+  auto exists = [&](const std::string& file) { return ::access((dir_.path() + "/" + file).c_str(), F_OK) == 0; };
+  std::ofstream(dir_.path() + "/1-1.ndi") << "garbage\n";
+  write("2-2.ndi", "name=NO PID\nurl=127.0.0.1:1\n");
   write("3-3.ndi", std::string(10000, 'x'));
-  write("4-4.ndi", "ndi-loopback 1\nname=DEAD (x)\nurl=127.0.0.1:4\npid=" + std::to_string(dead) + "\n");
-  write("5-5.ndi", "ndi-loopback 1\nname=ALIVE (x)\nurl=127.0.0.1:5\npid=" + std::to_string(getpid()) + "\n");
-  write("notes.txt", "ndi-loopback 1\nname=OTHER FILE\nurl=127.0.0.1:6\npid=" + std::to_string(getpid()) + "\n");
-  EXPECT_EQ(SourceNames(), std::vector<std::string>{"ALIVE (x)@127.0.0.1:5"});
+  write("notes.txt", "name=OTHER FILE\nurl=127.0.0.1:6\npid=" + alive + "\n");
+  write("5-5.ndi", "name=ALIVE (x)\nurl=127.0.0.1:5\npid=" + alive + "\n");
+  // A process that died: listed for a second from when it is found gone.
+  write("4-4.ndi", "name=DEAD (x)\nurl=127.0.0.1:4\npid=" + std::to_string(dead) + "\n");
+  // One name, three entries: the one made first while it is listed.
+  write("7-7.ndi", "name=BACK (x)\nurl=127.0.0.1:7\npid=" + alive + "\nsince=" + std::to_string(now) + "\n");
+  write("8-8.gone", "name=BACK (x)\nurl=127.0.0.1:8\npid=" + alive + "\nsince=" + std::to_string(now - 2) +
+                        "\ngone=" + std::to_string(now) + "\n");
+  write("9-9.gone", "name=BACK (x)\nurl=127.0.0.1:9\npid=" + alive + "\nsince=" + std::to_string(now - 3) +
+                        "\ngone=" + std::to_string(now - 2'000'000'000) + "\n");
+  // Gone long ago: removed by the reader that finds it.
+  write("6-6.gone", "name=LONG GONE (x)\nurl=127.0.0.1:6\npid=" + alive + "\ngone=" +
+                        std::to_string(now - 20'000'000'000) + "\n");
+  EXPECT_EQ(SourceNames(), (std::vector<std::string>{"ALIVE (x)@127.0.0.1:5", "BACK (x)@127.0.0.1:8",
+                                                     "DEAD (x)@127.0.0.1:4"}));
+  EXPECT_FALSE(exists("4-4.ndi"));
+  EXPECT_TRUE(exists("4-4.gone"));
+  EXPECT_FALSE(exists("6-6.gone"));
+  EXPECT_TRUE(pmtest::WaitFor([&] {
+    return SourceNames() == std::vector<std::string>{"ALIVE (x)@127.0.0.1:5", "BACK (x)@127.0.0.1:7"};
+  }));
+}
+
+// As with the vendor runtime, a receiver made for a URL takes whichever
+// sender listens there, and finds its sender by name when nothing answers.
+TEST_F(Loopback, ReceiverTakesTheSenderAtItsUrlElseTheOneListedForItsName) {
+  TestSource there(Args("There", {"--width", "32", "--height", "8", "--fps", "30"}));
+  TestSource named(Args("Named", {"--width", "16", "--height", "8", "--fps", "30"}));
+  ASSERT_TRUE(there.WaitReady() && named.WaitReady());
+  struct Case {
+    const char* url;
+    int width;
+  };
+  for (const Case c : {Case{there.url().c_str(), 32}, Case{"127.0.0.1:1", 16}, Case{nullptr, 16}}) {
+    SCOPED_TRACE(c.url ? c.url : "no url");
+    Receiver rx(named.name(), kNdiBandwidthHighest, c.url);
+    ndi_video_frame_v2 v{};
+    ASSERT_TRUE(rx.CaptureType(kNdiFrameVideo, &v, nullptr, nullptr));
+    EXPECT_EQ(v.xres, c.width);
+    NDIlib_recv_free_video_v2(rx.get(), &v);
+  }
 }
 
 // --- video, audio -------------------------------------------------------------

@@ -9,7 +9,7 @@
 #include "ndi-testsrc/pattern.h"
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/wire.h"
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 

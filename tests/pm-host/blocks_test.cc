@@ -5,8 +5,8 @@
 
 #include "ndi-testsrc/pattern.h"
 #include "pm-host/checks.h"
-#include "pm/task/formats.h"
-#include "taskndisource/ndi_abi.h"
+#include "pm/shm/formats.h"
+#include "ndi/ndi_abi.h"
 
 namespace {
 

@@ -1,12 +1,15 @@
 #include "e2e_support.h"
 
 #include <dirent.h>
+#include <signal.h>
 #include <stdlib.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <cstdio>
 #include <filesystem>
+#include <mutex>
 #include <thread>
 #include <set>
 #include <fstream>
@@ -54,6 +57,7 @@ bool Sender::Start(const Folder& folder, const std::string& name, std::vector<st
   }
   o.args.insert(o.args.end(), args.begin(), args.end());
   o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  if (folder.firstPort != 0) o.env["NDI_LOOPBACK_FIRST_PORT"] = std::to_string(folder.firstPort);
   o.captureStdout = true;
   o.onLine = [this](const std::string& line) {
     json event = json::parse(line, nullptr, false);
@@ -116,6 +120,59 @@ int SegmentsOf(const std::vector<std::string>& bases) {
     for (const std::string& base : bases) count += !base.empty() && name.rfind(base, 0) == 0 ? 1 : 0;
   }
   return count;
+}
+
+void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
+  constexpr int kOwnWidth = 640, kOtherWidth = 320;
+  auto args = [](int width) {
+    return std::vector<std::string>{"--pattern", "blocks", "--width", std::to_string(width), "--height",
+                                    std::to_string(width * 9 / 16), "--fps", "30", "--no-audio"};
+  };
+  auto own = std::make_unique<Sender>();
+  ASSERT_TRUE(own->Start(folder, "Own", args(kOwnWidth)));
+  const std::string id = pmhost::kSourceIdPrefix + own->Name();
+  own->Process().Signal(SIGKILL);
+  ASSERT_TRUE(own->Process().Wait(kPatience).has_value());
+  Sender other;
+  bool up = false;
+  std::thread starts([&] {
+    up = other.Start(folder, "Other", args(kOtherWidth));
+    auto again = std::make_unique<Sender>();
+    up = again->Start(folder, "Own", args(kOwnWidth)) && up;
+    own = std::move(again);
+  });
+  std::mutex lock;  // guards widths, states
+  std::vector<int> widths, states;
+  auto count = [&](auto match) {
+    std::lock_guard<std::mutex> guard(lock);
+    return std::count_if(widths.begin(), widths.end(), match);
+  };
+  std::atomic<bool> stop{false};
+  pmhost::ReceiveOptions o = ReceiveFrom(folder, id);
+  o.seconds = 120;
+  o.interrupted = &stop;
+  o.onVideo = [&](const pmhost::VideoFrame& frame) {
+    std::lock_guard<std::mutex> guard(lock);
+    widths.push_back(frame.width);
+  };
+  o.onNotification = [&](const std::string& command, const json& message) {
+    std::lock_guard<std::mutex> guard(lock);
+    if (command == "pm::tsrc::update_connection_state") states.push_back(message.value("state", 0));
+  };
+  o.whileReceiving = [&](pmhost::Session&, const std::string&) {
+    pmtest::WaitFor([&] { return count([](int w) { return w == kOwnWidth; }) >= 10; }, kPatience);
+    stop = true;
+  };
+  const pmhost::ReceiveResult result = pmhost::Receive(o);
+  starts.join();
+  ExpectOrderlyEnd(result, folder);
+  EXPECT_TRUE(up);
+  std::lock_guard<std::mutex> guard(lock);
+  const auto first = std::find(widths.begin(), widths.end(), kOwnWidth);
+  std::printf("pictures of the other sender first: %ld\n", static_cast<long>(first - widths.begin()));
+  EXPECT_NE(first, widths.end()) << "states " << ::testing::PrintToString(states) << ", "
+                                 << std::count(widths.begin(), widths.end(), kOtherWidth) << " pictures of the other";
+  EXPECT_EQ(std::find(first, widths.end(), kOtherWidth), widths.end());
 }
 
 void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder) {

@@ -47,6 +47,9 @@ struct Folder {
   std::string RunnerLog() const { return path + "/runner.log"; }
   std::string ReadRunnerLog() const;
   std::string path;
+  // When not 0, senders started in it take the lowest free port from this
+  // one (NDI_LOOPBACK_FIRST_PORT), as the vendor runtime's do from 5961.
+  int firstPort = 0;
 };
 
 // ndi-testsrc with its event lines (JSON objects on stdout) collected.
@@ -77,6 +80,13 @@ pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& sour
 // taken over.
 pmhost::ReceiveResult ReceiveUntil(pmhost::ReceiveOptions o, const std::function<bool()>& done,
                                    std::chrono::milliseconds limit = std::chrono::seconds(30));
+
+// A sender that died with nothing connected, its port taken at once by
+// another sender, and itself started again elsewhere; a source started for it
+// while its old URL is still listed (for about a second on either runtime) is
+// first led to the other sender, and must come to its own: pictures of its
+// own size arrive, and none of the other's after them.
+void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder);
 
 // Entries of /dev/shm whose names start with one of the bases.
 int SegmentsOf(const std::vector<std::string>& bases);

@@ -19,7 +19,7 @@
 #include "e2e_support.h"
 #include "pm-host/checks.h"
 #include "pm-host/receive.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 #include "support/wait.h"
 
 namespace {
@@ -269,6 +269,15 @@ TEST(EndToEnd, ASenderThatDiesAndReturnsGivesStates3Then1Then2AndFramesAgain) {
   ASSERT_NE(one, afterReturn.end()) << ::testing::PrintToString(afterReturn);
   EXPECT_NE(std::find(one, afterReturn.end(), 2), afterReturn.end()) << ::testing::PrintToString(afterReturn);
   EXPECT_TRUE(framesAgain);
+}
+
+// The loopback runtime keeps a sender that went listed for a second, as the
+// vendor runtime does; senders here take ports as the vendor's do (the lowest
+// free one), so the dead sender's port goes to the next sender at once.
+TEST(EndToEnd, ASourceLedToAnotherSendersPortByAStaleListingComesToItsOwnSender) {
+  Folder folder;
+  folder.firstPort = 20000 + static_cast<int>(::getpid() % 10000);
+  pmtest::ExpectASourceLedToAnotherSendersPortToComeToItsOwn(folder);
 }
 
 // A host sink that only counts.

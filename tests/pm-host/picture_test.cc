@@ -6,7 +6,7 @@
 #include <fstream>
 
 #include "pm-host/picture.h"
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 namespace {
 

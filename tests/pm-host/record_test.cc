@@ -12,7 +12,7 @@
 
 #include "pm-host/queue_reader.h"
 #include "pm-host/record.h"
-#include "pm/shm/shared_memory_queue.h"
+#include "pm/shm/queue_record.h"
 #include "support/log_capture.h"
 
 namespace {
@@ -41,7 +41,7 @@ Wire VideoRecord(std::uint32_t token, std::uint64_t size, std::uint32_t stride, 
   f.scan = pm::kScanProgressive;
   std::memcpy(w.bytes + 28, &mediaTime, 8);
   std::memcpy(w.bytes + 36, &f, sizeof f);
-  pm::SharedMemoryQueueProducer::CheckBytes(w.bytes + 4, 58, w.bytes + 62);
+  std::memcpy(w.bytes + 62, pm::FletcherCheckBytes(w.bytes + 4, 58).data(), 2);
   return w;
 }
 
@@ -58,7 +58,7 @@ Wire AudioRecord(std::uint32_t token, std::uint64_t size, std::uint32_t code, st
   std::memcpy(w.bytes + 40, &samples, 4);
   std::memcpy(w.bytes + 44, &rate, 4);
   w.bytes[48] = channels;
-  pm::SharedMemoryQueueProducer::CheckBytes(w.bytes + 4, 58, w.bytes + 62);
+  std::memcpy(w.bytes + 62, pm::FletcherCheckBytes(w.bytes + 4, 58).data(), 2);
   return w;
 }
 

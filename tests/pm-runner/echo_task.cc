@@ -9,7 +9,7 @@
 
 #include <nlohmann/json.hpp>
 
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/log.h"
 #include "pm/task/task.h"
 

@@ -20,7 +20,7 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
-#include "pm/runtime/host_socket.h"
+#include "support/host_socket.h"
 
 extern char** environ;
 

@@ -5,10 +5,12 @@
 
 #include <atomic>
 #include <memory>
+#include <vector>
 
+#include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
-#include "pm/runtime/dispatcher.h"
 #include "pm/task/task.h"
+#include "support/manual_clock.h"
 
 namespace {
 
@@ -21,21 +23,29 @@ class CountingTask : public pm::Task {
   std::atomic<int>* shutdowns_;
 };
 
-// A dispatcher without a connection whose Stop is counted instead of slept.
-std::shared_ptr<pm::RpcDispatcher> CountedDispatcher(std::atomic<int>* stops) {
-  pm::DispatcherTiming timing = pm::DispatcherTiming::Steady();
-  timing.sleep = [stops](std::int64_t) { stops->fetch_add(1); };
-  auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, timing);
-  dispatcher->Start();
-  return dispatcher;
-}
+// Dispatchers without a connection, each on a manual clock of its own, which
+// counts Stop's grace sleep instead of sleeping it.
+struct CountedDispatchers {
+  std::vector<std::shared_ptr<pmtest::ManualClock>> clocks;
+  std::shared_ptr<pm::RpcDispatcher> Make() {
+    clocks.push_back(std::make_shared<pmtest::ManualClock>());
+    auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clocks.back());
+    dispatcher->Start();
+    return dispatcher;
+  }
+  int Stops() const {
+    int stops = 0;
+    for (const auto& clock : clocks) stops += clock->Sleeps();
+    return stops;
+  }
+};
 
 TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndReleasesTheServer) {
   std::atomic<int> shutdowns{0};
-  std::atomic<int> stops{0};
+  CountedDispatchers counted;
   CountingTask task(&shutdowns);
-  task.AddDispatcher(CountedDispatcher(&stops));
-  task.AddDispatcher(CountedDispatcher(&stops));
+  task.AddDispatcher(counted.Make());
+  task.AddDispatcher(counted.Make());
   std::shared_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
   ASSERT_TRUE(server);
   std::weak_ptr<pm::ipc::Server> weakServer = server;
@@ -43,25 +53,25 @@ TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndReleasesTheServ
 
   task.StopTask();
   EXPECT_EQ(shutdowns.load(), 1);
-  EXPECT_EQ(stops.load(), 2);
+  EXPECT_EQ(counted.Stops(), 2);
   EXPECT_EQ(task.DispatcherCount(), 0u);
   EXPECT_TRUE(weakServer.expired());
 
   // Again (the destructor does it too): Shutdown runs, nothing is stopped twice.
   task.StopTask();
   EXPECT_EQ(shutdowns.load(), 2);
-  EXPECT_EQ(stops.load(), 2);
+  EXPECT_EQ(counted.Stops(), 2);
 }
 
 TEST(TaskObject, DestructorStopsDispatchersButNotTheDerivedWork) {
   std::atomic<int> shutdowns{0};
-  std::atomic<int> stops{0};
-  auto dispatcher = CountedDispatcher(&stops);
+  CountedDispatchers counted;
+  auto dispatcher = counted.Make();
   pm::TaskBase* task = new CountingTask(&shutdowns);
   static_cast<pm::Task*>(task)->AddDispatcher(dispatcher);
   delete task;  // through the base, as the runner does
   EXPECT_EQ(shutdowns.load(), 0);
-  EXPECT_EQ(stops.load(), 1);
+  EXPECT_EQ(counted.Stops(), 1);
   EXPECT_EQ(dispatcher.use_count(), 1);  // the queue let go
 }
 

@@ -3,6 +3,7 @@
 #include <cstring>
 
 #include "pm/ipc/server.h"
+#include "pm/shm/queue_record.h"
 
 namespace pmtest {
 
@@ -59,12 +60,8 @@ void QueueReader::Close() {
 }
 
 std::pair<unsigned, unsigned> FletcherSums(const std::uint8_t* bytes, std::size_t length) {
-  unsigned sum1 = 0, sum2 = 0;
-  for (std::size_t i = 0; i < length; ++i) {
-    sum1 = (sum1 + bytes[i]) % 255;
-    sum2 = (sum2 + sum1) % 255;
-  }
-  return {sum1, sum2};
+  const pm::FletcherSums sums = pm::Fletcher16(bytes, length);
+  return {sums.sum1, sums.sum2};
 }
 
 }  // namespace pmtest

@@ -10,7 +10,7 @@
 #include <nlohmann/json.hpp>
 
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 
 namespace pmtest {
 
@@ -46,7 +46,7 @@ class QueueReader {
   std::shared_ptr<pm::ipc::Connection> connection_;
 };
 
-// The 16-bit Fletcher sums (sum1, sum2) over `length` bytes.
+// pm::Fletcher16 over `length` bytes as a pair (sum1, sum2).
 std::pair<unsigned, unsigned> FletcherSums(const std::uint8_t* bytes, std::size_t length);
 
 }  // namespace pmtest

@@ -4,51 +4,6 @@
 
 namespace nditest {
 
-std::int64_t ManualClock::NowNs() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return now_;
-}
-
-void ManualClock::Signal() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  ++signals_;
-  changed_.notify_all();
-}
-
-bool ManualClock::WaitUntil(std::int64_t deadlineNs) {
-  std::unique_lock<std::mutex> lock(mutex_);
-  if (signals_ < 1 && now_ < deadlineNs) {
-    ++waitsBegun_;
-    waiting_ = true;
-    deadline_ = deadlineNs;
-    changed_.notify_all();
-    changed_.wait(lock, [&] { return signals_ >= 1 || now_ >= deadlineNs; });
-    waiting_ = false;
-  }
-  if (signals_ >= 1) {
-    --signals_;
-    return true;
-  }
-  return false;
-}
-
-void ManualClock::AdvanceMs(std::int64_t ms) {
-  std::lock_guard<std::mutex> guard(mutex_);
-  now_ += ms * 1'000'000;
-  changed_.notify_all();
-}
-
-std::int64_t ManualClock::AwaitWait(int n) {
-  std::unique_lock<std::mutex> lock(mutex_);
-  if (!changed_.wait_for(lock, std::chrono::seconds(10), [&] { return waitsBegun_ >= n && waiting_; })) return -1;
-  return (deadline_ - now_) / 1'000'000;
-}
-
-int ManualClock::WaitsBegun() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return waitsBegun_;
-}
-
 TaskNDISource::LoopEnvironment TestEnvironment::Make(std::chrono::milliseconds stopTimeout,
                                                      std::function<void()> onExit) const {
   TaskNDISource::LoopEnvironment env;

@@ -1,6 +1,7 @@
 #pragma once
-// Test doubles for the NDI source and discovery: a clock the test advances by
-// hand, host callbacks that record every call, and buffers over plain memory.
+// Test doubles for the NDI source and discovery: a loop environment on the
+// manual clock, host callbacks that record every call, and buffers over plain
+// memory.
 
 #include <atomic>
 #include <chrono>
@@ -14,41 +15,15 @@
 #include <vector>
 
 #include "pm/task/source.h"
-#include "taskndisource/loop_clock.h"
+#include "support/manual_clock.h"
+#include "taskndisource/loop_environment.h"
 
 namespace nditest {
-
-// Time stands still until the test advances it. A loop's timed wait ends when
-// the test moves the clock past its deadline or the loop is signalled.
-class ManualClock : public TaskNDISource::LoopClock {
- public:
-  std::int64_t NowNs() override;
-  void Signal() override;
-  bool WaitUntil(std::int64_t deadlineNs) override;
-
-  // Moves the clock forward and wakes waits whose deadline has come.
-  void AdvanceMs(std::int64_t ms);
-  // Waits (real time, at most 10 s) until the loop has begun its n-th wait
-  // that actually blocks and is in it; returns the wait's length in ms from
-  // now, or -1 when that did not happen.
-  std::int64_t AwaitWait(int n);
-  // Waits that blocked so far.
-  int WaitsBegun();
-
- private:
-  std::mutex mutex_;  // guards everything below
-  std::condition_variable changed_;
-  std::int64_t now_ = 1'000'000'000'000;
-  std::int32_t signals_ = 0;
-  int waitsBegun_ = 0;
-  bool waiting_ = false;
-  std::int64_t deadline_ = 0;
-};
 
 // A loop environment on `clock`, with a stop deadline and an exit hook that
 // counts instead of ending the process.
 struct TestEnvironment {
-  std::shared_ptr<ManualClock> clock = std::make_shared<ManualClock>();
+  std::shared_ptr<pmtest::ManualClock> clock = std::make_shared<pmtest::ManualClock>();
   std::shared_ptr<std::atomic<int>> exits = std::make_shared<std::atomic<int>>(0);
   TaskNDISource::LoopEnvironment Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5),
                                       std::function<void()> onExit = nullptr) const;

@@ -221,6 +221,60 @@ TEST_F(LoopTest, LostConnectionWhileReceivingGoesIdle) {
   EXPECT_EQ(source->PublishedMediaInfo(), TaskNDISource::MediaInfo{});
 }
 
+// The runtime keeps a dead sender's URL listed for a while, and a receiver
+// takes whichever sender listens at its URL: when the finder lists the sender
+// at another URL than its receiver was made for, the receiver is made again
+// for the listed one, while connecting as while receiving. The list is looked
+// at every 250 ms; a sender missing from it for a moment keeps its receiver.
+struct ListedCase {
+  const char* what;
+  bool receiving;                // else still connecting, with a receiver
+  std::vector<Entry> listed;     // the list from then on
+  const char* madeAgainFor;      // null: the receiver stays
+  std::vector<std::int32_t> states;
+};
+void PrintTo(const ListedCase& c, std::ostream* os) { *os << c.what; }
+
+class ListedUrl : public LoopTest, public ::testing::WithParamInterface<ListedCase> {};
+
+TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
+  const ListedCase& c = GetParam();
+  ndi.SetSources({Entry{kName, kUrl}});
+  if (c.receiving) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  Make();
+  source->Start();
+  if (c.receiving) UntilStates({1, 2});
+  Until([&] { return ndi.Captures() >= 3; });
+  ndi.SetSources(c.listed);
+  const int lists = ndi.ListCalls(), captures = ndi.Captures();
+  Until([&] { return ndi.Captures() >= captures + 20; });
+  EXPECT_EQ(ndi.ListCalls(), lists) << "not looked at before 250 ms have passed";
+  env.clock->AdvanceMs(250);
+  if (c.madeAgainFor != nullptr) {
+    ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.ReceiversCreated().size() == 2; }));
+    EXPECT_EQ(ndi.ReceiversCreated()[1].url, c.madeAgainFor);
+    EXPECT_EQ(ndi.ReceiversDestroyed(), 1);
+    ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
+  } else {
+    Until([&] { return ndi.Captures() >= captures + 40; });
+    EXPECT_EQ(ndi.ReceiversCreated().size(), 1u);
+  }
+  UntilStates(c.states);
+  EXPECT_EQ(logs.Count(std::string("#ndisource: source listed at a new url (") +
+                       (c.madeAgainFor ? c.madeAgainFor : "") + "): making its receiver again\n"),
+            c.madeAgainFor ? 1 : 0);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    LoopTest, ListedUrl,
+    ::testing::Values(ListedCase{"moved_while_receiving", true, {Entry{kName, "10.0.0.9:2"}}, "10.0.0.9:2", {1, 2, 1, 2}},
+                      ListedCase{"moved_while_connecting", false, {Entry{kName, "10.0.0.9:2"}}, "10.0.0.9:2", {1, 2}},
+                      ListedCase{"missing_from_the_list", true, {}, nullptr, {1, 2}},
+                      ListedCase{"listed_without_url", true, {Entry{kName, ""}}, nullptr, {1, 2}},
+                      ListedCase{"still_first_at_its_url", true,
+                                 {Entry{kName, kUrl}, Entry{kName, "10.0.0.9:2"}}, nullptr, {1, 2}}),
+    [](const ::testing::TestParamInfo<ListedCase>& info) { return std::string(info.param.what); });
+
 TEST_F(LoopTest, StopEndsAWaitingLoopAtOnceAndReleasesEverything) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);

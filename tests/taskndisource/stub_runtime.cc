@@ -1,7 +1,7 @@
 // A stand-in runtime library for the loader test. Built twice: with
 // STUB_RUNTIME_COMPLETE it exports every name the task loads; without, only
 // the library calls, so the first finder call is the first missing symbol.
-#include "taskndisource/ndi_abi.h"
+#include "ndi/ndi_abi.h"
 
 #define STUB_EXPORT __attribute__((visibility("default")))
 

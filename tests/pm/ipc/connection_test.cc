@@ -15,6 +15,7 @@
 #include <thread>
 
 #include "pm/ipc/server.h"
+#include "pm/runtime/little_endian.h"
 #include "pm/runtime/thread_name.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
@@ -45,7 +46,7 @@ std::vector<std::uint8_t> ReadBytes(Connection& from, std::size_t n) {
 }
 
 std::uint32_t LittleEndian(const std::vector<std::uint8_t>& b) {
-  return b[0] | (b[1] << 8) | (b[2] << 16) | (std::uint32_t(b[3]) << 24);
+  return pm::LoadLe32(b.data());
 }
 
 // ---------------------------------------------------------------------------
@@ -65,7 +66,7 @@ TEST(ConnectionOpen, NobodyListeningGivesNoneAndALogLine) {
 
 TEST(ConnectionFraming, MessageAtTheLimitGoesOutWithItsLength) {
   Pair pair;
-  const std::string text(pm::ipc::kMaxMessageBytes, 'x');
+  const std::string text(pm::ipc::kMaxFrameBytes, 'x');
   std::future<bool> sent = std::async(std::launch::async, [&] { return Connection::SendMessage(pair.task, text); });
   const auto prefix = ReadBytes(*pair.host, 4);
   EXPECT_EQ(prefix, (std::vector<std::uint8_t>{0x00, 0x00, 0x08, 0x00}));
@@ -77,7 +78,7 @@ TEST(ConnectionFraming, MessageAtTheLimitGoesOutWithItsLength) {
 TEST(ConnectionFraming, MessageOverTheLimitWritesNothing) {
   pmtest::LogCapture log;
   Pair pair;
-  EXPECT_FALSE(Connection::SendMessage(pair.task, std::string(pm::ipc::kMaxMessageBytes + 1, 'x')));
+  EXPECT_FALSE(Connection::SendMessage(pair.task, std::string(pm::ipc::kMaxFrameBytes + 1, 'x')));
   EXPECT_TRUE(log.Contains("Connection::SendMessage"));
   // The next thing on the wire is the next message, the empty one.
   EXPECT_TRUE(Connection::SendMessage(pair.task, ""));

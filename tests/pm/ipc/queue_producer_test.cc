@@ -13,6 +13,7 @@
 #include <thread>
 
 #include "pm/ipc/server.h"
+#include "pm/runtime/little_endian.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 
@@ -73,14 +74,14 @@ struct Reader {
     return !host->ReadFromSocket(&byte, 1, 20);
   }
   void Return(std::uint32_t token) {
-    const std::uint8_t bytes[4] = {std::uint8_t(token), std::uint8_t(token >> 8), std::uint8_t(token >> 16),
-                                   std::uint8_t(token >> 24)};
+    std::uint8_t bytes[4];
+    pm::StoreLe32(bytes, token);
     EXPECT_TRUE(host->Send({{bytes, 4}}));
   }
 };
 
 std::uint32_t TokenOf(const std::vector<std::uint8_t>& r) {
-  return r[0] | (r[1] << 8) | (r[2] << 16) | (std::uint32_t(r[3]) << 24);
+  return pm::LoadLe32(r.data());
 }
 
 struct Fixture : ::testing::Test {

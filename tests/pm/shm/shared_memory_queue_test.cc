@@ -45,13 +45,12 @@ struct StartedQueue {
 TEST(QueueCheckBytes, MatchTheReferenceVectorAndZeroTheSums) {
   const std::uint8_t abc[3] = {'a', 'b', 'c'};
   EXPECT_EQ(pmtest::FletcherSums(abc, 3), std::make_pair(39u, 76u));
-  std::uint8_t check[2];
-  SharedMemoryQueueProducer::CheckBytes(abc, 3, check);
+  const auto check = pm::FletcherCheckBytes(abc, 3);
   EXPECT_EQ(check[0], 0x8C);
   EXPECT_EQ(check[1], 0x4C);
   std::uint8_t record[60];
   for (int i = 0; i < 58; ++i) record[i] = static_cast<std::uint8_t>(i * 37 + 11);
-  SharedMemoryQueueProducer::CheckBytes(record, 58, record + 58);
+  std::memcpy(record + 58, pm::FletcherCheckBytes(record, 58).data(), 2);
   EXPECT_EQ(pmtest::FletcherSums(record, 60), std::make_pair(0u, 0u));
 }
 

@@ -3,33 +3,27 @@
 #include <gtest/gtest.h>
 
 #include "pm/task/media_clock.h"
+#include "support/manual_clock.h"
 
 namespace {
 
 constexpr std::int64_t kSecondNs = 1000000000;
 
-struct TestClock {
-  std::int64_t now = 5 * kSecondNs;
-  pm::MediaClock::NowFn Fn() {
-    return [this] { return now; };
-  }
-};
-
 constexpr std::uint32_t Rate(std::uint32_t frames, std::uint32_t seconds) { return frames | seconds << 16; }
 
 TEST(MediaClock, CurrentTimeCountsTicksFromTheEpoch) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   EXPECT_EQ(clock.CurrentTime(), 0);
-  t.now += kSecondNs;
+  t->Advance(kSecondNs);
   EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
-  t.now += 1;  // 1 ns is 0.7056 ticks: truncated
+  t->Advance(1);  // 1 ns is 0.7056 ticks: truncated
   EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
 }
 
 TEST(MediaClock, AudioTimeOfOneSecondOfSamples) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   EXPECT_EQ(clock.AudioTime(48000), 0);
   for (int i = 0; i < 30; ++i) clock.AudioSent(1600);
   EXPECT_EQ(clock.AudioTime(48000), 705600000);
@@ -38,27 +32,27 @@ TEST(MediaClock, AudioTimeOfOneSecondOfSamples) {
 }
 
 TEST(MediaClock, AudioTimeWithoutARateFollowsTheSteadyClock) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   clock.AudioSent(48000);
-  t.now += kSecondNs / 2;
+  t->Advance(kSecondNs / 2);
   EXPECT_EQ(clock.AudioTime(0), pm::kTicksPerSecond / 2);
   EXPECT_EQ(clock.AudioTime(-1), pm::kTicksPerSecond / 2);
 }
 
 TEST(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   for (std::int64_t i = 1; i <= 10; ++i) {
     EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(i, true));
   }
-  t.now += 2 * kSecondNs;
+  t->Advance(2 * kSecondNs);
   EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(2 * pm::kTicksPerSecond, false));
 }
 
 TEST(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   // 48 kHz audio in 1601/1602-sample buffers, video at 30000/1001.
   std::int64_t previous = -1;
   for (int frame = 0; frame < 300; ++frame) {
@@ -74,8 +68,8 @@ TEST(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
 }
 
 TEST(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   clock.AudioSent(1600);
   clock.AudioTime(48000);
   const auto first = clock.NextVideoTime(Rate(30, 1));
@@ -88,8 +82,8 @@ TEST(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
 }
 
 TEST(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   for (int i = 0; i < 100; ++i) clock.AudioSent(1600);
   clock.AudioTime(48000);
   const auto first = clock.NextVideoTime(Rate(30, 1));
@@ -101,8 +95,8 @@ TEST(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
 }
 
 TEST(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   clock.AudioSent(4800);
   const std::int64_t audio = clock.AudioTime(48000);
   EXPECT_EQ(clock.NextVideoTime(Rate(0, 1)), std::make_pair(audio, false));
@@ -111,12 +105,12 @@ TEST(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
 }
 
 TEST(MediaClock, ResetStartsTheEpochAgainAndReturnsToTheFallback) {
-  TestClock t;
-  pm::MediaClock clock(t.Fn());
+  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock(t);
   clock.AudioSent(48000);
   clock.AudioTime(48000);
   clock.NextVideoTime(Rate(25, 1));
-  t.now += 10 * kSecondNs;
+  t->Advance(10 * kSecondNs);
   clock.Reset();
   EXPECT_EQ(clock.CurrentTime(), 0);
   EXPECT_EQ(clock.NextVideoTime(Rate(25, 1)), std::make_pair(std::int64_t{1}, true));

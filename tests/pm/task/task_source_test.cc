@@ -16,8 +16,8 @@
 #include <vector>
 
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
-#include "pm/runtime/host_socket.h"
+#include "pm/ipc/dispatcher.h"
+#include "support/host_socket.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
 

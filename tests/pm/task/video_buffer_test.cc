@@ -9,8 +9,8 @@
 #include <memory>
 #include <vector>
 
+#include "pm/shm/formats.h"
 #include "pm/task/buffers.h"
-#include "pm/task/formats.h"
 
 namespace {
 

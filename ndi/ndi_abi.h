@@ -1,15 +1,20 @@
 /* The NDI runtime's C interface: the structures, constants and functions this
  * project uses, laid out exactly as the runtime library expects them. The
- * loopback runtime (ndi-loopback) defines the functions; ndi-testsrc calls
- * them directly; the task module never links them but loads each one by name
- * into its NdiApi table (taskndisource/ndi_api.h), so that the same task
- * binary works with any runtime that exports these names.
+ * loopback runtime (ndi-loopback) defines the functions; ndi-testsrc and the
+ * benchmarks call them directly; the task module never links them but loads
+ * each one by name into its NdiApi table (taskndisource/ndi_api.h), so that
+ * the same task binary works with any runtime that exports these names; the
+ * host reads the NDI constants. The structure layouts are pinned below for
+ * 64-bit targets (they are the same on 64-bit Linux and Windows: int 4 bytes,
+ * pointers 8, bool 1); taskndisource/ndi_abi_check.cc compares them with the
+ * vendor's own headers where those are at hand.
  *
  * Conventions: handles are opaque pointers; bool is the one-byte C++ bool;
  * strings are NUL-terminated UTF-8; timestamps are in 100 ns units (0 = none);
  * captured frames belong to the runtime until freed with the matching call. */
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 
 extern "C" {
@@ -140,6 +145,54 @@ struct ndi_send_create {
   bool clock_video;
   bool clock_audio;
 };
+
+/* The layouts, on every 64-bit target (LP64 and LLP64 alike). */
+static_assert(sizeof(void*) == 8 && sizeof(int) == 4 && sizeof(bool) == 1 && sizeof(float) == 4,
+              "the NDI structures are laid out for 64-bit targets");
+
+static_assert(sizeof(ndi_source) == 16 && alignof(ndi_source) == 8);
+static_assert(offsetof(ndi_source, ndi_name) == 0 && offsetof(ndi_source, url_address) == 8);
+
+static_assert(sizeof(ndi_find_create) == 24);
+static_assert(offsetof(ndi_find_create, show_local_sources) == 0 && offsetof(ndi_find_create, groups) == 8 &&
+              offsetof(ndi_find_create, extra_ips) == 16);
+
+static_assert(sizeof(ndi_recv_create) == 32);
+static_assert(offsetof(ndi_recv_create, source_to_connect_to) == 0 && offsetof(ndi_recv_create, color_format) == 16 &&
+              offsetof(ndi_recv_create, bandwidth) == 20 && offsetof(ndi_recv_create, allow_video_fields) == 24);
+
+static_assert(sizeof(ndi_video_frame_v2) == 72);
+static_assert(offsetof(ndi_video_frame_v2, xres) == 0 && offsetof(ndi_video_frame_v2, yres) == 4 &&
+              offsetof(ndi_video_frame_v2, FourCC) == 8 && offsetof(ndi_video_frame_v2, frame_rate_N) == 12 &&
+              offsetof(ndi_video_frame_v2, frame_rate_D) == 16 &&
+              offsetof(ndi_video_frame_v2, picture_aspect_ratio) == 20 &&
+              offsetof(ndi_video_frame_v2, frame_format_type) == 24 && offsetof(ndi_video_frame_v2, timecode) == 32 &&
+              offsetof(ndi_video_frame_v2, data) == 40 && offsetof(ndi_video_frame_v2, line_stride_in_bytes) == 48 &&
+              offsetof(ndi_video_frame_v2, metadata) == 56 && offsetof(ndi_video_frame_v2, timestamp) == 64);
+
+static_assert(sizeof(ndi_audio_frame_v2) == 56);
+static_assert(offsetof(ndi_audio_frame_v2, sample_rate) == 0 && offsetof(ndi_audio_frame_v2, no_channels) == 4 &&
+              offsetof(ndi_audio_frame_v2, no_samples) == 8 && offsetof(ndi_audio_frame_v2, timecode) == 16 &&
+              offsetof(ndi_audio_frame_v2, data) == 24 && offsetof(ndi_audio_frame_v2, channel_stride_in_bytes) == 32 &&
+              offsetof(ndi_audio_frame_v2, metadata) == 40 && offsetof(ndi_audio_frame_v2, timestamp) == 48);
+
+static_assert(sizeof(ndi_audio_frame_interleaved_32f) == 32);
+static_assert(offsetof(ndi_audio_frame_interleaved_32f, sample_rate) == 0 &&
+              offsetof(ndi_audio_frame_interleaved_32f, no_channels) == 4 &&
+              offsetof(ndi_audio_frame_interleaved_32f, no_samples) == 8 &&
+              offsetof(ndi_audio_frame_interleaved_32f, timecode) == 16 &&
+              offsetof(ndi_audio_frame_interleaved_32f, data) == 24);
+
+static_assert(sizeof(ndi_metadata_frame) == 24);
+static_assert(offsetof(ndi_metadata_frame, length) == 0 && offsetof(ndi_metadata_frame, timecode) == 8 &&
+              offsetof(ndi_metadata_frame, data) == 16);
+
+static_assert(sizeof(ndi_tally) == 2);
+static_assert(offsetof(ndi_tally, on_program) == 0 && offsetof(ndi_tally, on_preview) == 1);
+
+static_assert(sizeof(ndi_send_create) == 24);
+static_assert(offsetof(ndi_send_create, ndi_name) == 0 && offsetof(ndi_send_create, groups) == 8 &&
+              offsetof(ndi_send_create, clock_video) == 16 && offsetof(ndi_send_create, clock_audio) == 17);
 
 /* Library. */
 bool NDIlib_initialize(void);

@@ -6,7 +6,7 @@
 // negative, is not a picture a segment can hold: its stride or size is
 // reported as 0, which every caller already treats as "no buffer".
 
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 #include <cstddef>
 #include <limits>

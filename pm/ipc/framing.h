@@ -1,12 +1,16 @@
 #pragma once
-// Byte-level decoder of the message frames that travel on an IPC connection.
-// It never touches a socket: the caller hands it bytes (any split, one byte at
-// a time if it likes) and takes complete messages out, so tests and fuzzers
-// drive it directly.
+// Message frames, the unit in which requests, notifications and replies travel
+// on an IPC connection: the wire format, its one size limit, the encoder, and
+// the byte-level decoder.
 //
 // Wire format: a 4-byte little-endian unsigned length N, then N bytes of
 // message text (UTF-8 JSON, no terminating zero). 0 <= N <= kMaxFrameBytes
-// (524,288).
+// (524,288). A longer message is never sent (Connection::SendMessage refuses
+// it), and a receiver closes a connection that announces one.
+//
+// FrameReader never touches a socket: the caller hands it bytes (any split,
+// one byte at a time if it likes) and takes complete messages out, so tests
+// and fuzzers drive it directly.
 //
 // Max-frame policy: a length prefix above kMaxFrameBytes puts the reader in
 // the Oversize state for good. Nothing is allocated for that frame and no
@@ -15,20 +19,29 @@
 // Memory for a valid frame (at most kMaxFrameBytes) is reserved once its
 // length is known.
 //
-// Which thread calls this: one thread at a time (no internal locking).
+// Which thread calls this: a FrameReader on one thread at a time (no internal
+// locking); the encoders from any thread.
 
+#include <array>
 #include <cstddef>
 #include <cstdint>
 #include <deque>
 #include <string>
+#include <string_view>
 
-namespace pm {
+namespace pm::ipc {
+
+inline constexpr std::uint32_t kMaxFrameBytes = 524288;
+inline constexpr std::size_t kFrameHeaderBytes = 4;
+
+// The length prefix of a frame whose message text is `length` bytes.
+std::array<std::uint8_t, kFrameHeaderBytes> FramePrefix(std::uint32_t length);
+// A whole frame: the prefix of message.size() (as a 32-bit number), then the
+// text. It encodes texts over kMaxFrameBytes too; senders check the limit.
+std::string EncodeFrame(std::string_view message);
 
 class FrameReader {
  public:
-  static constexpr std::uint32_t kMaxFrameBytes = 524288;
-  static constexpr std::size_t kHeaderBytes = 4;
-
   FrameReader() = default;
   FrameReader(const FrameReader&) = delete;
   FrameReader& operator=(const FrameReader&) = delete;
@@ -60,7 +73,7 @@ class FrameReader {
  private:
   void HeaderComplete();
 
-  unsigned char header_[kHeaderBytes] = {};
+  unsigned char header_[kFrameHeaderBytes] = {};
   std::size_t headerFill_ = 0;
   bool inBody_ = false;
   std::string body_;          // sized to the frame length while inBody_
@@ -70,4 +83,4 @@ class FrameReader {
   std::deque<std::string> ready_;
 };
 
-}  // namespace pm
+}  // namespace pm::ipc

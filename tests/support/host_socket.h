@@ -18,6 +18,8 @@
 
 #include <nlohmann/json.hpp>
 
+#include "pm/runtime/little_endian.h"
+
 namespace pmtest {
 
 class HostPeer {
@@ -54,7 +56,7 @@ class HostPeer {
   }
   static std::string Prefix(std::uint32_t n) {
     std::string out(4, '\0');
-    for (int i = 0; i < 4; ++i) out[static_cast<std::size_t>(i)] = static_cast<char>((n >> (8 * i)) & 0xFF);
+    pm::StoreLe32(out.data(), n);
     return out;
   }
   bool WriteFrame(const std::string& text) {
@@ -85,8 +87,7 @@ class HostPeer {
   std::optional<std::string> ReadFrame(std::chrono::milliseconds limit = std::chrono::seconds(5)) {
     unsigned char header[4];
     if (!ReadExact(header, 4, limit)) return std::nullopt;
-    const std::uint32_t n = header[0] | header[1] << 8 | header[2] << 16 |
-                            static_cast<std::uint32_t>(header[3]) << 24;
+    const std::uint32_t n = pm::LoadLe32(header);
     std::string text(n, '\0');
     if (n > 0 && !ReadExact(text.data(), n, limit)) return std::nullopt;
     return text;

@@ -1,15 +1,30 @@
-#include "pm/runtime/frame_reader.h"
+#include "pm/ipc/framing.h"
 
 #include <algorithm>
 #include <cstring>
 #include <utility>
 
-namespace pm {
+#include "pm/runtime/little_endian.h"
+
+namespace pm::ipc {
+
+std::array<std::uint8_t, kFrameHeaderBytes> FramePrefix(std::uint32_t length) {
+  std::array<std::uint8_t, kFrameHeaderBytes> prefix{};
+  StoreLe32(prefix.data(), length);
+  return prefix;
+}
+
+std::string EncodeFrame(std::string_view message) {
+  const auto prefix = FramePrefix(static_cast<std::uint32_t>(message.size()));
+  std::string frame(prefix.begin(), prefix.end());
+  frame.append(message);
+  return frame;
+}
 
 std::size_t FrameReader::Wanted() const {
   if (oversize_) return 0;
   if (inBody_) return body_.size() - bodyFill_;
-  return kHeaderBytes - headerFill_;
+  return kFrameHeaderBytes - headerFill_;
 }
 
 void* FrameReader::WritePointer() {
@@ -31,15 +46,12 @@ void FrameReader::Commit(std::size_t n) {
     return;
   }
   headerFill_ += n;
-  if (headerFill_ == kHeaderBytes) HeaderComplete();
+  if (headerFill_ == kFrameHeaderBytes) HeaderComplete();
 }
 
 void FrameReader::HeaderComplete() {
   headerFill_ = 0;
-  const std::uint32_t length = static_cast<std::uint32_t>(header_[0]) |
-                               static_cast<std::uint32_t>(header_[1]) << 8 |
-                               static_cast<std::uint32_t>(header_[2]) << 16 |
-                               static_cast<std::uint32_t>(header_[3]) << 24;
+  const std::uint32_t length = LoadLe32(header_);
   if (length > kMaxFrameBytes) {
     oversize_ = true;
     oversizeLength_ = length;
@@ -73,4 +85,4 @@ bool FrameReader::Next(std::string* message) {
   return true;
 }
 
-}  // namespace pm
+}  // namespace pm::ipc

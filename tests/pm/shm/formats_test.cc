@@ -1,4 +1,4 @@
-#include "pm/task/formats.h"
+#include "pm/shm/formats.h"
 
 #include <gtest/gtest.h>
 

@@ -15,10 +15,11 @@
 #include <vector>
 
 #include "pm/ipc/connection.h"
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 #include "pm/runtime/json.h"
-#include "pm/runtime/host_socket.h"
+#include "support/host_socket.h"
 #include "support/log_capture.h"
+#include "support/manual_clock.h"
 #include "support/wait.h"
 
 namespace {
@@ -27,63 +28,6 @@ using Json = nlohmann::json;
 using namespace std::chrono_literals;
 
 constexpr std::int64_t kMs = 1'000'000;
-
-// A clock the test moves by hand. The dispatcher's expiry thread waits on its
-// own condition variable; Advance wakes it under its lock, so a wake is never
-// lost. Stop's grace sleep is only counted.
-class ManualClock {
- public:
-  explicit ManualClock(std::int64_t start = 1'000'000 * kMs) : now_(start) {}
-
-  std::int64_t Now() const { return now_.load(); }
-  void Advance(std::int64_t nanos) {
-    now_.fetch_add(nanos);
-    std::vector<std::pair<std::condition_variable*, std::mutex*>> waiters;
-    {
-      std::lock_guard<std::mutex> guard(mutex_);
-      waiters.assign(waiters_.begin(), waiters_.end());
-    }
-    for (auto [condition, mutex] : waiters) {
-      std::lock_guard<std::mutex> guard(*mutex);
-      condition->notify_all();
-    }
-  }
-  int Waits() const {
-    std::lock_guard<std::mutex> guard(mutex_);
-    return waits_;
-  }
-  std::int64_t LastWaitDeadline() const {
-    std::lock_guard<std::mutex> guard(mutex_);
-    return lastDeadline_;
-  }
-  int Sleeps() const { return sleeps_.load(); }
-
-  pm::DispatcherTiming Timing() {
-    pm::DispatcherTiming timing;
-    timing.now = [this] { return Now(); };
-    timing.waitUntil = [this](std::condition_variable& condition, std::unique_lock<std::mutex>& lock,
-                              std::int64_t deadline) {
-      {
-        std::lock_guard<std::mutex> guard(mutex_);
-        waiters_.insert({&condition, lock.mutex()});
-        ++waits_;
-        lastDeadline_ = deadline;
-      }
-      if (Now() >= deadline) return;
-      condition.wait(lock);
-    };
-    timing.sleep = [this](std::int64_t) { sleeps_.fetch_add(1); };
-    return timing;
-  }
-
- private:
-  std::atomic<std::int64_t> now_;
-  std::atomic<int> sleeps_{0};
-  mutable std::mutex mutex_;  // guards waiters_, waits_, lastDeadline_
-  std::set<std::pair<std::condition_variable*, std::mutex*>> waiters_;
-  int waits_ = 0;
-  std::int64_t lastDeadline_ = 0;
-};
 
 // A dispatcher on a real loopback connection whose other end the test holds.
 class DispatcherTest : public ::testing::Test {
@@ -94,7 +38,7 @@ class DispatcherTest : public ::testing::Test {
     ASSERT_TRUE(connection_);
     host_ = listener_.Accept();
     ASSERT_TRUE(host_.Valid());
-    dispatcher_ = std::make_shared<pm::RpcDispatcher>(connection_, clock_.Timing());
+    dispatcher_ = std::make_shared<pm::RpcDispatcher>(connection_, clock_);
   }
   void TearDown() override {
     if (dispatcher_) dispatcher_->Stop();
@@ -119,7 +63,7 @@ class DispatcherTest : public ::testing::Test {
   }
 
   pmtest::LogCapture log_;  // first: outlives the dispatcher's threads
-  ManualClock clock_;
+  std::shared_ptr<pmtest::ManualClock> clock_ = std::make_shared<pmtest::ManualClock>();
   pmtest::HostListener listener_;
   std::shared_ptr<pm::ipc::Connection> connection_;
   pmtest::HostPeer host_;
@@ -173,7 +117,7 @@ TEST_F(DispatcherTest, TextOfExactlyTheLimitIsSentOneByteMoreIsNotButStaysPendin
 
 TEST_F(DispatcherTest, ZeroTimeoutIsRegisteredAtTheSendTimeAndSent) {
   Json payload = Json::object();
-  const std::int64_t now = clock_.Now();
+  const std::int64_t now = clock_->NowNs();
   EXPECT_TRUE(dispatcher_->RpcRequest("c", payload, 0));
   EXPECT_EQ(dispatcher_->PendingCount(), 1u);
   EXPECT_EQ(dispatcher_->EarliestDeadlineNs(), now);
@@ -181,7 +125,7 @@ TEST_F(DispatcherTest, ZeroTimeoutIsRegisteredAtTheSendTimeAndSent) {
 }
 
 TEST_F(DispatcherTest, OnlyAnEarlierDeadlineWakesTheExpiryThread) {
-  const std::int64_t now = clock_.Now();
+  const std::int64_t now = clock_->NowNs();
   EXPECT_FALSE(dispatcher_->WakeFlag());
   Json a, b, c;
   dispatcher_->RpcRequest("a", a, 1000);
@@ -218,15 +162,14 @@ TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) 
   dispatcher_->RpcRequest("later", later, 200, record);
   EXPECT_EQ(dispatcher_->PendingCount(), 4u);
 
-  // Just before the deadline nothing goes: wait until the expiry thread has
-  // looked at the new time and gone back to waiting for the same deadline.
-  const int waits = clock_.Waits();
-  clock_.Advance(99 * kMs);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return clock_.Waits() > waits; }));
+  // Just before the deadline nothing goes: once the expiry thread waits on
+  // the clock for the earliest deadline, 99 ms later it is still in that wait.
+  ASSERT_TRUE(pmtest::WaitFor([&] { return clock_->LastWaitDeadline() == dispatcher_->EarliestDeadlineNs(); }));
+  clock_->Advance(99 * kMs);
+  EXPECT_EQ(clock_->AwaitWait(clock_->WaitsBegun()), 1);
   EXPECT_EQ(dispatcher_->PendingCount(), 4u);
-  EXPECT_EQ(clock_.LastWaitDeadline(), dispatcher_->EarliestDeadlineNs());
 
-  clock_.Advance(1 * kMs);
+  clock_->Advance(1 * kMs);
   ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->PendingCount() == 1u; }));
   {
     std::lock_guard<std::mutex> guard(mutex);
@@ -237,7 +180,7 @@ TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) 
       EXPECT_EQ(reply["pm::response"], true);
     }
   }
-  clock_.Advance(100 * kMs);
+  clock_->Advance(100 * kMs);
   ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->PendingCount() == 0u; }));
   std::lock_guard<std::mutex> guard(mutex);
   EXPECT_EQ(timeouts.size(), 4u);
@@ -277,7 +220,7 @@ TEST_F(DispatcherTest, ReplyCompletesItsPendingRequestOnceAndRunsTheCallback) {
   ASSERT_TRUE(pmtest::WaitFor([&] { return log_.Contains("reply without a request id"); }));
 
   // Its deadline passing later runs nothing more.
-  clock_.Advance(1000 * kMs);
+  clock_->Advance(1000 * kMs);
   ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->PendingCount() == 0u; }));
   EXPECT_EQ(calls.load(), 1);
   EXPECT_FALSE(dispatcher_->Ended());
@@ -418,7 +361,7 @@ TEST_F(DispatcherTest, StopFromAHandlerEndsWithoutJoiningItsOwnThread) {
   EXPECT_TRUE(handlerReturned.load());
   EXPECT_TRUE(host_.SeesEndOfStream());
   EXPECT_EQ(endedCalls_.load(), 1);
-  EXPECT_EQ(clock_.Sleeps(), 1);
+  EXPECT_EQ(clock_->Sleeps(), 1);
   dispatcher_.reset();  // joins the receive thread from here
 }
 
@@ -426,7 +369,7 @@ TEST_F(DispatcherTest, StopIsIdempotentAndLaterRequestsStayPendingUnsent) {
   StartReceiving();
   dispatcher_->Stop();
   dispatcher_->Stop();
-  EXPECT_EQ(clock_.Sleeps(), 1);  // the second call returned at once
+  EXPECT_EQ(clock_->Sleeps(), 1);  // the second call returned at once
   EXPECT_TRUE(dispatcher_->Ended());
   EXPECT_EQ(endedCalls_.load(), 1);
   EXPECT_TRUE(host_.SeesEndOfStream());
@@ -446,8 +389,8 @@ TEST_F(DispatcherTest, HostClosingEndsReceivingAndStopAfterwardsStillWorks) {
 }
 
 TEST(DispatcherLifecycle, StoppedBeforeStartReportsTheEndAtOnce) {
-  ManualClock clock;
-  auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clock.Timing());
+  auto clock = std::make_shared<pmtest::ManualClock>();
+  auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clock);
   dispatcher->Stop();
   int ended = 0;
   dispatcher->Start([&] { ++ended; });
@@ -458,15 +401,15 @@ TEST(DispatcherLifecycle, StoppedBeforeStartReportsTheEndAtOnce) {
 }
 
 TEST(DispatcherLifecycle, ExpiryRunsWithoutAConnection) {
-  ManualClock clock;
-  auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clock.Timing());
+  auto clock = std::make_shared<pmtest::ManualClock>();
+  auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clock);
   int ended = 0;
   dispatcher->Start([&] { ++ended; });
   EXPECT_EQ(ended, 1);
   std::atomic<int> expired{0};
   Json payload;
   EXPECT_FALSE(dispatcher->RpcRequest("c", payload, 5, [&](const Json&) { expired.fetch_add(1); }));
-  clock.Advance(5 * kMs);
+  clock->Advance(5 * kMs);
   ASSERT_TRUE(pmtest::WaitFor([&] { return expired.load() == 1; }));
   dispatcher->Stop();
 }

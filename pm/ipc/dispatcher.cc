@@ -1,13 +1,12 @@
-#include "pm/runtime/dispatcher.h"
+#include "pm/ipc/dispatcher.h"
 
-#include <chrono>
 #include <exception>
 #include <vector>
 
 #include "pm/ip/socket.h"
 #include "pm/ipc/connection.h"
+#include "pm/ipc/framing.h"
 #include "pm/runtime/clock.h"
-#include "pm/runtime/frame_reader.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/perf.h"
@@ -45,26 +44,10 @@ const Json* Field(const Json& object, const char* key) {
 
 }  // namespace
 
-DispatcherTiming DispatcherTiming::Steady() {
-  DispatcherTiming timing;
-  timing.now = [] { return SteadyNowNs(); };
-  timing.waitUntil = [](std::condition_variable& condition, std::unique_lock<std::mutex>& lock,
-                        std::int64_t deadlineNs) {
-    if (deadlineNs >= RpcDispatcher::kNoDeadline) {
-      condition.wait(lock);
-      return;
-    }
-    condition.wait_until(
-        lock, std::chrono::steady_clock::time_point(std::chrono::nanoseconds(deadlineNs)));
-  };
-  timing.sleep = [](std::int64_t nanos) {
-    std::this_thread::sleep_for(std::chrono::nanoseconds(nanos));
-  };
-  return timing;
-}
-
-RpcDispatcher::RpcDispatcher(std::shared_ptr<ipc::Connection> connection, DispatcherTiming timing)
-    : connection_(std::move(connection)), epoch_(timing.now()), timing_(std::move(timing)) {}
+RpcDispatcher::RpcDispatcher(std::shared_ptr<ipc::Connection> connection, std::shared_ptr<Clock> clock)
+    : connection_(std::move(connection)),
+      clock_(clock ? std::move(clock) : MakeSteadyClock()),
+      epoch_(clock_->NowNs()) {}
 
 RpcDispatcher::~RpcDispatcher() {
   Stop();
@@ -89,11 +72,11 @@ void RpcDispatcher::Start(std::function<void()> onEnded) {
     started_ = true;
     bool run = false;
     {
-      // Checked under the wake lock, where Stop clears running_, so that a
-      // concurrent Stop either sees the threads or keeps them from starting.
-      std::lock_guard<std::mutex> wake(wakeLock_);
+      // Checked under the running lock, where Stop clears running_, so that
+      // a concurrent Stop either sees the threads or keeps them from starting.
+      std::lock_guard<std::mutex> running(runningLock_);
       run = !stopRequested_.load();
-      running_ = run;
+      running_.store(run);
     }
     if (run) expiryThread_ = std::thread([this] { ExpiryLoop(); });
     if (run && connection_) {
@@ -135,7 +118,7 @@ bool RpcDispatcher::RpcRequest(std::string command, Json& payload, std::int64_t 
   bool earlier = false;
   {
     std::lock_guard<std::mutex> guard(pendingLock_);
-    const std::int64_t deadline = DeadlineAfter(timing_.now(), timeoutMs);
+    const std::int64_t deadline = DeadlineAfter(clock_->NowNs(), timeoutMs);
     auto [it, inserted] = pending_.try_emplace(id);
     if (!inserted) deadlineIndex_.erase({it->second.deadline, id});
     it->second.text = text;
@@ -149,12 +132,10 @@ bool RpcDispatcher::RpcRequest(std::string command, Json& payload, std::int64_t 
     }
   }
   if (earlier) {
-    // Notified under the wake lock: the expiry thread holds that lock from
-    // reading the earliest deadline until it waits, so the wake cannot fall
-    // between its check and its wait.
+    // A signal is kept until the expiry thread waits, so it cannot fall
+    // between that thread's look at the earliest deadline and its wait.
     wakeSignals_.fetch_add(1);
-    std::lock_guard<std::mutex> wake(wakeLock_);
-    wakeCondition_.notify_one();
+    clock_->Signal();
   }
   lockScope.Stop();
 
@@ -165,15 +146,15 @@ bool RpcDispatcher::RpcRequest(std::string command, Json& payload, std::int64_t 
 
 void RpcDispatcher::Stop() {
   if (stopRequested_.exchange(true)) return;
-  timing_.sleep(kStopGraceNs);
+  clock_->Sleep(kStopGraceNs);
   const std::thread::id self = std::this_thread::get_id();
 
   if (connection_) connection_->Close();
   {
-    std::lock_guard<std::mutex> wake(wakeLock_);
-    running_ = false;
-    wakeCondition_.notify_all();
+    std::lock_guard<std::mutex> running(runningLock_);
+    running_.store(false);
   }
+  clock_->Signal();
   std::thread expiry;
   std::thread receive;
   {
@@ -197,20 +178,16 @@ std::int64_t RpcDispatcher::EarliestDeadlineNs() const {
 
 void RpcDispatcher::ExpiryLoop() {
   SetThreadName("pm::Rpc Expiry");
-  std::unique_lock<std::mutex> wake(wakeLock_);
-  while (running_) {
+  while (running_.load()) {
     wakeFlag_.store(false);
-    const std::int64_t now = timing_.now();
+    const std::int64_t now = clock_->NowNs();
     const std::int64_t earliest = EarliestDeadlineNs();
     if (earliest <= now) {
-      wake.unlock();
       ExpireDue(now);
-      wake.lock();
       continue;
     }
-    timing_.waitUntil(wakeCondition_, wake, earliest);
+    clock_->WaitUntil(earliest);
   }
-  wake.unlock();
   ClearThreadName();
 }
 
@@ -255,7 +232,7 @@ void RpcDispatcher::ExpireDue(std::int64_t now) {
 
 void RpcDispatcher::ReceiveLoop() {
   SetThreadName("pm::Rpc Receive");
-  FrameReader reader;
+  ipc::FrameReader reader;
   std::string text;
   for (;;) {
     const std::size_t wanted = reader.Wanted();
@@ -270,7 +247,7 @@ void RpcDispatcher::ReceiveLoop() {
       Log(LogType::Normal, "",
           "RpcDispatcher: frame of %u bytes exceeds %u, closing the connection\n",
           static_cast<unsigned>(reader.OversizeLength()),
-          static_cast<unsigned>(FrameReader::kMaxFrameBytes));
+          static_cast<unsigned>(ipc::kMaxFrameBytes));
       break;
     }
     while (reader.Next(&text)) HandleMessage(text);
@@ -397,7 +374,7 @@ void RpcDispatcher::HandleRequest(const Json& message) {
   if (IsScalar(commandField)) response["pm::command"] = *commandField;
   response["pm::response"] = true;
   std::string text = pmjson::Dump(response);
-  if (text.size() > FrameReader::kMaxFrameBytes) {
+  if (text.size() > ipc::kMaxFrameBytes) {
     Log(LogType::Normal, "", "RpcDispatcher: reply to '%s' is %zu bytes, too long to send\n",
         command.c_str(), text.size());
     Json error = Json::object();

@@ -5,7 +5,7 @@
 // that reads message frames, runs handlers and matches replies to the
 // requests that are still pending.
 //
-// Messages are JSON objects sent as message frames (pm/runtime/frame_reader.h
+// Messages are JSON objects sent as message frames (pm/ipc/framing.h
 // gives the wire format). Envelope keys:
 //   request / notification: "pm::unique_id" (unsigned), "pm::command"
 //     (string), "pm::request": true, plus the command's own keys;
@@ -18,21 +18,23 @@
 //   - the receive thread ("pm::Rpc Receive") reads frames and runs handlers
 //     and the callbacks of answered requests;
 //   - the expiry thread ("pm::Rpc Expiry") removes pending requests whose
-//     deadline passed and runs their callbacks with a "timeout" error;
+//     deadline passed and runs their callbacks with a "timeout" error; it
+//     waits on the dispatcher's clock (pm/runtime/clock.h) until the earliest
+//     deadline, and RpcRequest (for an earlier deadline) and Stop signal it;
 //   - RegisterHandler, RpcRequest and Stop may be called from any thread,
 //     including from a handler or a callback (Stop never joins the thread it
 //     runs on; that thread ends by itself once its handler returns).
 //   Stop before destroy; destroy on a thread other than the dispatcher's own.
 //
-// Locks (none is ever held while another is taken, and none while a handler,
-// a callback, the log or a send runs):
+// Locks (none is held while a handler, a callback, the log, a send or the
+// clock runs; none is held while another is taken, except in the order
+// threadLock_ -> runningLock_ in Start):
 //   handlerLock_  guards handlers_
 //   pendingLock_  guards pending_, deadlineIndex_ and updates of earliestDeadline_
-//   wakeLock_     guards running_; paired with wakeCondition_
+//   runningLock_  guards the writes of running_ (Start sets it, Stop clears it)
 //   threadLock_   guards the thread handles and onEnded_
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -44,6 +46,8 @@
 #include <utility>
 
 #include <nlohmann/json.hpp>
+
+#include "pm/runtime/clock.h"
 
 namespace pm {
 
@@ -61,34 +65,19 @@ using RpcHandler = std::function<void(const nlohmann::json& request, nlohmann::j
 // "pm::response": true, "pm::error": "timeout"} when no reply came in time.
 using RpcCallback = std::function<void(const nlohmann::json& reply)>;
 
-// The clock and waits the dispatcher uses; tests substitute their own to drive
-// time instead of sleeping.
-struct DispatcherTiming {
-  // The steady clock in nanoseconds.
-  std::function<std::int64_t()> now;
-  // Waits on `condition` (the caller holds `lock`) until now() reaches
-  // deadlineNs (kNoDeadline: no time limit) or a notify; may return early.
-  std::function<void(std::condition_variable& condition, std::unique_lock<std::mutex>& lock,
-                     std::int64_t deadlineNs)>
-      waitUntil;
-  // Sleeps for the given number of nanoseconds (Stop's grace period).
-  std::function<void(std::int64_t nanos)> sleep;
-
-  // The real steady clock, condition waits and sleeps.
-  static DispatcherTiming Steady();
-};
-
 class RpcDispatcher {
  public:
-  static constexpr std::int64_t kNoDeadline = INT64_MAX;
+  static constexpr std::int64_t kNoDeadline = Clock::kNoDeadline;
   // Stop waits this long before closing the connection, so that replies that
   // are being written still leave.
   static constexpr std::int64_t kStopGraceNs = 50'000'000;
   static constexpr std::uint64_t kFirstRequestId = 1;
 
-  // `connection` may be null (nothing is sent or received then).
-  explicit RpcDispatcher(std::shared_ptr<ipc::Connection> connection,
-                         DispatcherTiming timing = DispatcherTiming::Steady());
+  // `connection` may be null (nothing is sent or received then). `clock` is
+  // the dispatcher's own (its expiry thread waits on it; Stop's grace period
+  // is slept on it); without one it makes a steady clock. Tests pass a clock
+  // they move by hand.
+  explicit RpcDispatcher(std::shared_ptr<ipc::Connection> connection, std::shared_ptr<Clock> clock = nullptr);
   // Stops (see Stop) and joins what is left.
   ~RpcDispatcher();
   RpcDispatcher(const RpcDispatcher&) = delete;
@@ -109,7 +98,7 @@ class RpcDispatcher {
   // `payload` (overwriting them; they stay there), registers it as pending
   // with deadline now + timeoutMs (a negative timeout counts as 0), and sends
   // it as one frame. True when the connection accepted the frame; a text over
-  // 524,288 bytes is not sent (false). The pending entry stays either way
+  // ipc::kMaxFrameBytes is not sent (false). The pending entry stays either way
   // until a reply or the deadline removes it. A payload that is neither an
   // object nor null is not sent (false, logged).
   bool RpcRequest(std::string command, nlohmann::json& payload, std::int64_t timeoutMs,
@@ -126,7 +115,7 @@ class RpcDispatcher {
 
   // Diagnostics.
   std::size_t PendingCount() const;
-  // The earliest deadline among pending requests on the timing's clock, or
+  // The earliest deadline among pending requests on the dispatcher's clock, or
   // kNoDeadline. May be earlier than the real one after a reply removed the
   // earliest request; the expiry thread then catches up.
   std::int64_t EarliestDeadlineNs() const;
@@ -140,7 +129,7 @@ class RpcDispatcher {
 
   struct PendingRequest {
     std::shared_ptr<const std::string> text;  // the request as sent
-    std::int64_t deadline = 0;                // on the timing's clock
+    std::int64_t deadline = 0;                // on the dispatcher's clock
     RpcCallback callback;                     // may be empty
   };
 
@@ -154,6 +143,7 @@ class RpcDispatcher {
   void FinishReceiving();
 
   const std::shared_ptr<ipc::Connection> connection_;
+  const std::shared_ptr<Clock> clock_;
   std::atomic<std::uint64_t> nextRequestId_{kFirstRequestId};
   const std::int64_t epoch_;                        // origin of earliestDeadline_
   std::atomic<std::int64_t> earliestDeadline_{kNoDeadline};  // relative to epoch_
@@ -167,15 +157,13 @@ class RpcDispatcher {
   std::atomic<bool> stopRequested_{false};
   std::atomic<bool> ended_{false};
   std::atomic<std::uint64_t> wakeSignals_{0};
-  const DispatcherTiming timing_;
   std::mutex threadLock_;
   bool started_ = false;                 // guarded by threadLock_
   std::function<void()> onEnded_;        // guarded by threadLock_ until the receive thread starts
   std::thread expiryThread_;             // guarded by threadLock_
-  bool running_ = false;                 // guarded by wakeLock_
+  std::atomic<bool> running_{false};     // written under runningLock_
   std::thread receiveThread_;            // guarded by threadLock_
-  std::condition_variable wakeCondition_;
-  std::mutex wakeLock_;
+  std::mutex runningLock_;
   std::atomic<bool> wakeFlag_{false};    // the earliest deadline moved earlier since the last look
 };
 
