@@ -230,8 +230,15 @@ std::vector<Socket*> Socket::WaitReadable(const std::vector<Socket*>& sockets, s
       waitMs = static_cast<int>(std::min<std::int64_t>(remaining / 1000000, sys::kPollSliceMs));
     }
     const int ready = sys::Poll(entries.data(), entries.size(), waitMs);
-    if (ready < 0 && LastSocketError::Read().Interrupted()) continue;
-    if (ready < 0) return {};
+    if (ready < 0) {
+      // On Windows our own Shutdown wakes the poll by cancelling it, which
+      // fails it: the flag checked above reports the socket.
+      const bool interrupted = LastSocketError::Read().Interrupted();
+      const bool shutDown =
+          std::any_of(owners.begin(), owners.end(), [](const Socket* owner) { return owner->shutDown_.load(); });
+      if (interrupted || shutDown) continue;
+      return {};
+    }
     if (ready == 0) {
       // Only a slice of the time passed: the deadline decides.
       if (forever || deadline - (SteadyNowNs() - start) > 0) continue;
