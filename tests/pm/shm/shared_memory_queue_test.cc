@@ -1,37 +1,31 @@
 // The segment pool of a source and its record channel to the host: ids,
 // sizes, reuse, holds, records with their check bytes, the host connection,
-// GPU segments, and what is left in /dev/shm.
+// GPU segments, and what the system still holds of the segments.
 #include <gtest/gtest.h>
 
-#include <sys/stat.h>
-
 #include <cstring>
-#include <filesystem>
 
 #include "pm/runtime/context.h"
+#include "pm/runtime/system.h"
 #include "pm/shm/shared_gpu_memory.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "fake_gpu.h"
 #include "support/host_link.h"
 #include "support/log_capture.h"
+#include "support/segment_probe.h"
 #include "support/wait.h"
 
 namespace {
 
 using pm::SharedMemoryQueueProducer;
 
-std::uint64_t ShmFileSize(const std::string& name) {
-  struct stat st {};
-  if (::stat(("/dev/shm/" + name).c_str(), &st) != 0) return 0;
-  return static_cast<std::uint64_t>(st.st_size);
-}
-
-bool ShmExists(const std::string& name) { return std::filesystem::exists("/dev/shm/" + name); }
+using pmtest::SegmentBytes;
+using pmtest::SegmentExists;
 
 struct StartedQueue {
   pmtest::HostLink link;
   std::shared_ptr<SharedMemoryQueueProducer> queue = std::make_shared<SharedMemoryQueueProducer>();
-  std::string base = "pmtestq" + std::to_string(::getpid()) + "_";
+  std::string base = "pmtestq" + std::to_string(pm::CurrentProcessId()) + "_";
   nlohmann::json startRequest;
   std::atomic<bool> hostConnected{false};
 
@@ -84,8 +78,8 @@ TEST(QueueSizes, AreRoundedUpTo4096) {
   auto more = q.queue->AllocateCpuBuffer(4097);
   EXPECT_EQ(one->Size(), 4096u);
   EXPECT_EQ(more->Size(), 8192u);
-  EXPECT_EQ(ShmFileSize(q.base + std::to_string(one->id)), 4096u);
-  EXPECT_EQ(ShmFileSize(q.base + std::to_string(more->id)), 8192u);
+  EXPECT_EQ(SegmentBytes(q.base + std::to_string(one->id)), 4096u);
+  EXPECT_EQ(SegmentBytes(q.base + std::to_string(more->id)), 8192u);
   EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
 }
 
@@ -191,9 +185,9 @@ TEST(QueueShm, NothingIsLeftAfterTheQueueGoes) {
     StartedQueue q;
     auto segment = q.queue->AllocateCpuBuffer(5000);
     name = q.base + std::to_string(segment->id);
-    EXPECT_TRUE(ShmExists(name));
+    EXPECT_TRUE(SegmentExists(name));
   }
-  EXPECT_FALSE(ShmExists(name));
+  EXPECT_FALSE(SegmentExists(name));
 }
 
 TEST(QueueGpu, ARegisteredManagerIsPreferredAndMatchedFieldByField) {
