@@ -180,8 +180,6 @@ bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
   return true;
 }
 
-bool ProcessAlive(int pid) { return pid > 0 && sys::ProcessAlive(pid); }
-
 std::vector<RegistryEntry> ListRegistry() {
   const std::string dir = RegistryDir();
   const std::int64_t now = RealtimeNs();
@@ -196,7 +194,7 @@ std::vector<RegistryEntry> ListRegistry() {
     if (!ReadSmallFile(dir + "/" + file, &text) || !ParseRegistryEntry(text, &e)) continue;
     if (present && e.gone != 0) continue;   // not one of ours
     if (!present && e.gone == 0) continue;
-    if (present && !ProcessAlive(e.pid)) {
+    if (present && !pm::ProcessAlive(e.pid)) {
       // Found gone just now. Where that cannot be written down (a folder
       // this process may not write), it is not listed at all: each look
       // would find it gone "just now" again.

@@ -1,5 +1,4 @@
 #include <fcntl.h>
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -68,20 +67,5 @@ bool RenameFile(const std::string& from, const std::string& to, int* error) {
 }
 
 void RemoveFile(const std::string& path) { ::unlink(path.c_str()); }
-
-bool ProcessAlive(int pid) {
-  if (::kill(pid, 0) != 0 && errno == ESRCH) return false;
-  // A killed child that its parent has not reaped yet still answers kill().
-  std::string stat;
-  if (ReadSmallFile("/proc/" + std::to_string(pid) + "/stat", 4096, &stat)) {
-    const std::size_t paren = stat.rfind(')');
-    if (paren != std::string::npos && paren + 2 < stat.size() && (stat[paren + 2] == 'Z' || stat[paren + 2] == 'X')) {
-      return false;
-    }
-  }
-  return true;
-}
-
-std::string ErrorText(int error) { return pm::ErrnoText(error); }
 
 }  // namespace ndilb::sys

@@ -1,7 +1,7 @@
 #pragma once
 // The system's side of the registry folder, one file per platform
 // (registry_posix.cc, registry_win.cc): where the folder is by default, how
-// an entry file is read and written, and whether a process lives.
+// an entry file is read and written.
 #include <cstddef>
 #include <string>
 
@@ -25,7 +25,5 @@ bool WriteNewFile(const std::string& path, const std::string& text, int* error);
 // Gives `from` the name `to`, replacing it; false with *error on failure.
 bool RenameFile(const std::string& from, const std::string& to, int* error);
 void RemoveFile(const std::string& path);
-// Whether the process exists and has not ended (nor is a zombie).
-bool ProcessAlive(int pid);
 
 }  // namespace ndilb::sys

@@ -69,14 +69,4 @@ bool RenameFile(const std::string& from, const std::string& to, int* error) {
 
 void RemoveFile(const std::string& path) { ::DeleteFileA(path.c_str()); }
 
-bool ProcessAlive(int pid) {
-  HANDLE process = ::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, static_cast<DWORD>(pid));
-  if (process == nullptr) return ::GetLastError() == ERROR_ACCESS_DENIED;  // exists, not ours to look at
-  // An ended process can still be opened for a while: its exit code says.
-  DWORD code = 0;
-  const bool running = ::GetExitCodeProcess(process, &code) && code == STILL_ACTIVE;
-  ::CloseHandle(process);
-  return running;
-}
-
 }  // namespace ndilb::sys

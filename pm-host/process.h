@@ -82,8 +82,4 @@ class ChildProcess {
 // with a trailing separator; empty when it cannot be read.
 std::string ProgramDirectory();
 
-// The processor time (user and system) that process `pid` has used, in
-// seconds; 0 when it cannot be read (/proc/PID/stat, GetProcessTimes).
-double ProcessCpuSeconds(int pid);
-
 }  // namespace pmhost

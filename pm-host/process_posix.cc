@@ -7,9 +7,6 @@
 #include <cerrno>
 #include <climits>
 #include <cstring>
-#include <fstream>
-#include <iterator>
-#include <sstream>
 
 #include "pm-host/process.h"
 
@@ -131,25 +128,6 @@ std::string ProgramDirectory() {
   std::string text(path, static_cast<std::size_t>(n));
   const std::size_t slash = text.rfind('/');
   return slash == std::string::npos ? std::string() : text.substr(0, slash + 1);
-}
-
-double ProcessCpuSeconds(int pid) {
-  if (pid <= 0) return 0;
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  // The command name (field 2) may hold blanks and parentheses: count from
-  // the last ')'. utime and stime are fields 14 and 15.
-  const std::size_t close = text.rfind(')');
-  if (close == std::string::npos) return 0;
-  std::istringstream fields(text.substr(close + 1));
-  std::string field;
-  unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && fields >> field; ++i) {
-    if (i == 14) utime = std::strtoull(field.c_str(), nullptr, 10);
-    if (i == 15) stime = std::strtoull(field.c_str(), nullptr, 10);
-  }
-  const long ticks = ::sysconf(_SC_CLK_TCK);
-  return ticks > 0 ? static_cast<double>(utime + stime) / static_cast<double>(ticks) : 0;
 }
 
 }  // namespace pmhost

@@ -224,16 +224,4 @@ std::string ProgramDirectory() {
   return separator == std::string::npos ? std::string() : text.substr(0, separator + 1);
 }
 
-double ProcessCpuSeconds(int pid) {
-  if (pid <= 0) return 0;
-  HANDLE process = ::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, static_cast<DWORD>(pid));
-  if (process == nullptr) return 0;
-  FILETIME created{}, ended{}, kernel{}, user{};
-  const bool ok = ::GetProcessTimes(process, &created, &ended, &kernel, &user);
-  ::CloseHandle(process);
-  if (!ok) return 0;
-  auto ticks = [](const FILETIME& t) { return (static_cast<ULONGLONG>(t.dwHighDateTime) << 32) | t.dwLowDateTime; };
-  return static_cast<double>(ticks(kernel) + ticks(user)) / 1e7;  // 100 ns units
-}
-
 }  // namespace pmhost

@@ -204,11 +204,31 @@ void NDISource::RunLoop() {
     loop.finder = nullptr;
     pm::ClearThreadName();
   });
-  bool leave = false;
-  while (!leave) LoopPass(loop, leave);
+  for (;;) {
+    switch (BeginPass(loop)) {
+      case ReceiverState::Exiting:
+        return;
+      case ReceiverState::Connecting:
+        PassConnecting(loop);
+        break;
+      case ReceiverState::Receiving:
+        PassReceiving(loop);
+        break;
+      case ReceiverState::Idle:
+        PassIdle(loop);
+        break;
+      case ReceiverState::Error:
+        PassError(loop);
+        break;
+      default:
+        pm::LogText(kLogTag, "unexpected state in NDI source receiver loop");
+        loop.wanted = ReceiverState::Error;
+        break;
+    }
+  }
 }
 
-void NDISource::LoopPass(LoopState& loop, bool& leave) {
+ReceiverState NDISource::BeginPass(LoopState& loop) {
   if (loop.waitMs > 0) {
     env_.clock->WaitUntil(env_.clock->NowNs() + loop.waitMs * 1'000'000);
     loop.waitMs = 0;
@@ -254,12 +274,9 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
     }
   }
   if (unexpectedExternal) pm::LogText(kLogTag, "unexpected external state transition for NDI source");
+  if (s == ReceiverState::Exiting) return s;
 
   const std::shared_ptr<Callbacks>& callbacks = GetCallbacks();
-  if (s == ReceiverState::Exiting) {
-    leave = true;
-    return;
-  }
   if (callbacks && loop.guiDirty) {
     callbacks->UpdateGui(BuildStatusGui(loop.config, s), {});
     loop.guiDirty = false;
@@ -270,119 +287,114 @@ void NDISource::LoopPass(LoopState& loop, bool& leave) {
     loop.reported = loop.toReport;
     if (callbacks) callbacks->UpdateConnectionState(loop.toReport);
   }
+  return s;
+}
 
-  switch (s) {
-    case ReceiverState::Connecting: {
-      loop.toReport = 1;
-      if (loop.receiver != nullptr && ListedElsewhere(loop)) return;
-      if (loop.receiver == nullptr) {
-        const std::string name = SenderName();
-        std::string url;
-        if (!FindSourceUrl(loop, name, &url)) {
-          loop.wanted = ReceiverState::Error;
-          return;
-        }
-        if (url.empty()) {
-          pm::LogText(kLogTag, "waiting for source to be found");
-          ++loop.attempts;
-          loop.waitMs = kRetryWaitMs;
-          return;
-        }
-        ndi_recv_create settings{};
-        settings.source_to_connect_to.ndi_name = name.c_str();
-        settings.source_to_connect_to.url_address = url.c_str();
-        settings.color_format = kNdiColorUyvyBgra;
-        settings.bandwidth = static_cast<std::int32_t>(loop.bandwidth);
-        settings.allow_video_fields = false;
-        loop.receiver = api_->recv_create_v2(&settings);
-        if (loop.receiver == nullptr) {
-          pm::LogText(kLogTag, "failed to create NDI receiver\n");
-          loop.wanted = ReceiverState::Error;
-          return;
-        }
-        loop.url = url;
-        loop.nextListLookNs = env_.clock->NowNs() + kRetryWaitMs * 1'000'000;
-      }
-      if (loop.attempts * kRetryWaitMs >= kConnectLimitMs) {
-        loop.wanted = ReceiverState::Idle;
-        return;
-      }
-      const ndi_tally tally{loop.tallyLive, loop.tallyPreview};
-      if (!api_->recv_set_tally(loop.receiver, &tally)) {
-        ++loop.attempts;
-        loop.waitMs = kRetryWaitMs;
-        return;
-      }
-      loop.tallyDirty = false;
-      if (!SendReceiverDocuments(loop.receiver, loop.requestedWidth, loop.requestedHeight,
-                                 loop.requestedFrameRate)) {
-        ++loop.attempts;
-        loop.waitMs = kRetryWaitMs;
-        return;
-      }
-      if (!CaptureOnce(loop.receiver, &loop.media)) {
-        ++loop.attempts;  // the capture itself waited
-        return;
-      }
-      loop.attempts = 0;
-      loop.wanted = ReceiverState::Receiving;
-      SendShotEvents(loop.receiver, loop.events);
-      RunPtzCommands(loop.receiver, loop.ptz);
-      return;
-    }
-    case ReceiverState::Receiving: {
-      loop.toReport = 2;
-      if (loop.receiver == nullptr) {
-        pm::LogText(kLogTag, "expected receiver in receiving state");
-        loop.wanted = ReceiverState::Error;
-        return;
-      }
-      if (ListedElsewhere(loop)) {
-        loop.wanted = ReceiverState::Connecting;
-        return;
-      }
-      if (loop.tallyDirty) {
-        const ndi_tally tally{loop.tallyLive, loop.tallyPreview};
-        if (api_->recv_set_tally(loop.receiver, &tally)) loop.tallyDirty = false;
-      }
-      if (!CaptureOnce(loop.receiver, &loop.media)) {
-        if (api_->recv_get_no_connections(loop.receiver) <= 0) {
-          pm::LogText(kLogTag, "lost connection from receiving state\n");
-          loop.wanted = ReceiverState::Idle;
-        }
-        return;
-      }
-      SendShotEvents(loop.receiver, loop.events);
-      RunPtzCommands(loop.receiver, loop.ptz);
-      return;
-    }
-    case ReceiverState::Idle: {
-      if (loop.reported != 3) {
-        loop.toReport = 3;
-        loop.waitMs = 0;
-      } else {
-        loop.waitMs = kPollWaitMs;
-      }
-      if (loop.receiver != nullptr && api_->recv_get_no_connections(loop.receiver) > 0) {
-        pm::LogText(kLogTag, "attempting to reconnect from idle state\n");
-        loop.wanted = ReceiverState::Connecting;
-        loop.waitMs = 0;
-      }
-      return;
-    }
-    case ReceiverState::Error: {
-      if (loop.receiver != nullptr) {
-        api_->recv_destroy(loop.receiver);
-        loop.receiver = nullptr;
-      }
-      loop.waitMs = kPollWaitMs;
-      return;
-    }
-    default:
-      pm::LogText(kLogTag, "unexpected state in NDI source receiver loop");
-      loop.wanted = ReceiverState::Error;
-      return;
+void NDISource::RetryLater(LoopState& loop) {
+  ++loop.attempts;
+  loop.waitMs = kRetryWaitMs;
+}
+
+void NDISource::AfterDelivery(LoopState& loop) {
+  SendShotEvents(loop.receiver, loop.events);
+  RunPtzCommands(loop.receiver, loop.ptz);
+}
+
+void NDISource::PassConnecting(LoopState& loop) {
+  loop.toReport = 1;
+  if (loop.receiver != nullptr && ListedElsewhere(loop)) return;
+  if (loop.receiver == nullptr && !MakeReceiver(loop)) return;
+  if (loop.attempts * kRetryWaitMs >= kConnectLimitMs) {
+    loop.wanted = ReceiverState::Idle;
+    return;
   }
+  const ndi_tally tally{loop.tallyLive, loop.tallyPreview};
+  if (!api_->recv_set_tally(loop.receiver, &tally)) return RetryLater(loop);
+  loop.tallyDirty = false;
+  if (!SendReceiverDocuments(loop.receiver, loop.requestedWidth, loop.requestedHeight, loop.requestedFrameRate)) {
+    return RetryLater(loop);
+  }
+  if (!CaptureOnce(loop.receiver, &loop.media)) {
+    ++loop.attempts;  // the capture itself waited
+    return;
+  }
+  loop.attempts = 0;
+  loop.wanted = ReceiverState::Receiving;
+  AfterDelivery(loop);
+}
+
+bool NDISource::MakeReceiver(LoopState& loop) {
+  const std::string name = SenderName();
+  std::string url;
+  if (!FindSourceUrl(loop, name, &url)) {
+    loop.wanted = ReceiverState::Error;
+    return false;
+  }
+  if (url.empty()) {
+    pm::LogText(kLogTag, "waiting for source to be found");
+    RetryLater(loop);
+    return false;
+  }
+  ndi_recv_create settings{};
+  settings.source_to_connect_to.ndi_name = name.c_str();
+  settings.source_to_connect_to.url_address = url.c_str();
+  settings.color_format = kNdiColorUyvyBgra;
+  settings.bandwidth = static_cast<std::int32_t>(loop.bandwidth);
+  settings.allow_video_fields = false;
+  loop.receiver = api_->recv_create_v2(&settings);
+  if (loop.receiver == nullptr) {
+    pm::LogText(kLogTag, "failed to create NDI receiver\n");
+    loop.wanted = ReceiverState::Error;
+    return false;
+  }
+  loop.url = url;
+  loop.nextListLookNs = env_.clock->NowNs() + kRetryWaitMs * 1'000'000;
+  return true;
+}
+
+void NDISource::PassReceiving(LoopState& loop) {
+  loop.toReport = 2;
+  if (loop.receiver == nullptr) {
+    pm::LogText(kLogTag, "expected receiver in receiving state");
+    loop.wanted = ReceiverState::Error;
+    return;
+  }
+  if (ListedElsewhere(loop)) {
+    loop.wanted = ReceiverState::Connecting;
+    return;
+  }
+  if (loop.tallyDirty) {
+    const ndi_tally tally{loop.tallyLive, loop.tallyPreview};
+    if (api_->recv_set_tally(loop.receiver, &tally)) loop.tallyDirty = false;
+  }
+  if (CaptureOnce(loop.receiver, &loop.media)) return AfterDelivery(loop);
+  if (api_->recv_get_no_connections(loop.receiver) <= 0) {
+    pm::LogText(kLogTag, "lost connection from receiving state\n");
+    loop.wanted = ReceiverState::Idle;
+  }
+}
+
+void NDISource::PassIdle(LoopState& loop) {
+  // Report Idle at once, then poll.
+  if (loop.reported != 3) {
+    loop.toReport = 3;
+    loop.waitMs = 0;
+  } else {
+    loop.waitMs = kPollWaitMs;
+  }
+  if (loop.receiver != nullptr && api_->recv_get_no_connections(loop.receiver) > 0) {
+    pm::LogText(kLogTag, "attempting to reconnect from idle state\n");
+    loop.wanted = ReceiverState::Connecting;
+    loop.waitMs = 0;
+  }
+}
+
+void NDISource::PassError(LoopState& loop) {
+  if (loop.receiver != nullptr) {
+    api_->recv_destroy(loop.receiver);
+    loop.receiver = nullptr;
+  }
+  loop.waitMs = kPollWaitMs;
 }
 
 std::string NDISource::SenderName() const {

@@ -158,7 +158,31 @@ class NDISource : public pm::Source {
   void StopLocked();   // lifecycleMutex_ held
   void ApplyConfiguration(const std::string& configJson);  // mutex_ held
   void RunLoop();
-  void LoopPass(LoopState& loop, bool& leave);
+  // Each pass of the loop: the wait the last pass asked for, then, under the
+  // mutex, the state sync (a state written by another thread wins over the
+  // loop's wish), tally, queues and published media; then the GUI and
+  // connection-state reports. Returns the state to act on (no reports for
+  // Exiting).
+  ReceiverState BeginPass(LoopState& loop);
+  // One function per state, as in the table above.
+  // Connecting: find the sender and make its receiver (MakeReceiver), give
+  // up to Idle after kConnectLimitMs of attempts, send tally and the two
+  // documents, and go to Receiving on the first delivered frame.
+  void PassConnecting(LoopState& loop);
+  // Receiving: follow a new listed URL, send a changed tally, capture; to
+  // Idle when nothing came and the receiver has no connection.
+  void PassReceiving(LoopState& loop);
+  // Idle: report at once, then poll every kPollWaitMs for a connection.
+  void PassIdle(LoopState& loop);
+  // Error: drop the receiver and poll every kPollWaitMs until Stop.
+  void PassError(LoopState& loop);
+  // Connecting without a receiver: true when one was made for the listed
+  // URL; otherwise sets the wish (Error) or the retry.
+  bool MakeReceiver(LoopState& loop);
+  // One more attempt, the next pass after kRetryWaitMs.
+  void RetryLater(LoopState& loop);
+  // After a delivered frame: pending shot events and PTZ commands.
+  void AfterDelivery(LoopState& loop);
   bool FindSourceUrl(LoopState& loop, const std::string& name, std::string* url);
   // The NDI name in the unique id (empty when the id is too short).
   std::string SenderName() const;

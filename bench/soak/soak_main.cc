@@ -37,6 +37,7 @@
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/log.h"
+#include "pm/runtime/proc_stat.h"
 
 namespace {
 
@@ -93,25 +94,10 @@ std::optional<Usage> UsageOf(pid_t pid) {
   return usage;
 }
 
-// A child of this process by its command name (/proc/PID/stat); -1 when none.
+// A child of this process by its command name; -1 when none.
 pid_t FindChild(const std::string& command) {
-  const pid_t self = ::getpid();
-  std::error_code error;
-  for (const auto& entry : std::filesystem::directory_iterator("/proc", error)) {
-    const std::string name = entry.path().filename().string();
-    if (name.empty() || name.find_first_not_of("0123456789") != std::string::npos) continue;
-    std::ifstream in(entry.path() / "stat");
-    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    // "PID (COMM) STATE PPID ...": the name may hold blanks, so from the last ')'.
-    const std::size_t open = text.find('(');
-    const std::size_t close = text.rfind(')');
-    if (open == std::string::npos || close == std::string::npos || close < open) continue;
-    char state = 0;
-    long parent = 0;
-    if (std::sscanf(text.c_str() + close + 1, " %c %ld", &state, &parent) != 2) continue;
-    if (parent == self && text.substr(open + 1, close - open - 1) == command) return std::atoi(name.c_str());
-  }
-  return -1;
+  const std::vector<pid_t> children = pm::ChildrenNamed(::getpid(), command);
+  return children.empty() ? -1 : children.front();
 }
 
 // Resident memory, descriptors and threads of one process over the run.

@@ -1,8 +1,11 @@
 #include <dlfcn.h>
+#include <signal.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstring>
 
+#include "pm/runtime/proc_stat.h"
 #include "pm/runtime/syscall.h"
 #include "pm/runtime/system.h"
 
@@ -10,10 +13,7 @@ namespace pm {
 
 void* FindProgramExport(const char* name) { return ::dlsym(RTLD_DEFAULT, name); }
 
-void WriteDefaultLogLine(const char* line) {
-  // One write, so lines from several threads do not mix.
-  [[maybe_unused]] ssize_t written = ::write(STDERR_FILENO, line, std::strlen(line));
-}
+void WriteDefaultLogLine(const char* line) { WriteToStderr(line); }
 
 void WriteToStderr(const char* text) {
   std::size_t length = std::strlen(text);
@@ -28,6 +28,21 @@ void WriteToStderr(const char* text) {
 std::string SystemErrorText(int code) { return ErrnoText(code); }
 
 int CurrentProcessId() { return static_cast<int>(::getpid()); }
+
+bool ProcessAlive(int pid) {
+  if (pid <= 0) return false;
+  if (::kill(pid, 0) != 0 && errno == ESRCH) return false;
+  // A killed child that its parent has not reaped yet still answers kill().
+  ProcStat stat;
+  return !(ReadProcStat(pid, &stat) && (stat.state == 'Z' || stat.state == 'X'));
+}
+
+double ProcessCpuSeconds(int pid) {
+  ProcStat stat;
+  const long ticks = ::sysconf(_SC_CLK_TCK);
+  if (!ReadProcStat(pid, &stat) || ticks <= 0) return 0;
+  return static_cast<double>(stat.userTicks + stat.systemTicks) / static_cast<double>(ticks);
+}
 
 std::string HostName() {
   char host[256] = {};

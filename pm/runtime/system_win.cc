@@ -40,6 +40,29 @@ std::string SystemErrorText(int code) {
 
 int CurrentProcessId() { return static_cast<int>(::GetCurrentProcessId()); }
 
+bool ProcessAlive(int pid) {
+  if (pid <= 0) return false;
+  HANDLE process = ::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, static_cast<DWORD>(pid));
+  if (process == nullptr) return ::GetLastError() == ERROR_ACCESS_DENIED;  // exists, not ours to look at
+  // An ended process can still be opened for a while: its exit code says.
+  DWORD code = 0;
+  const bool running = ::GetExitCodeProcess(process, &code) && code == STILL_ACTIVE;
+  ::CloseHandle(process);
+  return running;
+}
+
+double ProcessCpuSeconds(int pid) {
+  if (pid <= 0) return 0;
+  HANDLE process = ::OpenProcess(PROCESS_QUERY_LIMITED_INFORMATION, FALSE, static_cast<DWORD>(pid));
+  if (process == nullptr) return 0;
+  FILETIME created{}, ended{}, kernel{}, user{};
+  const bool ok = ::GetProcessTimes(process, &created, &ended, &kernel, &user);
+  ::CloseHandle(process);
+  if (!ok) return 0;
+  auto ticks = [](const FILETIME& t) { return (static_cast<ULONGLONG>(t.dwHighDateTime) << 32) | t.dwLowDateTime; };
+  return static_cast<double>(ticks(kernel) + ticks(user)) / 1e7;  // 100 ns units
+}
+
 std::string HostName() {
   char host[MAX_COMPUTERNAME_LENGTH + 1] = {};
   DWORD size = sizeof host;

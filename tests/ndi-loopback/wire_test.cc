@@ -1,5 +1,6 @@
 // The loopback runtime's pieces that need no socket: the wire decoder, the
 // registry entry format, picture halving and the audio interleaving call.
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -74,31 +75,42 @@ TEST(WireDecoder, WholeMessagesComeOutWhateverTheFragmentation) {
   }
 }
 
+std::vector<std::uint8_t> AudioBytes(int channels, int samples, std::uint64_t payload) {
+  ndilb::AudioInfo info;
+  info.sample_rate = 48000;
+  info.channels = channels;
+  info.samples = samples;
+  ndilb::EncodedHead head = ndilb::EncodeAudio(info, 0, payload);
+  return {head.bytes, head.bytes + head.size};
+}
+
 TEST(WireDecoder, RejectsBadHeadersBeforeAllocatingAndStaysFailed) {
-  struct Case {
-    const char* what;
-    std::function<void(std::vector<std::uint8_t>&)> spoil;
-  };
-  const std::vector<Case> cases = {
-      {"magic", [](auto& b) { b[0] ^= 0xFF; }},
-      {"type", [](auto& b) { b[4] = 99; }},
-      {"info size", [](auto& b) { b[6] = 47; }},
-      {"reserved", [](auto& b) { b[12] = 1; }},
-      {"oversize text", [](auto& b) { b[8] = b[9] = b[10] = b[11] = 0xFF; }},
-      {"oversize payload", [](auto& b) { b[23] = 0x7F; }},
-      {"payload not matching the picture", [](auto& b) { b[16] += 1; }},
-      {"impossible picture", [](auto& b) { b[24 + 3] = 0x80; }},  // negative width
-  };
-  for (const Case& c : cases) {
+  auto spoilt = [](void (*spoil)(std::vector<std::uint8_t>&)) {
     std::vector<std::uint8_t> bytes = VideoBytes(8, 4, 1);
-    c.spoil(bytes);
+    spoil(bytes);
+    return bytes;
+  };
+  const std::pair<const char*, std::vector<std::uint8_t>> cases[] = {
+      {"magic", spoilt([](auto& b) { b[0] ^= 0xFF; })},
+      {"type", spoilt([](auto& b) { b[4] = 99; })},
+      {"info size", spoilt([](auto& b) { b[6] = 47; })},
+      {"reserved", spoilt([](auto& b) { b[12] = 1; })},
+      {"oversize text", spoilt([](auto& b) { b[8] = b[9] = b[10] = b[11] = 0xFF; })},
+      {"oversize payload", spoilt([](auto& b) { b[23] = 0x7F; })},
+      {"payload not matching the picture", spoilt([](auto& b) { b[16] += 1; })},
+      {"impossible picture", spoilt([](auto& b) { b[24 + 3] = 0x80; })},  // negative width
+      {"sound payload not channels x samples", AudioBytes(2, 10, 2 * 10 * 4 + 4)},
+      {"too many channels", AudioBytes(ndilb::kMaxAudioChannels + 1, 10, (ndilb::kMaxAudioChannels + 1) * 10 * 4)},
+  };
+  for (const auto& [what, bytes] : cases) {
+    SCOPED_TRACE(what);
     Decoder d = ReceiverDecoder();
-    EXPECT_FALSE(d.Feed(bytes.data(), bytes.size())) << c.what;
-    EXPECT_TRUE(d.failed()) << c.what;
-    EXPECT_FALSE(d.Pop().has_value()) << c.what;
-    EXPECT_TRUE(d.WritableSpan().empty()) << c.what;
+    EXPECT_FALSE(d.Feed(bytes.data(), bytes.size()));
+    EXPECT_TRUE(d.failed());
+    EXPECT_FALSE(d.Pop().has_value());
+    EXPECT_TRUE(d.WritableSpan().empty());
     const auto good = MetadataBytes("<x/>");
-    EXPECT_FALSE(d.Feed(good.data(), good.size())) << c.what << ": a failed decoder must stay failed";
+    EXPECT_FALSE(d.Feed(good.data(), good.size())) << "a failed decoder must stay failed";
   }
 }
 
@@ -125,20 +137,6 @@ TEST(WireDecoder, EachEndAcceptsOnlyItsOwnMessages) {
   EXPECT_TRUE(t->on_preview);
 }
 
-TEST(WireDecoder, AudioPayloadMustMatchChannelsTimesSamples) {
-  ndilb::AudioInfo info;
-  info.sample_rate = 48000;
-  info.channels = 2;
-  info.samples = 10;
-  ndilb::EncodedHead bad = ndilb::EncodeAudio(info, 0, 2 * 10 * 4 + 4);
-  Decoder d = ReceiverDecoder();
-  EXPECT_FALSE(d.Feed(bad.bytes, bad.size));
-  info.channels = ndilb::kMaxAudioChannels + 1;
-  ndilb::EncodedHead many = ndilb::EncodeAudio(info, 0, static_cast<std::uint64_t>(info.channels) * 10 * 4);
-  Decoder d2 = ReceiverDecoder();
-  EXPECT_FALSE(d2.Feed(many.bytes, many.size));
-}
-
 TEST(RegistryEntry, MalformedEntriesAreRefused) {
   ndilb::RegistryEntry e;
   EXPECT_TRUE(ndilb::ParseRegistryEntry("ndi-loopback 1\nname=H (a)\nurl=127.0.0.1:5\npid=7\n", &e));
@@ -149,13 +147,9 @@ TEST(RegistryEntry, MalformedEntriesAreRefused) {
                           "ndi-loopback 1\nname=\nurl=b\npid=1\n", "ndi-loopback 1\nname=a\nurl=b\npid=99999999999\n"}) {
     EXPECT_FALSE(ndilb::ParseRegistryEntry(bad, &e)) << bad;
   }
-}
-
-TEST(RegistryEntry, FullNameUpperCasesTheHost) {
+  // A sender's full name: the host in capitals, then its own name.
   const std::string full = ndilb::FullSourceName("Cam 1");
-  ASSERT_GT(full.size(), 8u);
-  EXPECT_EQ(full.substr(full.size() - 8), " (Cam 1)");
-  for (char c : full.substr(0, full.size() - 8)) EXPECT_FALSE(c >= 'a' && c <= 'z') << full;
+  EXPECT_THAT(full, ::testing::MatchesRegex("[^a-z]+ \\(Cam 1\\)"));
 }
 
 TEST(ScalePicture, UyvyKeepsEveryOtherPixelWithItsChroma) {
@@ -275,36 +269,6 @@ TEST(InterleaveAudio, PlanarWithPaddedStrideBecomesSampleMajor) {
   EXPECT_EQ(out.back(), -7.0f) << "wrote past no_samples x no_channels";
   NDIlib_util_audio_to_interleaved_32f_v2(nullptr, &dst);
   NDIlib_util_audio_to_interleaved_32f_v2(&src, nullptr);
-}
-
-TEST(NullHandles, EveryEntryPointToleratesThem) {
-  std::uint32_t count = 5;
-  EXPECT_EQ(NDIlib_find_get_current_sources(nullptr, &count), nullptr);
-  EXPECT_EQ(count, 0u);
-  EXPECT_FALSE(NDIlib_find_wait_for_sources(nullptr, 0));
-  NDIlib_find_destroy(nullptr);
-  EXPECT_EQ(NDIlib_recv_create_v2(nullptr), nullptr);
-  EXPECT_EQ(NDIlib_recv_get_no_connections(nullptr), 0);
-  EXPECT_EQ(NDIlib_recv_capture_v2(nullptr, nullptr, nullptr, nullptr, 0), kNdiFrameNone);
-  NDIlib_recv_free_video_v2(nullptr, nullptr);
-  NDIlib_recv_free_audio_v2(nullptr, nullptr);
-  NDIlib_recv_free_metadata(nullptr, nullptr);
-  EXPECT_FALSE(NDIlib_recv_set_tally(nullptr, nullptr));
-  EXPECT_FALSE(NDIlib_recv_send_metadata(nullptr, nullptr));
-  EXPECT_FALSE(NDIlib_recv_ptz_is_supported(nullptr));
-  EXPECT_FALSE(NDIlib_recv_ptz_zoom(nullptr, 1));
-  NDIlib_recv_destroy(nullptr);
-  EXPECT_EQ(NDIlib_send_create(nullptr), nullptr);
-  NDIlib_send_send_video_v2(nullptr, nullptr);
-  NDIlib_send_send_audio_v2(nullptr, nullptr);
-  NDIlib_send_send_metadata(nullptr, nullptr);
-  EXPECT_EQ(NDIlib_send_capture(nullptr, nullptr, 0), kNdiFrameNone);
-  NDIlib_send_free_metadata(nullptr, nullptr);
-  EXPECT_FALSE(NDIlib_send_get_tally(nullptr, nullptr, 0));
-  EXPECT_EQ(NDIlib_send_get_no_connections(nullptr, 0), 0);
-  NDIlib_send_add_connection_metadata(nullptr, nullptr);
-  NDIlib_send_clear_connection_metadata(nullptr);
-  NDIlib_send_destroy(nullptr);
 }
 
 }  // namespace

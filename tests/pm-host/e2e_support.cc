@@ -9,11 +9,11 @@
 #include <atomic>
 #include <cstdio>
 #include <filesystem>
-#include <mutex>
-#include <thread>
-#include <set>
 #include <fstream>
-#include <sstream>
+#include <iterator>
+#include <mutex>
+#include <set>
+#include <thread>
 
 #include <gtest/gtest.h>
 
@@ -41,9 +41,7 @@ Folder::~Folder() {
 
 std::string Folder::ReadRunnerLog() const {
   std::ifstream in(RunnerLog());
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
 }
 
 bool Sender::Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
@@ -214,19 +212,15 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
 std::optional<ProcessUsage> OwnUsage() { return UsageAt("/proc/self"); }
 
 std::optional<ProcessUsage> LevelOf(pid_t pid) {
-  std::optional<ProcessUsage> level;
-  for (int i = 0; i < 5; ++i) {
+  std::optional<ProcessUsage> level = UsageOf(pid);
+  for (int i = 0; i < 4 && level; ++i) {
+    std::this_thread::sleep_for(10ms);
     const std::optional<ProcessUsage> now = UsageOf(pid);
     if (!now) return std::nullopt;
-    if (!level) {
-      level = now;
-    } else {
-      level->descriptors = std::min(level->descriptors, now->descriptors);
-      level->threads = std::min(level->threads, now->threads);
-      level->residentKiB = std::max(level->residentKiB, now->residentKiB);
-      level->privateKiB = std::max(level->privateKiB, now->privateKiB);
-    }
-    std::this_thread::sleep_for(10ms);
+    level->descriptors = std::min(level->descriptors, now->descriptors);
+    level->threads = std::min(level->threads, now->threads);
+    level->residentKiB = std::max(level->residentKiB, now->residentKiB);
+    level->privateKiB = std::max(level->privateKiB, now->privateKiB);
   }
   return level;
 }

@@ -1,10 +1,9 @@
 // A task module for the runner tests: a pm::Task with handlers that answer,
-// throw, ask the host a question of their own, and end the task.
+// hang, and end the task.
 #include <unistd.h>
 
 #include <chrono>
 #include <memory>
-#include <stdexcept>
 #include <thread>
 
 #include <nlohmann/json.hpp>
@@ -26,9 +25,6 @@ class EchoTask : public pm::Task {
       response["value"] = request.value("value", Json());
       response["pid"] = ::getpid();
     });
-    dispatcher->RegisterHandler("test::throw", [](const Json&, Json&) {
-      throw std::runtime_error("the handler failed on purpose");
-    });
     dispatcher->RegisterHandler("test::stop_task", [this](const Json&, Json&) { StopTask(); });
     std::weak_ptr<pm::RpcDispatcher> weak = dispatcher;
     // A handler that never comes back in time (it tells the host it started):
@@ -39,20 +35,6 @@ class EchoTask : public pm::Task {
         self->RpcRequest("test::hanging", note, 10000);
       }
       std::this_thread::sleep_for(std::chrono::seconds(60));
-    });
-    // Sends the host a request whose reply's "answer" comes back to the host
-    // in a "test::callback_ran" notification, from the request's callback.
-    dispatcher->RegisterHandler("test::ask_host", [weak](const Json& request, Json& response) {
-      auto self = weak.lock();
-      if (!self) return;
-      Json question = {{"question", request.value("question", "")}};
-      self->RpcRequest("test::question", question, 10000, [weak](const Json& reply) {
-        if (auto again = weak.lock()) {
-          Json note = {{"answer", reply.value("answer", Json())}, {"error", reply.value("pm::error", "")}};
-          again->RpcRequest("test::callback_ran", note, 10000);
-        }
-      });
-      response["asked"] = question["pm::unique_id"];
     });
   }
 

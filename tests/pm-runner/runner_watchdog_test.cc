@@ -6,26 +6,23 @@
 
 #include <chrono>
 
-#include "pm-runner/runner_process.h"
+#include "support/runner_child.h"
 
 namespace {
 
 using namespace std::chrono_literals;
 
 TEST(RunnerWatchdog, WorkerThatDoesNotStopEndsTheProcessWithStatus1) {
-  pmtest::HostListener listener;
-  pmtest::RunnerProcess runner(pmtest::Args(PM_ECHO_TASK_PATH, {listener.Port()}));
-  pmtest::HostPeer host = listener.Accept();
-  ASSERT_TRUE(host.Valid());
-  EXPECT_TRUE(pmtest::Echoes(host, 1));
-  ASSERT_TRUE(host.WriteJson({{"pm::command", "test::hang"}, {"pm::unique_id", 2}}));
-  EXPECT_EQ(host.ReadJson(10s).value("pm::command", ""), "test::hanging");
+  pmtest::RunnerOnPort r(PM_ECHO_TASK_PATH);
+  ASSERT_TRUE(r.Ready());
+  ASSERT_TRUE(r.host.WriteJson(pmtest::Request("test::hang", 2)));
+  EXPECT_EQ(r.host.ReadJson(10s).value("pm::command", ""), "test::hanging");
 
   const auto start = std::chrono::steady_clock::now();
-  runner.Signal(SIGTERM);
-  EXPECT_EQ(runner.Wait(30s), 1);
+  r.runner.Signal(SIGTERM);
+  EXPECT_EQ(r.runner.Wait(30s), 1);
   EXPECT_GE(std::chrono::steady_clock::now() - start, 4s);
-  EXPECT_NE(runner.Stderr().find("did not stop within 5 seconds"), std::string::npos) << runner.Stderr();
+  EXPECT_NE(r.runner.Stderr().find("did not stop within 5 seconds"), std::string::npos) << r.runner.Stderr();
 }
 
 }  // namespace

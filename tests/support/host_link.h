@@ -11,6 +11,7 @@
 
 #include "pm/ipc/connection.h"
 #include "pm/ipc/dispatcher.h"
+#include "support/host_socket.h"
 
 namespace pmtest {
 
@@ -27,7 +28,7 @@ class HostLink {
   std::optional<nlohmann::json> ReadCommand(const std::string& command, std::int64_t timeoutMs = 5000);
 
  private:
-  std::shared_ptr<pm::ipc::Connection> host_;
+  HostPeer host_;
   std::shared_ptr<pm::RpcDispatcher> dispatcher_;
 };
 
@@ -45,8 +46,5 @@ class QueueReader {
  private:
   std::shared_ptr<pm::ipc::Connection> connection_;
 };
-
-// pm::Fletcher16 over `length` bytes as a pair (sum1, sum2).
-std::pair<unsigned, unsigned> FletcherSums(const std::uint8_t* bytes, std::size_t length);
 
 }  // namespace pmtest

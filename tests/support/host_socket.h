@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 
 #include <nlohmann/json.hpp>
 
@@ -32,12 +33,11 @@ class HostPeer {
  public:
   HostPeer() = default;
   explicit HostPeer(pm::ip::SocketHandle fd) : fd_(fd) {}
-  HostPeer(HostPeer&& other) noexcept : fd_(other.fd_) { other.fd_ = pm::ip::kNoSocket; }
+  HostPeer(HostPeer&& other) noexcept : fd_(std::exchange(other.fd_, pm::ip::kNoSocket)) {}
   HostPeer& operator=(HostPeer&& other) noexcept {
     if (this != &other) {
       Close();
-      fd_ = other.fd_;
-      other.fd_ = pm::ip::kNoSocket;
+      fd_ = std::exchange(other.fd_, pm::ip::kNoSocket);
     }
     return *this;
   }
@@ -70,21 +70,11 @@ class HostPeer {
 
   // Exactly n bytes within the time limit; false on timeout or end of stream.
   bool ReadExact(void* out, std::size_t n, std::chrono::milliseconds limit) {
-    auto* p = static_cast<char*>(out);
     const auto deadline = std::chrono::steady_clock::now() + limit;
-    std::size_t at = 0;
-    while (at < n) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      if (left.count() < 0) return false;
-      hostsys::PollEntry entry{fd_, false, false};
-      if (RetryInterrupted([&] { return hostsys::Poll(&entry, 1, static_cast<int>(left.count()) + 1); }) <= 0) {
-        return false;
-      }
-      const std::int64_t got =
-          RetryInterrupted([&] { return hostsys::Receive(fd_, p + at, n - at, hostsys::ReceiveMode::kNormal); });
-      if (got <= 0) return false;
-      at += static_cast<std::size_t>(got);
+    for (std::size_t at = 0; at < n;) {
+      const auto got = ReceiveBy(deadline, static_cast<char*>(out) + at, n - at);
+      if (!got || *got <= 0) return false;
+      at += static_cast<std::size_t>(*got);
     }
     return true;
   }
@@ -102,26 +92,33 @@ class HostPeer {
     if (!text) return nlohmann::json(nlohmann::json::value_t::discarded);
     return nlohmann::json::parse(*text, nullptr, false);
   }
-  // True when the peer ends the stream (or resets it) within the limit.
+  // True when the peer ends the stream (or resets it) within the limit; data
+  // before the end is skipped.
   bool SeesEndOfStream(std::chrono::milliseconds limit = std::chrono::seconds(5)) {
-    char byte;
     const auto deadline = std::chrono::steady_clock::now() + limit;
+    char byte;
     for (;;) {
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-          deadline - std::chrono::steady_clock::now());
-      if (left.count() < 0) return false;
-      hostsys::PollEntry entry{fd_, false, false};
-      if (RetryInterrupted([&] { return hostsys::Poll(&entry, 1, static_cast<int>(left.count()) + 1); }) <= 0) {
-        return false;
-      }
-      const std::int64_t got =
-          RetryInterrupted([&] { return hostsys::Receive(fd_, &byte, 1, hostsys::ReceiveMode::kNormal); });
-      if (got <= 0) return true;
-      // Data before the end: keep reading.
+      const auto got = ReceiveBy(deadline, &byte, 1);
+      if (!got) return false;
+      if (*got <= 0) return true;
     }
   }
 
  private:
+  // What Receive returns once the socket is readable (0 at the end of the
+  // stream, negative on an error); nullopt when it is not readable by the
+  // deadline.
+  std::optional<std::int64_t> ReceiveBy(std::chrono::steady_clock::time_point deadline, char* p, std::size_t n) {
+    using std::chrono::steady_clock;
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
+    if (left.count() < 0) return std::nullopt;
+    hostsys::PollEntry entry{fd_, false, false};
+    if (RetryInterrupted([&] { return hostsys::Poll(&entry, 1, static_cast<int>(left.count()) + 1); }) <= 0) {
+      return std::nullopt;
+    }
+    return RetryInterrupted([&] { return hostsys::Receive(fd_, p, n, hostsys::ReceiveMode::kNormal); });
+  }
+
   pm::ip::SocketHandle fd_ = pm::ip::kNoSocket;
 };
 

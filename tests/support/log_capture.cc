@@ -54,9 +54,8 @@ std::vector<std::string> LogCapture::Lines() const {
 }
 
 int LogCapture::Count(const std::string& text) const {
-  std::lock_guard<std::mutex> guard(mutex_);
   int n = 0;
-  for (const auto& line : lines_) n += line.find(text) != std::string::npos;
+  for (const auto& line : Lines()) n += line.find(text) != std::string::npos;
   return n;
 }
 

@@ -6,10 +6,7 @@ namespace pmtest {
 
 ManualClock::ManualClock(std::int64_t startNs) : now_(startNs) {}
 
-std::int64_t ManualClock::NowNs() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return now_;
-}
+std::int64_t ManualClock::NowNs() { return Locked(now_); }
 
 void ManualClock::Signal() {
   std::lock_guard<std::mutex> guard(mutex_);
@@ -49,21 +46,6 @@ std::int64_t ManualClock::AwaitWait(int n) {
   std::unique_lock<std::mutex> lock(mutex_);
   if (!changed_.wait_for(lock, std::chrono::seconds(10), [&] { return waitsBegun_ >= n && waiting_; })) return -1;
   return (deadline_ - now_) / 1'000'000;
-}
-
-int ManualClock::WaitsBegun() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return waitsBegun_;
-}
-
-std::int64_t ManualClock::LastWaitDeadline() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return deadline_;
-}
-
-int ManualClock::Sleeps() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return sleeps_;
 }
 
 }  // namespace pmtest

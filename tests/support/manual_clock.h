@@ -30,12 +30,18 @@ class ManualClock final : public pm::Clock {
   // now, or -1 when that did not happen.
   std::int64_t AwaitWait(int n);
   // Waits that blocked so far, and the deadline of the last one.
-  int WaitsBegun();
-  std::int64_t LastWaitDeadline();
+  int WaitsBegun() { return Locked(waitsBegun_); }
+  std::int64_t LastWaitDeadline() { return Locked(deadline_); }
   // Sleep calls so far.
-  int Sleeps();
+  int Sleeps() { return Locked(sleeps_); }
 
  private:
+  template <typename T>
+  T Locked(const T& value) {
+    std::lock_guard<std::mutex> guard(mutex_);
+    return value;
+  }
+
   std::mutex mutex_;  // guards everything below
   std::condition_variable changed_;
   std::int64_t now_;

@@ -39,11 +39,11 @@ class DiscoveryTest : public ::testing::Test {
 TEST_F(DiscoveryTest, ScansAfter125MsThenDoublingTo4s) {
   discovery->Start();
   EXPECT_EQ(env.clock->AwaitWait(1), 125);
-  EXPECT_EQ(ndi.ListCalls(), 0);
+  EXPECT_EQ(ndi.Seen().listCalls, 0);
   std::vector<std::int64_t> intervals;
   for (int scan = 1; scan <= 7; ++scan) {
     intervals.push_back(NextScan());
-    EXPECT_EQ(ndi.ListCalls(), scan);
+    EXPECT_EQ(ndi.Seen().listCalls, scan);
   }
   EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
 }
@@ -53,22 +53,22 @@ TEST_F(DiscoveryTest, SenderIsAnnouncedOnceWhileItStaysAndAnewAfterItVanished) {
   discovery->Start();
   NextScan();
   NextScan();
-  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)"});
+  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)"});
   EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: STUDIO (Cam 1) (127.0.0.1:1)\n"), 1);
-  const pm::SourceInfo info = callbacks->Infos().at(0);
+  const pm::SourceInfo info = callbacks->Seen().infos.at(0);
   EXPECT_EQ(info.produces, 3u);
   EXPECT_EQ(info.maximumLatencySeconds, 1.0);
 
   ndi.SetSources({});
   NextScan();
-  EXPECT_EQ(callbacks->Calls().back(), "-NDICaptureDevice~STUDIO (Cam 1)");
+  EXPECT_EQ(callbacks->Seen().calls.back(), "-NDICaptureDevice~STUDIO (Cam 1)");
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 2u);
+  EXPECT_EQ(callbacks->Seen().calls.size(), 2u);
 
   ndi.SetSources({Entry{"STUDIO (Cam 1)", "127.0.0.1:1"}});
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 3u);
-  EXPECT_EQ(callbacks->Calls().back(), "+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)");
+  EXPECT_EQ(callbacks->Seen().calls.size(), 3u);
+  EXPECT_EQ(callbacks->Seen().calls.back(), "+NDICaptureDevice~STUDIO (Cam 1) STUDIO (Cam 1)");
   EXPECT_EQ(logs.Count("Discovered NDI Source"), 2);
 }
 
@@ -77,7 +77,7 @@ TEST_F(DiscoveryTest, EntriesWithoutNameOrUrlAreIgnored) {
                   Entry{"C (z)", ""}, Entry{"D (w)", "10.0.0.4:1"}});
   discovery->Start();
   NextScan();
-  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"+NDICaptureDevice~D (w) D (w)"});
+  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"+NDICaptureDevice~D (w) D (w)"});
 }
 
 // Senders are told apart by URL, so two with one name are two entries with
@@ -109,7 +109,7 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
       ndi.SetSources(scan);
       ASSERT_TRUE(fresh.ScanOnce(reinterpret_cast<void*>(0x10)));
     }
-    EXPECT_EQ(calls->Calls(), script.calls);
+    EXPECT_EQ(calls->Seen().calls, script.calls);
   }
 }
 
@@ -117,8 +117,8 @@ TEST_F(DiscoveryTest, StopDuringAWaitEndsWithoutAnotherScan) {
   discovery->Start();
   NextScan();
   discovery->Stop();
-  EXPECT_EQ(ndi.ListCalls(), 1);
-  EXPECT_EQ(ndi.FindersDestroyed(), 1);
+  EXPECT_EQ(ndi.Seen().listCalls, 1);
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
   EXPECT_EQ(*env.exits, 0);
 }
 
@@ -133,9 +133,9 @@ TEST_F(DiscoveryTest, RestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
   waits = 3;           // the first loop's two waits, then this loop's first
   EXPECT_EQ(env.clock->AwaitWait(waits), 125);
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 1u);  // still there: not announced again
-  EXPECT_EQ(ndi.FindersCreated(), 2);
-  EXPECT_EQ(ndi.MaxLiveFinders(), 1);
+  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);  // still there: not announced again
+  EXPECT_EQ(ndi.Seen().findersCreated, 2);
+  EXPECT_EQ(ndi.Seen().maxLiveFinders, 1);
 }
 
 TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
@@ -146,7 +146,7 @@ TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Start();
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 1u);
+  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);
 }
 
 TEST_F(DiscoveryTest, WithoutCallbacksTheTableIsKeptAndNothingAnnounced) {

@@ -1,5 +1,6 @@
 #include "fakes.h"
 
+#include <algorithm>
 #include <atomic>
 
 namespace nditest {
@@ -66,12 +67,15 @@ std::vector<float> FakeAudioBuffer::Samples() const {
   return samples;
 }
 
-void FakeCallbacks::Record(std::string call) { calls_.push_back(std::move(call)); }
+void FakeCallbacks::Note(std::string call) {
+  std::lock_guard<std::mutex> guard(mutex_);
+  heard_.calls.push_back(std::move(call));
+}
 
 std::shared_ptr<pm::VideoBuffer> FakeCallbacks::RequestVideoBuffer(const pm::VideoFormat& format, std::uint32_t) {
   std::lock_guard<std::mutex> guard(mutex_);
-  videoRequests_.push_back(format);
-  Record("video request");
+  heard_.videoRequests.push_back(format);
+  heard_.calls.push_back("video request");
   if (videoDry_) return nullptr;
   return std::make_shared<FakeVideoBuffer>(overrideVideo_ ? videoOverride_ : format);
 }
@@ -79,8 +83,8 @@ std::shared_ptr<pm::VideoBuffer> FakeCallbacks::RequestVideoBuffer(const pm::Vid
 std::shared_ptr<pm::AudioBuffer> FakeCallbacks::RequestAudioBuffer(const pm::AudioFormat& format,
                                                                    std::int32_t sampleCount) {
   std::lock_guard<std::mutex> guard(mutex_);
-  audioRequests_.emplace_back(format, sampleCount);
-  Record("audio request");
+  heard_.audioRequests.emplace_back(format, sampleCount);
+  heard_.calls.push_back("audio request");
   if (audioDry_) return nullptr;
   const std::int64_t bytes =
       audioBytes_ >= 0 ? audioBytes_ : std::int64_t{format.channels} * sampleCount * static_cast<std::int64_t>(sizeof(float));
@@ -89,46 +93,26 @@ std::shared_ptr<pm::AudioBuffer> FakeCallbacks::RequestAudioBuffer(const pm::Aud
 
 void FakeCallbacks::UpdateGui(std::string guiJson, std::vector<std::string> widgets) {
   std::lock_guard<std::mutex> guard(mutex_);
-  guis_.push_back(guiJson);
-  Record(widgets.empty() ? "gui" : "gui with widgets");
-}
-
-void FakeCallbacks::UpdateProduction(std::uint32_t produces) {
-  std::lock_guard<std::mutex> guard(mutex_);
-  Record("production " + std::to_string(produces));
-}
-
-void FakeCallbacks::TimestampReset() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  Record("reset");
-}
-
-void FakeCallbacks::UpdateBuildOutDuration(std::int64_t ticks) {
-  std::lock_guard<std::mutex> guard(mutex_);
-  Record("buildout " + std::to_string(ticks));
-}
-
-void FakeCallbacks::UpdatePtzCommandSuite(const std::string& suite, const std::string& model) {
-  std::lock_guard<std::mutex> guard(mutex_);
-  Record("ptz " + suite + "/" + model);
+  heard_.guis.push_back(guiJson);
+  heard_.calls.push_back(widgets.empty() ? "gui" : "gui with widgets");
 }
 
 void FakeCallbacks::SendAudioBuffer(std::int64_t mediaTime, std::shared_ptr<pm::AudioBuffer> buffer) {
   std::lock_guard<std::mutex> guard(mutex_);
-  audioSent_.push_back(std::static_pointer_cast<FakeAudioBuffer>(buffer));
-  Record("audio " + std::to_string(mediaTime));
+  heard_.audioSent.push_back(std::static_pointer_cast<FakeAudioBuffer>(buffer));
+  heard_.calls.push_back("audio " + std::to_string(mediaTime));
 }
 
 void FakeCallbacks::SendVideoBuffer(std::int64_t mediaTime, std::shared_ptr<pm::VideoBuffer> buffer) {
   std::lock_guard<std::mutex> guard(mutex_);
-  videoSent_.push_back(std::static_pointer_cast<FakeVideoBuffer>(buffer));
-  Record("video " + std::to_string(mediaTime));
+  heard_.videoSent.push_back(std::static_pointer_cast<FakeVideoBuffer>(buffer));
+  heard_.calls.push_back("video " + std::to_string(mediaTime));
 }
 
 void FakeCallbacks::UpdateConnectionState(std::int32_t state) {
   std::lock_guard<std::mutex> guard(mutex_);
-  states_.push_back(state);
-  Record("state " + std::to_string(state));
+  heard_.states.push_back(state);
+  heard_.calls.push_back("state " + std::to_string(state));
 }
 
 void FakeCallbacks::SetDry(bool video, bool audio) {
@@ -148,67 +132,30 @@ void FakeCallbacks::OverrideAudioBytes(std::int64_t bytes) {
   audioBytes_ = bytes;
 }
 
-std::vector<std::string> FakeCallbacks::Calls() {
+Heard FakeCallbacks::Seen() {
   std::lock_guard<std::mutex> guard(mutex_);
-  return calls_;
-}
-
-std::vector<std::int32_t> FakeCallbacks::States() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return states_;
-}
-
-std::vector<std::string> FakeCallbacks::Guis() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return guis_;
-}
-
-std::vector<pm::VideoFormat> FakeCallbacks::VideoRequests() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return videoRequests_;
-}
-
-std::vector<std::pair<pm::AudioFormat, std::int32_t>> FakeCallbacks::AudioRequests() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return audioRequests_;
-}
-
-std::vector<std::shared_ptr<FakeVideoBuffer>> FakeCallbacks::VideoSent() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return videoSent_;
-}
-
-std::vector<std::shared_ptr<FakeAudioBuffer>> FakeCallbacks::AudioSent() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return audioSent_;
+  return heard_;
 }
 
 int FakeCallbacks::Count(const std::string& call) {
   std::lock_guard<std::mutex> guard(mutex_);
-  int n = 0;
-  for (const auto& c : calls_) n += c == call;
-  return n;
+  return static_cast<int>(std::count(heard_.calls.begin(), heard_.calls.end(), call));
 }
 
 void FakeDiscoveryCallbacks::SourceAvailable(const pm::SourceInfo& info) {
   std::lock_guard<std::mutex> guard(mutex_);
-  calls_.push_back("+" + info.uniqueId + " " + info.name);
-  infos_.push_back(info);
+  seen_.calls.push_back("+" + info.uniqueId + " " + info.name);
+  seen_.infos.push_back(info);
 }
 
 void FakeDiscoveryCallbacks::SourceUnavailable(const std::string& uniqueId) {
   std::lock_guard<std::mutex> guard(mutex_);
-  calls_.push_back("-" + uniqueId);
+  seen_.calls.push_back("-" + uniqueId);
 }
 
-std::vector<std::string> FakeDiscoveryCallbacks::Calls() {
+Announced FakeDiscoveryCallbacks::Seen() {
   std::lock_guard<std::mutex> guard(mutex_);
-  return calls_;
-}
-
-std::vector<pm::SourceInfo> FakeDiscoveryCallbacks::Infos() {
-  std::lock_guard<std::mutex> guard(mutex_);
-  return infos_;
+  return seen_;
 }
 
 }  // namespace nditest

@@ -62,8 +62,19 @@ class FakeAudioBuffer : public pm::AudioBuffer {
   std::vector<std::uint8_t> memory;
 };
 
-// Records every call, in order, as text ("state 1", "reset", "production 3",
-// "video 1234", "audio 0", "buildout 352800000", "ptz NDI3/Model", "gui").
+// Every call the source made, in order, as text ("state 1", "reset",
+// "production 3", "video 1234", "audio 0", "buildout 352800000",
+// "ptz NDI3/Model", "gui"), and what came with it.
+struct Heard {
+  std::vector<std::string> calls;
+  std::vector<std::int32_t> states;
+  std::vector<std::string> guis;
+  std::vector<pm::VideoFormat> videoRequests;
+  std::vector<std::pair<pm::AudioFormat, std::int32_t>> audioRequests;
+  std::vector<std::shared_ptr<FakeVideoBuffer>> videoSent;
+  std::vector<std::shared_ptr<FakeAudioBuffer>> audioSent;
+};
+
 class FakeCallbacks : public pm::Source::Callbacks {
  public:
   void SetMaxVideoBuffers(std::int32_t) override {}
@@ -74,10 +85,12 @@ class FakeCallbacks : public pm::Source::Callbacks {
   std::shared_ptr<pm::AudioBuffer> RequestAudioBuffer(const pm::AudioFormat& format, std::int32_t sampleCount) override;
   void UpdateConfiguration(const std::string&) override {}
   void UpdateGui(std::string guiJson, std::vector<std::string> widgets) override;
-  void UpdateProduction(std::uint32_t produces) override;
-  void TimestampReset() override;
-  void UpdateBuildOutDuration(std::int64_t ticks) override;
-  void UpdatePtzCommandSuite(const std::string& suite, const std::string& model) override;
+  void UpdateProduction(std::uint32_t produces) override { Note("production " + std::to_string(produces)); }
+  void TimestampReset() override { Note("reset"); }
+  void UpdateBuildOutDuration(std::int64_t ticks) override { Note("buildout " + std::to_string(ticks)); }
+  void UpdatePtzCommandSuite(const std::string& suite, const std::string& model) override {
+    Note("ptz " + suite + "/" + model);
+  }
   std::int64_t CurrentTime() override { return 0; }
   std::int64_t AudioTime(std::int32_t) override { return 0; }
   std::pair<std::int64_t, bool> NextVideoTime(std::uint32_t) override { return {0, false}; }
@@ -92,27 +105,14 @@ class FakeCallbacks : public pm::Source::Callbacks {
   void OverrideVideoFormat(const pm::VideoFormat& format);
   void OverrideAudioBytes(std::int64_t bytes);
 
-  // Records.
-  std::vector<std::string> Calls();
-  std::vector<std::int32_t> States();
-  std::vector<std::string> Guis();
-  std::vector<pm::VideoFormat> VideoRequests();
-  std::vector<std::pair<pm::AudioFormat, std::int32_t>> AudioRequests();
-  std::vector<std::shared_ptr<FakeVideoBuffer>> VideoSent();
-  std::vector<std::shared_ptr<FakeAudioBuffer>> AudioSent();
+  Heard Seen();
   int Count(const std::string& call);
 
  private:
-  void Record(std::string call);
+  void Note(std::string call);
 
   std::mutex mutex_;  // guards everything below
-  std::vector<std::string> calls_;
-  std::vector<std::int32_t> states_;
-  std::vector<std::string> guis_;
-  std::vector<pm::VideoFormat> videoRequests_;
-  std::vector<std::pair<pm::AudioFormat, std::int32_t>> audioRequests_;
-  std::vector<std::shared_ptr<FakeVideoBuffer>> videoSent_;
-  std::vector<std::shared_ptr<FakeAudioBuffer>> audioSent_;
+  Heard heard_;
   bool videoDry_ = false;
   bool audioDry_ = false;
   bool overrideVideo_ = false;
@@ -120,18 +120,21 @@ class FakeCallbacks : public pm::Source::Callbacks {
   std::int64_t audioBytes_ = -1;
 };
 
-// Records discovery announcements in order: "+id name", "-id".
+// Discovery announcements in order ("+id name", "-id") and the infos given.
+struct Announced {
+  std::vector<std::string> calls;
+  std::vector<pm::SourceInfo> infos;
+};
+
 class FakeDiscoveryCallbacks : public pm::SourceDiscovery::Callbacks {
  public:
   void SourceAvailable(const pm::SourceInfo& info) override;
   void SourceUnavailable(const std::string& uniqueId) override;
-  std::vector<std::string> Calls();
-  std::vector<pm::SourceInfo> Infos();
+  Announced Seen();
 
  private:
-  std::mutex mutex_;  // guards calls_ and infos_
-  std::vector<std::string> calls_;
-  std::vector<pm::SourceInfo> infos_;
+  std::mutex mutex_;  // guards seen_
+  Announced seen_;
 };
 
 }  // namespace nditest

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <functional>
 #include <limits>
 
 #include "fakes.h"
@@ -49,99 +50,77 @@ class IntakeTest : public ::testing::Test {
   }
 };
 
-TEST_F(IntakeTest, UyvyFrameIsRequestedAs2vuyAndCopiedRowByRow) {
-  // Stride wider than a row: the padding must not end up in the buffer.
-  auto frame = VideoCapture(kNdiFourCCUYVY, 64, 8, 160);
-  MediaInfo info;
-  ASSERT_TRUE(Video(frame, &info));
-  ASSERT_EQ(callbacks->VideoRequests().size(), 1u);
-  const Requested r = Read(callbacks->VideoRequests()[0]);
-  EXPECT_EQ(r.code, 0x32767579u);
-  EXPECT_EQ(r.width, 64);
-  EXPECT_EQ(r.height, 8);
-  EXPECT_EQ(r.byteSize, 0u);
-  EXPECT_EQ(r.field, 0);
-  EXPECT_EQ(r.scan, 'P');
-  EXPECT_EQ(r.extras, 0);
-  const auto sent = callbacks->VideoSent();
-  ASSERT_EQ(sent.size(), 1u);
-  EXPECT_EQ(sent[0]->copiedStride, 160);
-  for (int row = 0; row < 8; ++row) {
-    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 128, frame->bytes.data() + row * 160, 128)) << row;
-  }
-  EXPECT_EQ(info, (MediaInfo{64, 8, 30000, 1001, 0, 0}));
-}
-
-TEST_F(IntakeTest, EachAcceptedFourCCMapsToItsHostCode) {
+// Each accepted FourCC is asked for as its host code, with the scan of the
+// frame, and copied row by row (NV12's chroma rows too) from the frame's
+// stride: padding past a row never ends up in the buffer.
+TEST_F(IntakeTest, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
   struct Case {
-    std::uint32_t fourcc;
-    std::uint32_t code;
+    std::uint32_t fourcc, code;
     int stride;
+    bool progressive;
+    int rows, rowBytes;
+  } cases[] = {
+      {kNdiFourCCUYVY, 0x32767579u /* '2vuy' */, 40, true, 4, 32},
+      {kNdiFourCCUYVA, pm::kCode2vuy, 32, false, 4, 32},
+      {kNdiFourCCNV12, pm::kCodeNV12, 24, true, 6, 16},
+      {kNdiFourCCBGRA, pm::kCodeRgba, 72, false, 4, 64},
   };
-  for (const Case& c : {Case{kNdiFourCCUYVA, pm::kCode2vuy, 32}, Case{kNdiFourCCNV12, pm::kCodeNV12, 16},
-                        Case{kNdiFourCCBGRA, pm::kCodeRgba, 64}}) {
-    ASSERT_TRUE(Video(VideoCapture(c.fourcc, 16, 4, c.stride, 0, /*progressive=*/false)));
-    EXPECT_EQ(Read(callbacks->VideoRequests().back()).code, c.code);
-    EXPECT_EQ(Read(callbacks->VideoRequests().back()).scan, 'U');
-  }
-}
-
-TEST_F(IntakeTest, Nv12CopiesLumaAndChromaWithTheFrameStride) {
-  auto frame = VideoCapture(kNdiFourCCNV12, 16, 4, 24);
-  ASSERT_TRUE(Video(frame));
-  const auto sent = callbacks->VideoSent();
-  ASSERT_EQ(sent.size(), 1u);
-  for (int row = 0; row < 6; ++row) {  // 4 luma rows, 2 chroma rows
-    ASSERT_EQ(0, std::memcmp(sent[0]->memory.data() + row * 16, frame->bytes.data() + row * 24, 16)) << row;
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.fourcc);
+    auto frame = VideoCapture(c.fourcc, 16, 4, c.stride, 0, c.progressive);
+    MediaInfo info;
+    ASSERT_TRUE(Video(frame, &info));
+    const Requested r = Read(callbacks->Seen().videoRequests.back());
+    EXPECT_EQ(r.code, c.code);
+    EXPECT_EQ(r.width, 16);
+    EXPECT_EQ(r.height, 4);
+    EXPECT_EQ(r.byteSize, 0u);
+    EXPECT_EQ(r.field, 0);
+    EXPECT_EQ(r.scan, c.progressive ? 'P' : 'U');
+    EXPECT_EQ(r.extras, 0);
+    const auto sent = callbacks->Seen().videoSent.back();
+    EXPECT_EQ(sent->copiedStride, c.stride);
+    for (int row = 0; row < c.rows; ++row) {
+      ASSERT_EQ(0, std::memcmp(sent->memory.data() + row * c.rowBytes, frame->bytes.data() + row * c.stride,
+                               static_cast<std::size_t>(c.rowBytes)))
+          << row;
+    }
+    EXPECT_EQ(info, (MediaInfo{16, 4, 30000, 1001, 0, 0}));
   }
 }
 
 TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
+  // A good 16x4 UYVY frame at stride 32, spoilt one way.
+  const auto spoilt = [](const std::function<void(ndi_video_frame_v2&)>& spoil) {
+    auto capture = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
+    spoil(capture->video);
+    return capture;
+  };
   struct Case {
     std::shared_ptr<nditest::Capture> frame;
     const char* line;
   };
-  auto nullData = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  nullData->video.data = nullptr;
-  auto zeroStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  zeroStride->video.line_stride_in_bytes = 0;
-  auto negativeStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  negativeStride->video.line_stride_in_bytes = -32;
-  auto shortStride = VideoCapture(kNdiFourCCUYVY, 16, 4, 31);     // a row is 32 bytes
-  auto shortNv12 = VideoCapture(kNdiFourCCNV12, 16, 4, 15);       // a row is 16 bytes
-  auto shortBgra = VideoCapture(kNdiFourCCBGRA, 16, 4, 63);       // a row is 64 bytes
-  auto zeroWidth = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  zeroWidth->video.xres = 0;
-  auto negativeHeight = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  negativeHeight->video.yres = -4;
-  auto wide = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  wide->video.xres = 32768;
-  auto tall = VideoCapture(kNdiFourCCUYVY, 16, 4, 32);
-  tall->video.yres = 40000;
-  auto i420 = VideoCapture(kNdiFourCCI420, 16, 4, 16);
-  auto unknown = VideoCapture(0x12345678, 16, 4, 32);
-
   const Case cases[] = {
-      {nullData, "#ndisource: null data in NDI video frame\n"},
-      {zeroStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {negativeStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortStride, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortNv12, "#ndisource: invalid stride in NDI video frame\n"},
-      {shortBgra, "#ndisource: invalid stride in NDI video frame\n"},
-      {zeroWidth, "#ndisource: invalid resolution in NDI video frame\n"},
-      {negativeHeight, "#ndisource: invalid resolution in NDI video frame\n"},
-      {wide, "#ndisource: NDI video frame too large (32768x4)\n"},
-      {tall, "#ndisource: NDI video frame too large (16x40000)\n"},
-      {i420, "#ndisource: unexpected raster format\n"},
-      {unknown, "#ndisource: unexpected raster format\n"},
+      {spoilt([](auto& v) { v.data = nullptr; }), "#ndisource: null data in NDI video frame\n"},
+      {spoilt([](auto& v) { v.line_stride_in_bytes = 0; }), "#ndisource: invalid stride in NDI video frame\n"},
+      {spoilt([](auto& v) { v.line_stride_in_bytes = -32; }), "#ndisource: invalid stride in NDI video frame\n"},
+      {VideoCapture(kNdiFourCCUYVY, 16, 4, 31), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 32
+      {VideoCapture(kNdiFourCCNV12, 16, 4, 15), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 16
+      {VideoCapture(kNdiFourCCBGRA, 16, 4, 63), "#ndisource: invalid stride in NDI video frame\n"},  // rows of 64
+      {spoilt([](auto& v) { v.xres = 0; }), "#ndisource: invalid resolution in NDI video frame\n"},
+      {spoilt([](auto& v) { v.yres = -4; }), "#ndisource: invalid resolution in NDI video frame\n"},
+      {spoilt([](auto& v) { v.xres = 32768; }), "#ndisource: NDI video frame too large (32768x4)\n"},
+      {spoilt([](auto& v) { v.yres = 40000; }), "#ndisource: NDI video frame too large (16x40000)\n"},
+      {VideoCapture(kNdiFourCCI420, 16, 4, 16), "#ndisource: unexpected raster format\n"},
+      {VideoCapture(0x12345678, 16, 4, 32), "#ndisource: unexpected raster format\n"},
   };
   for (const Case& c : cases) {
     logs.Clear();
     EXPECT_FALSE(Video(c.frame)) << c.line;
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
   }
-  EXPECT_TRUE(callbacks->VideoRequests().empty());
-  EXPECT_TRUE(callbacks->Calls().empty());
+  EXPECT_TRUE(callbacks->Seen().videoRequests.empty());
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
   // The source still takes good frames.
   EXPECT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
 }
@@ -149,7 +128,7 @@ TEST_F(IntakeTest, BadVideoFramesAreDroppedWithTheirLineAndNoBufferRequested) {
 TEST_F(IntakeTest, LargestDescribableFrameIsTaken) {
   auto frame = VideoCapture(kNdiFourCCNV12, 32767, 1, 32767);
   ASSERT_TRUE(Video(frame));
-  EXPECT_EQ(Read(callbacks->VideoRequests().back()).width, 32767);
+  EXPECT_EQ(Read(callbacks->Seen().videoRequests.back()).width, 32767);
 }
 
 TEST_F(IntakeTest, VideoWellRanDryLosesOnlyThatFrame) {
@@ -167,7 +146,7 @@ TEST_F(IntakeTest, BufferOfAnotherFormatIsNotCopiedInto) {
   bigger.height = 1080;
   callbacks->OverrideVideoFormat(bigger);
   EXPECT_FALSE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32)));
-  EXPECT_TRUE(callbacks->VideoSent().empty());
+  EXPECT_TRUE(callbacks->Seen().videoSent.empty());
 }
 
 TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
@@ -183,13 +162,13 @@ TEST_F(IntakeTest, NoCallbacksDropsFramesWithTheirLines) {
 TEST_F(IntakeTest, StereoAudioIsInterleavedIntoTheHostBuffer) {
   MediaInfo info;
   ASSERT_TRUE(Audio(AudioCapture(48000, 2, 1600), &info));
-  const auto requests = callbacks->AudioRequests();
+  const auto requests = callbacks->Seen().audioRequests;
   ASSERT_EQ(requests.size(), 1u);
   EXPECT_EQ(requests[0].first.code, 0x666C3332u);
   EXPECT_EQ(requests[0].first.sampleRate, 48000u);
   EXPECT_EQ(requests[0].first.channels, 2);
   EXPECT_EQ(requests[0].second, 1600);
-  const auto samples = callbacks->AudioSent().at(0)->Samples();
+  const auto samples = callbacks->Seen().audioSent.at(0)->Samples();
   ASSERT_EQ(samples.size(), 3200u);
   EXPECT_EQ(samples[0], 0.0f);     // channel 0, sample 0
   EXPECT_EQ(samples[1], 1000.0f);  // channel 1, sample 0
@@ -218,7 +197,7 @@ TEST_F(IntakeTest, BadAudioFramesAreDroppedWithTheirLine) {
     EXPECT_FALSE(Audio(c.frame)) << c.line;
     EXPECT_EQ(logs.Lines(), std::vector<std::string>{c.line});
   }
-  EXPECT_TRUE(callbacks->AudioRequests().empty());
+  EXPECT_TRUE(callbacks->Seen().audioRequests.empty());
   EXPECT_TRUE(Audio(AudioCapture(48000, 127, 4)));
 }
 
@@ -248,10 +227,10 @@ TEST_F(IntakeTest, SoundOfTooManyChannelsIsToldOnceAndNamedOnThePanel) {
   for (const Case& c : cases) {
     SCOPED_TRACE(c.channels);
     logs.Clear();
-    const std::size_t requested = callbacks->AudioRequests().size();
+    const std::size_t requested = callbacks->Seen().audioRequests.size();
     MediaInfo info;
     for (int frame = 0; frame < 5; ++frame) EXPECT_EQ(Audio(AudioCapture(48000, c.channels, 4), &info), c.lines.empty());
-    EXPECT_EQ(callbacks->AudioRequests().size() - requested, c.lines.empty() ? 5u : 0u);
+    EXPECT_EQ(callbacks->Seen().audioRequests.size() - requested, c.lines.empty() ? 5u : 0u);
     EXPECT_EQ(logs.Lines(), c.lines);
     EXPECT_EQ(TaskNDISource::AudioStatusText(info), c.status);
   }
@@ -261,7 +240,7 @@ TEST_F(IntakeTest, AudioBufferSmallerThanTheFrameIsNotWrittenPast) {
   callbacks->OverrideAudioBytes(2 * 16 * 4 - 1);
   EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
   EXPECT_TRUE(logs.Contains("#ndisource: audio buffer too small for the NDI audio frame\n"));
-  EXPECT_TRUE(callbacks->AudioSent().empty());
+  EXPECT_TRUE(callbacks->Seen().audioSent.empty());
   callbacks->SetDry(false, true);
   EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
   EXPECT_TRUE(logs.Contains("#ndisource: audio well ran dry\n"));
@@ -276,7 +255,7 @@ TEST_F(IntakeTest, TimestampsCountFromTheOldestFrameAcrossAudioAndVideo) {
   // Audio older than every video frame: new base for both, host clock reset.
   ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 40'000'000)));
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 40'000'001)));
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{
                                     "video request", "reset", "production 1", "video 0",
                                     "video request", "video 705600000",
                                     "audio request", "production 3", "audio 352800000",
@@ -291,7 +270,7 @@ TEST_F(IntakeTest, NewBaseOfADroppedFrameResetsTheHostWithTheNextDeliveredFrame)
   EXPECT_FALSE(Video(VideoCapture(kNdiFourCCI420, 16, 4, 16, 10'000'000)));  // takes the base, no reset yet
   EXPECT_EQ(callbacks->Count("reset"), 1);
   ASSERT_TRUE(Audio(AudioCapture(48000, 1, 16, 20'000'000)));
-  const auto calls = callbacks->Calls();
+  const auto calls = callbacks->Seen().calls;
   EXPECT_EQ(std::vector<std::string>(calls.end() - 4, calls.end()),
             (std::vector<std::string>{"audio request", "reset", "production 3", "audio 705600000"}));
 }
@@ -322,7 +301,7 @@ TEST(TicksFrom100ns, ConvertsExactlyAndSaturatesInsteadOfOverflowing) {
 TEST_F(IntakeTest, TimestampsFarApartDoNotOverflow) {
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::min() + 1)));
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, std::numeric_limits<std::int64_t>::max())));
-  EXPECT_EQ(callbacks->Calls().back(), "video " + std::to_string(std::numeric_limits<std::int64_t>::max()));
+  EXPECT_EQ(callbacks->Seen().calls.back(), "video " + std::to_string(std::numeric_limits<std::int64_t>::max()));
 }
 
 }  // namespace

@@ -30,10 +30,10 @@ class MetadataTest : public ::testing::Test {
 
   std::vector<std::string> Ptz(std::vector<nlohmann::json> commands) {
     std::deque<nlohmann::json> queue(commands.begin(), commands.end());
-    const std::size_t before = ndi.PtzCalls().size();
+    const std::size_t before = ndi.Seen().ptzCalls.size();
     source->RunPtzCommands(kReceiver, queue);
     EXPECT_TRUE(queue.empty());
-    const auto calls = ndi.PtzCalls();
+    const auto calls = ndi.Seen().ptzCalls;
     return std::vector<std::string>(calls.begin() + static_cast<std::ptrdiff_t>(before), calls.end());
   }
 
@@ -48,12 +48,12 @@ TEST_F(MetadataTest, ShotEventIsPrintedIndentedWithItsTerminatingZeroCounted) {
   std::deque<ShotEvent> queue{ShotEvent{"X", 1, 0}, ShotEvent{"a\"b<&>", 0, 1}};
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  const auto sent = ndi.MetadataSent();
+  const auto sent = ndi.Seen().metadataSent;
   ASSERT_EQ(sent.size(), 2u);
   EXPECT_EQ(sent[0], "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[1],
             "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n</skyrelay_ext>\n");
-  EXPECT_EQ(ndi.MetadataLengths()[0], static_cast<int>(sent[0].size()) + 1);
+  EXPECT_EQ(ndi.Seen().metadataLengths[0], static_cast<int>(sent[0].size()) + 1);
 }
 
 TEST_F(MetadataTest, UnsentShotEventStaysFirstForTheNextPass) {
@@ -62,13 +62,13 @@ TEST_F(MetadataTest, UnsentShotEventStaysFirstForTheNextPass) {
   source->SendShotEvents(kReceiver, queue);
   ASSERT_EQ(queue.size(), 2u);
   EXPECT_EQ(queue.front().name, "one");
-  EXPECT_EQ(ndi.MetadataLengths().size(), 1u);  // stopped at the first failure
+  EXPECT_EQ(ndi.Seen().metadataLengths.size(), 1u);  // stopped at the first failure
   ndi.SetMetadataResult(true);
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  ASSERT_EQ(ndi.MetadataSent().size(), 2u);
-  EXPECT_NE(ndi.MetadataSent()[0].find("\"one\""), std::string::npos);
-  EXPECT_NE(ndi.MetadataSent()[1].find("\"two\""), std::string::npos);
+  ASSERT_EQ(ndi.Seen().metadataSent.size(), 2u);
+  EXPECT_NE(ndi.Seen().metadataSent[0].find("\"one\""), std::string::npos);
+  EXPECT_NE(ndi.Seen().metadataSent[1].find("\"two\""), std::string::npos);
 }
 
 TEST_F(MetadataTest, EveryPtzCommandReachesItsCallWithItsParameters) {
@@ -144,54 +144,56 @@ TEST_F(MetadataTest, ModelNameIsLoggedWhenItChanges) {
   EXPECT_EQ(logs.Count("NDI source model name"), 2);
 }
 
-TEST_F(MetadataTest, BuildOutDurationIsReportedInTicks) {
-  Metadata("<metadata><buildOutDuration>0.5</buildOutDuration></metadata>");
-  Metadata("<skyrelay_ext>\n  <other/>\n  <buildOutDuration> 2 </buildOutDuration></skyrelay_ext>");
-  Metadata("<other><buildOutDuration>0.5</buildOutDuration></other>");
-  Metadata("<metadata><buildOutDuration>soon</buildOutDuration></metadata>");
-  Metadata("<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>");
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"buildout 352800000", "buildout 1411200000"}));
-  EXPECT_TRUE(logs.Lines().empty());
-}
-
-TEST_F(MetadataTest, BuildOutDurationWithoutATickCountIsDropped) {
-  Metadata("<metadata><buildOutDuration>1e300</buildOutDuration></metadata>");
-  Metadata("<metadata><buildOutDuration>nan</buildOutDuration></metadata>");
-  Metadata("<metadata><buildOutDuration>-inf</buildOutDuration></metadata>");
-  EXPECT_TRUE(callbacks->Calls().empty());
-  EXPECT_EQ(logs.Count("#ndisource: invalid buildOutDuration in NDI metadata frame\n"), 3);
-}
-
-TEST_F(MetadataTest, BadMetadataFramesAreDroppedWithTheirLine) {
-  ndi_metadata_frame frame{};
-  frame.length = 0;
-  frame.data = const_cast<char*>("<a/>");
-  source->ProcessMetadataFrame(frame);
-  frame.length = -5;
-  source->ProcessMetadataFrame(frame);
-  frame.length = 5;
-  frame.data = nullptr;
-  source->ProcessMetadataFrame(frame);
-  Metadata("");
-  Metadata("not xml at all");
-  Metadata("<metadata><buildOutDuration>0.5</metadata>");
-  Metadata("<!-- only a comment -->");
-  Metadata(std::string(1 << 20, '<'));
+// One frame each on a fresh source: what reaches the host and what is logged.
+TEST_F(MetadataTest, FramesAreReadAsTheirXmlSays) {
+  const std::string parseFailed = "#ndisource: failed to parse metadata frame\n";
+  const std::string invalidBuildOut = "#ndisource: invalid buildOutDuration in NDI metadata frame\n";
   std::string deep;
   for (int i = 0; i < 10000; ++i) deep += "<a>";
-  Metadata(deep);
-  EXPECT_EQ(logs.Lines(), (std::vector<std::string>{
-                              "#ndisource: invalid length in NDI metadata frame\n",
-                              "#ndisource: invalid length in NDI metadata frame\n",
-                              "#ndisource: null data in NDI metadata frame\n",
-                              "#ndisource: failed to parse metadata frame\n",
-                              "#ndisource: failed to parse metadata frame\n",
-                              "#ndisource: failed to parse metadata frame\n",
-                              "#ndisource: metadata frame has no root element\n",
-                              "#ndisource: failed to parse metadata frame\n",
-                              "#ndisource: failed to parse metadata frame\n",
-                          }));
-  EXPECT_TRUE(callbacks->Calls().empty());
+  struct Case {
+    std::string text;
+    std::vector<std::string> calls;
+    std::vector<std::string> log;
+  } cases[] = {
+      {"<metadata><buildOutDuration>0.5</buildOutDuration></metadata>", {"buildout 352800000"}, {}},
+      {"<skyrelay_ext>\n  <other/>\n  <buildOutDuration> 2 </buildOutDuration></skyrelay_ext>",
+       {"buildout 1411200000"}, {}},
+      {"<other><buildOutDuration>0.5</buildOutDuration></other>", {}, {}},
+      {"<metadata><buildOutDuration>soon</buildOutDuration></metadata>", {}, {}},
+      {"<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>", {}, {}},
+      {"<metadata><buildOutDuration>1e300</buildOutDuration></metadata>", {}, {invalidBuildOut}},
+      {"<metadata><buildOutDuration>nan</buildOutDuration></metadata>", {}, {invalidBuildOut}},
+      {"<metadata><buildOutDuration>-inf</buildOutDuration></metadata>", {}, {invalidBuildOut}},
+      {"", {}, {parseFailed}},
+      {"not xml at all", {}, {parseFailed}},
+      {"<metadata><buildOutDuration>0.5</metadata>", {}, {parseFailed}},
+      {"<!-- only a comment -->", {}, {"#ndisource: metadata frame has no root element\n"}},
+      {std::string(1 << 20, '<'), {}, {parseFailed}},
+      {deep, {}, {parseFailed}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.text.substr(0, 80));
+    auto fresh = std::make_shared<nditest::FakeCallbacks>();
+    NDISource one(fresh, kId, ndi.Api(), env.Make());
+    logs.Clear();
+    one.ProcessMetadataFrame(nditest::MetadataCapture(c.text)->metadata);
+    EXPECT_EQ(fresh->Seen().calls, c.calls);
+    EXPECT_EQ(logs.Lines(), c.log);
+  }
+}
+
+TEST_F(MetadataTest, FramesWithoutUsableDataAreDroppedWithTheirLine) {
+  const std::pair<ndi_metadata_frame, const char*> cases[] = {
+      {{0, 0, const_cast<char*>("<a/>")}, "#ndisource: invalid length in NDI metadata frame\n"},
+      {{-5, 0, const_cast<char*>("<a/>")}, "#ndisource: invalid length in NDI metadata frame\n"},
+      {{5, 0, nullptr}, "#ndisource: null data in NDI metadata frame\n"},
+  };
+  for (const auto& [frame, line] : cases) {
+    logs.Clear();
+    source->ProcessMetadataFrame(frame);
+    EXPECT_EQ(logs.Lines(), std::vector<std::string>{line});
+  }
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
 }
 
 TEST_F(MetadataTest, MetadataIsReadOnlyWithinItsLength) {
@@ -208,7 +210,7 @@ TEST_F(MetadataTest, MetadataIsReadOnlyWithinItsLength) {
   withZero += "garbage that is not XML";
   ndi_metadata_frame early{static_cast<int>(withZero.size()), 0, withZero.data()};
   source->ProcessMetadataFrame(early);
-  EXPECT_EQ(callbacks->Calls(), std::vector<std::string>{"buildout 705600000"});
+  EXPECT_EQ(callbacks->Seen().calls, std::vector<std::string>{"buildout 705600000"});
   EXPECT_EQ(source->ModelName(), "A");
 }
 
@@ -218,7 +220,7 @@ TEST_F(MetadataTest, PtzSupportIsReportedWithTheModelName) {
   source->ReportPtzSupport(kReceiver);
   ndi.SetPtzSupported(false);
   source->ReportPtzSupport(kReceiver);
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"ptz NDI3/Model X", "ptz /"}));
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/Model X", "ptz /"}));
   EXPECT_TRUE(logs.Contains("#ndisource: NDICaptureDevice~STUDIO (Cam 1) supports PTZ\n"));
 }
 
@@ -231,7 +233,7 @@ TEST_F(MetadataTest, AModelNameArrivingAfterPtzSupportIsReportedAgain) {
   ndi.SetPtzSupported(false);
   source->ReportPtzSupport(kReceiver);
   Metadata(R"(<ndi_product model_name="Model Z"/>)");
-  EXPECT_EQ(callbacks->Calls(), (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
+  EXPECT_EQ(callbacks->Seen().calls, (std::vector<std::string>{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /"}));
 }
 
 // Through the receiver loop: tally, shot events and PTZ commands reach the
@@ -249,15 +251,15 @@ class MetadataLoopTest : public MetadataTest {
 TEST_F(MetadataLoopTest, TallyChangesBetweenTwoPassesAreSentAsOne) {
   StartReceiving();
   ndi.BlockCapture(true);
-  const int captures = ndi.Captures();
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Captures() > captures; }));
-  const std::size_t before = ndi.Tallies().size();
+  const int captures = ndi.Seen().captures;
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures; }));
+  const std::size_t before = ndi.Seen().tallies.size();
   source->HandleShotEvent("TALLY_LIVE_ON");
   source->HandleShotEvent("TALLY_PREVIEW_ON");
   ndi.BlockCapture(false);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Tallies().size() > before; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Captures() > captures + 2; }));
-  const auto tallies = ndi.Tallies();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().tallies.size() > before; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().captures > captures + 2; }));
+  const auto tallies = ndi.Seen().tallies;
   ASSERT_EQ(tallies.size(), before + 1);
   EXPECT_TRUE(tallies.back().on_program);
   EXPECT_TRUE(tallies.back().on_preview);
@@ -265,7 +267,7 @@ TEST_F(MetadataLoopTest, TallyChangesBetweenTwoPassesAreSentAsOne) {
 
 TEST_F(MetadataLoopTest, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
   source->HandleShotEvent("Cut before start");
-  StartReceiving();  // Start emptied the queue
+  StartReceiving();  // Start empties the queue: the event above is never sent
   source->HandleShotEvent("TALLY_PREVIEW_ON");
   source->HandleShotEvent(" TALLY_LIVE_ON");  // not a tally command
   source->HandleShotEvent("TALLY_LIVE_ON ");
@@ -273,40 +275,32 @@ TEST_F(MetadataLoopTest, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
   // The loop may take the events in more than one batch; each batch goes
   // out after a delivered frame.
   for (int i = 0; i < 3; ++i) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.MetadataSent().size() >= 5; }));
-  const auto sent = ndi.MetadataSent();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().metadataSent.size() >= 5; }));
+  const auto sent = ndi.Seen().metadataSent;
   ASSERT_EQ(sent.size(), 5u);
   EXPECT_EQ(sent[2], "<skyrelay_ext>\n    <event value=\" TALLY_LIVE_ON\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[3], "<skyrelay_ext>\n    <event value=\"TALLY_LIVE_ON \" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
   EXPECT_EQ(sent[4], "<skyrelay_ext>\n    <event value=\"Cut\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n");
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Tallies().empty() && ndi.Tallies().back().on_preview; }));
-  EXPECT_FALSE(ndi.Tallies().back().on_program);
-}
-
-TEST_F(MetadataLoopTest, QueuedEventsBeforeStartAreDropped) {
-  source->HandleShotEvent("Cut");
-  StartReceiving();
-  ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.CapturesQueued() == 0 && ndi.Captures() > 3; }));
-  EXPECT_EQ(ndi.MetadataSent().size(), 2u);  // only the receiver's own documents
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; }));
+  EXPECT_FALSE(ndi.Seen().tallies.back().on_program);
 }
 
 TEST_F(MetadataLoopTest, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.1}});
   StartReceiving();
   ndi.SetConnections(0);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->States() == std::vector<std::int32_t>{1, 2, 3}; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Seen().states == std::vector<std::int32_t>{1, 2, 3}; }));
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.5}});
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
-  EXPECT_TRUE(ndi.PtzCalls().empty());
+  EXPECT_TRUE(ndi.Seen().ptzCalls.empty());
   ndi.SetConnections(1);
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
   env.clock->AdvanceMs(5000);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.PtzCalls().empty(); }));
-  EXPECT_EQ(ndi.PtzCalls(), std::vector<std::string>{"zoom(0.5)"});
+  ASSERT_TRUE(pmtest::WaitFor([&] { return !ndi.Seen().ptzCalls.empty(); }));
+  EXPECT_EQ(ndi.Seen().ptzCalls, std::vector<std::string>{"zoom(0.5)"});
   source->Stop();
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.9}});
-  EXPECT_EQ(ndi.PtzCalls().size(), 1u);
+  EXPECT_EQ(ndi.Seen().ptzCalls.size(), 1u);
 }
 
 TEST_F(MetadataLoopTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
@@ -316,11 +310,11 @@ TEST_F(MetadataLoopTest, StatusChangeAndMetadataFramesAreHandledAndFreed) {
   ndi.Push(nditest::TypeOnly(kNdiFrameError));
   StartReceiving();  // the metadata frame counts as delivered
   ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Count("ptz NDI3/Cam") == 1; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.CapturesQueued() == 0; }));
+  ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().queued == 0; }));
   source->Stop();
-  EXPECT_EQ(ndi.MetadataFrees(), 1);
-  EXPECT_EQ(ndi.VideoFrees(), 1);
-  EXPECT_TRUE(ndi.FreesMatched());
+  EXPECT_EQ(ndi.Seen().frees[2], 1);
+  EXPECT_EQ(ndi.Seen().frees[0], 1);
+  EXPECT_TRUE(ndi.Seen().freesMatched);
 }
 
 }  // namespace

@@ -34,6 +34,11 @@ class LoopTest : public ::testing::Test {
   void Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5), std::function<void()> onExit = nullptr) {
     source = std::make_shared<NDISource>(callbacks, kId, ndi.Api(), env.Make(stopTimeout, std::move(onExit)));
   }
+  // Makes the source and starts its loop.
+  void Run() {
+    Make();
+    source->Start();
+  }
 
   // Waits (real time) until `done` holds.
   static void Until(const std::function<bool()>& done) { ASSERT_TRUE(pmtest::WaitFor(done)); }
@@ -43,7 +48,7 @@ class LoopTest : public ::testing::Test {
   }
 
   void UntilStates(std::vector<std::int32_t> states) {
-    Until([&] { return callbacks->States() == states; });
+    Until([&] { return callbacks->Seen().states == states; });
   }
 
   pmtest::LogCapture logs;
@@ -54,8 +59,7 @@ class LoopTest : public ::testing::Test {
 };
 
 TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
-  Make();
-  source->Start();
+  Run();
   for (int attempt = 1; attempt <= 130; ++attempt) {
     ASSERT_EQ(env.clock->AwaitWait(attempt), 250) << attempt;
     ASSERT_EQ(logs.Count("#ndisource: waiting for source to be found\n"), attempt);
@@ -63,23 +67,22 @@ TEST_F(LoopTest, SenderNeverFoundKeepsConnectingAndLogsEvery250Ms) {
   }
   ASSERT_EQ(env.clock->AwaitWait(131), 250);
   EXPECT_EQ(source->State(), ReceiverState::Connecting);
-  EXPECT_EQ(callbacks->States(), std::vector<std::int32_t>{1});
-  EXPECT_TRUE(ndi.ReceiversCreated().empty());
-  EXPECT_EQ(ndi.FindersCreated(), 1);  // one finder for the whole loop
+  EXPECT_EQ(callbacks->Seen().states, std::vector<std::int32_t>{1});
+  EXPECT_TRUE(ndi.Seen().receivers.empty());
+  EXPECT_EQ(ndi.Seen().findersCreated, 1);  // one finder for the whole loop
   source->Stop();
   EXPECT_EQ(source->State(), ReceiverState::None);
-  EXPECT_EQ(ndi.FindersDestroyed(), 1);
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
   EXPECT_EQ(*env.exits, 0);
 }
 
 TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
   ndi.SetSources({Entry{kName, ""}});
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
   EXPECT_TRUE(logs.Contains("#ndisource: source has no url\n"));
   EXPECT_EQ(source->State(), ReceiverState::Error);
-  const std::string gui = callbacks->Guis().back();
+  const std::string gui = callbacks->Seen().guis.back();
   EXPECT_NE(gui.find("\"indication\":101"), std::string::npos) << gui;
   EXPECT_NE(gui.find("taskvistafeed_status_error"), std::string::npos) << gui;
   // The sender comes back with a URL: Error is left only by a reconnect.
@@ -87,8 +90,8 @@ TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
   env.clock->AdvanceMs(5000);
   ASSERT_EQ(env.clock->AwaitWait(2), 5000);
   EXPECT_EQ(source->State(), ReceiverState::Error);
-  EXPECT_TRUE(ndi.ReceiversCreated().empty());
-  for (std::int32_t state : callbacks->States()) EXPECT_NE(state, 4);
+  EXPECT_TRUE(ndi.Seen().receivers.empty());
+  for (std::int32_t state : callbacks->Seen().states) EXPECT_NE(state, 4);
   source->ExecuteCustomActionCommand("taskndisource::reconnect");
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
   UntilState(ReceiverState::Receiving);
@@ -97,10 +100,9 @@ TEST_F(LoopTest, SenderListedWithoutUrlGoesToErrorAndStays) {
 TEST_F(LoopTest, FirstOfTwoSendersWithOneNameIsUsed) {
   ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{std::nullopt, "10.0.0.2:1"}, Entry{kName, kUrl},
                   Entry{kName, "10.0.0.3:1"}});
-  Make();
-  source->Start();
-  Until([&] { return !ndi.ReceiversCreated().empty(); });
-  const auto created = ndi.ReceiversCreated().at(0);
+  Run();
+  Until([&] { return !ndi.Seen().receivers.empty(); });
+  const auto created = ndi.Seen().receivers.at(0);
   EXPECT_EQ(created.name, kName);
   EXPECT_EQ(created.url, kUrl);
   EXPECT_EQ(created.colorFormat, 1);
@@ -110,8 +112,7 @@ TEST_F(LoopTest, FirstOfTwoSendersWithOneNameIsUsed) {
 
 TEST_F(LoopTest, FailingFinderOrReceiverGoesToError) {
   ndi.FailFinderCreate(true);
-  Make();
-  source->Start();
+  Run();
   UntilState(ReceiverState::Error);
   EXPECT_TRUE(logs.Contains("#ndisource: failed to create NDI finder\n"));
   source->Stop();
@@ -131,38 +132,37 @@ TEST_F(LoopTest, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) 
   source->HandleShotEvent("TALLY_LIVE_ON");
   source->Start();
   UntilStates({1, 2});
-  const auto sent = ndi.MetadataSent();
+  const auto sent = ndi.Seen().metadataSent;
   ASSERT_GE(sent.size(), 2u);
   EXPECT_EQ(sent[0],
             "<metadata>\n    <receiver_info name=\"Skyrelay\" vendor=\"Quillfront LLC\" protocol_version=\"1\"/>\n"
             "</metadata>\n");
   EXPECT_EQ(sent[1], "<metadata>\n    <media_settings width=\"1280\" height=\"720\" framerate=\"1\"/>\n</metadata>\n");
-  EXPECT_EQ(ndi.MetadataLengths()[0], static_cast<int>(sent[0].size()) + 1);
-  ASSERT_FALSE(ndi.Tallies().empty());
-  EXPECT_TRUE(ndi.Tallies()[0].on_program);
-  EXPECT_FALSE(ndi.Tallies()[0].on_preview);
+  EXPECT_EQ(ndi.Seen().metadataLengths[0], static_cast<int>(sent[0].size()) + 1);
+  ASSERT_FALSE(ndi.Seen().tallies.empty());
+  EXPECT_TRUE(ndi.Seen().tallies[0].on_program);
+  EXPECT_FALSE(ndi.Seen().tallies[0].on_preview);
   // One panel for Connecting, one for Receiving with the media format.
-  Until([&] { return callbacks->Guis().size() >= 2; });
-  const std::string gui = callbacks->Guis().at(1);
+  Until([&] { return callbacks->Seen().guis.size() >= 2; });
+  const std::string gui = callbacks->Seen().guis.at(1);
   EXPECT_NE(gui.find("ndi_state_receiving"), std::string::npos) << gui;
   EXPECT_NE(gui.find("16x4 @ 29.97 fps"), std::string::npos) << gui;
   EXPECT_EQ(source->PublishedMediaInfo().videoWidth, 16);
   source->Stop();
-  EXPECT_TRUE(ndi.FreesMatched());
-  EXPECT_EQ(ndi.ReceiversDestroyed(), 1);
+  EXPECT_TRUE(ndi.Seen().freesMatched);
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
 }
 
 TEST_F(LoopTest, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetTallyResult(false);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 250);
   ndi.SetTallyResult(true);
   ndi.SetMetadataResult(false);
   env.clock->AdvanceMs(250);
   ASSERT_EQ(env.clock->AwaitWait(2), 250);
-  EXPECT_EQ(ndi.Captures(), 0);
+  EXPECT_EQ(ndi.Seen().captures, 0);
   ndi.SetMetadataResult(true);
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
   env.clock->AdvanceMs(250);
@@ -172,19 +172,18 @@ TEST_F(LoopTest, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
 TEST_F(LoopTest, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);
-  EXPECT_EQ(ndi.Captures(), 120);
+  EXPECT_EQ(ndi.Seen().captures, 120);
   EXPECT_EQ(source->State(), ReceiverState::Idle);
-  EXPECT_EQ(callbacks->States(), (std::vector<std::int32_t>{1, 3}));
-  const int queries = ndi.ConnectionQueries();
+  EXPECT_EQ(callbacks->Seen().states, (std::vector<std::int32_t>{1, 3}));
+  const int queries = ndi.Seen().connectionQueries;
   for (int poll = 2; poll <= 4; ++poll) {
     env.clock->AdvanceMs(5000);
     ASSERT_EQ(env.clock->AwaitWait(poll), 5000);
-    EXPECT_EQ(ndi.ConnectionQueries(), queries + poll - 1);
+    EXPECT_EQ(ndi.Seen().connectionQueries, queries + poll - 1);
   }
-  EXPECT_EQ(ndi.ReceiversCreated().size(), 1u);  // the receiver stays in Idle
+  EXPECT_EQ(ndi.Seen().receivers.size(), 1u);  // the receiver stays in Idle
 
   // The sender is back: reconnect from Idle, then receive.
   ndi.SetConnections(1);
@@ -192,12 +191,11 @@ TEST_F(LoopTest, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
   env.clock->AdvanceMs(5000);
   UntilStates({1, 3, 1, 2});
   EXPECT_TRUE(logs.Contains("#ndisource: attempting to reconnect from idle state\n"));
-  EXPECT_EQ(ndi.ReceiversCreated().size(), 1u);
+  EXPECT_EQ(ndi.Seen().receivers.size(), 1u);
 }
 
 TEST_F(LoopTest, SenderSlowToAppearSendsTheLoopToIdleOnceItsReceiverExists) {
-  Make();
-  source->Start();
+  Run();
   ndi.SetConnections(0);
   for (int attempt = 1; attempt <= 120; ++attempt) {
     ASSERT_EQ(env.clock->AwaitWait(attempt), 250);
@@ -205,14 +203,13 @@ TEST_F(LoopTest, SenderSlowToAppearSendsTheLoopToIdleOnceItsReceiverExists) {
     env.clock->AdvanceMs(250);
   }
   UntilState(ReceiverState::Idle);
-  EXPECT_EQ(ndi.Captures(), 0);
+  EXPECT_EQ(ndi.Seen().captures, 0);
 }
 
 TEST_F(LoopTest, LostConnectionWhileReceivingGoesIdle) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  Make();
-  source->Start();
+  Run();
   UntilStates({1, 2});
   ndi.SetConnections(0);
   UntilStates({1, 2, 3});
@@ -241,23 +238,22 @@ TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
   const ListedCase& c = GetParam();
   ndi.SetSources({Entry{kName, kUrl}});
   if (c.receiving) ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
-  Make();
-  source->Start();
+  Run();
   if (c.receiving) UntilStates({1, 2});
-  Until([&] { return ndi.Captures() >= 3; });
+  Until([&] { return ndi.Seen().captures >= 3; });
   ndi.SetSources(c.listed);
-  const int lists = ndi.ListCalls(), captures = ndi.Captures();
-  Until([&] { return ndi.Captures() >= captures + 20; });
-  EXPECT_EQ(ndi.ListCalls(), lists) << "not looked at before 250 ms have passed";
+  const int lists = ndi.Seen().listCalls, captures = ndi.Seen().captures;
+  Until([&] { return ndi.Seen().captures >= captures + 20; });
+  EXPECT_EQ(ndi.Seen().listCalls, lists) << "not looked at before 250 ms have passed";
   env.clock->AdvanceMs(250);
   if (c.madeAgainFor != nullptr) {
-    ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.ReceiversCreated().size() == 2; }));
-    EXPECT_EQ(ndi.ReceiversCreated()[1].url, c.madeAgainFor);
-    EXPECT_EQ(ndi.ReceiversDestroyed(), 1);
+    ASSERT_TRUE(pmtest::WaitFor([&] { return ndi.Seen().receivers.size() == 2; }));
+    EXPECT_EQ(ndi.Seen().receivers[1].url, c.madeAgainFor);
+    EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
     ndi.Push(VideoCapture(kNdiFourCCUYVY, 16, 4, 32));
   } else {
-    Until([&] { return ndi.Captures() >= captures + 40; });
-    EXPECT_EQ(ndi.ReceiversCreated().size(), 1u);
+    Until([&] { return ndi.Seen().captures >= captures + 40; });
+    EXPECT_EQ(ndi.Seen().receivers.size(), 1u);
   }
   UntilStates(c.states);
   EXPECT_EQ(logs.Count(std::string("#ndisource: source listed at a new url (") +
@@ -278,14 +274,13 @@ INSTANTIATE_TEST_SUITE_P(
 TEST_F(LoopTest, StopEndsAWaitingLoopAtOnceAndReleasesEverything) {
   ndi.SetSources({Entry{kName, kUrl}});
   ndi.SetConnections(0);
-  Make();
-  source->Start();
+  Run();
   ASSERT_EQ(env.clock->AwaitWait(1), 5000);  // Idle, waiting for the next poll
   source->Stop();
   EXPECT_EQ(*env.exits, 0);
   EXPECT_EQ(source->State(), ReceiverState::None);
-  EXPECT_EQ(ndi.ReceiversDestroyed(), 1);
-  EXPECT_EQ(ndi.FindersDestroyed(), 1);
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
   // Stop and Stop again, or Stop without Start, only leave state 0.
   source->Stop();
   NDISource never(callbacks, kId, ndi.Api(), env.Make());
@@ -298,7 +293,7 @@ TEST_F(LoopTest, LoopStuckPastTheStopDeadlineEndsTheProcess) {
   ndi.BlockCapture(true);
   Make(std::chrono::milliseconds(20), [this] { ndi.BlockCapture(false); });
   source->Start();
-  Until([&] { return ndi.Captures() >= 1; });
+  Until([&] { return ndi.Seen().captures >= 1; });
   source->Stop();
   EXPECT_EQ(*env.exits, 1);
   EXPECT_TRUE(logs.Contains("#ndisource: failed to exit receiver loop\n"));
@@ -312,24 +307,23 @@ TEST_F(LoopTest, StartedSourceRestartsOnReconnectAndConfiguration) {
   source->ExecuteCustomActionCommand("something else");
   EXPECT_FALSE(source->Started());
   EXPECT_EQ(source->Bandwidth(), 10u);
-  EXPECT_EQ(ndi.FindersCreated(), 0);
+  EXPECT_EQ(ndi.Seen().findersCreated, 0);
 
   source->Start();
-  Until([&] { return ndi.ReceiversCreated().size() == 1; });
-  EXPECT_EQ(ndi.ReceiversCreated()[0].bandwidth, 10);
+  Until([&] { return ndi.Seen().receivers.size() == 1; });
+  EXPECT_EQ(ndi.Seen().receivers[0].bandwidth, 10);
   source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest"})");
-  Until([&] { return ndi.ReceiversCreated().size() == 2; });
-  EXPECT_EQ(ndi.ReceiversCreated()[1].bandwidth, 0);
-  EXPECT_EQ(ndi.ReceiversDestroyed(), 1);
+  Until([&] { return ndi.Seen().receivers.size() == 2; });
+  EXPECT_EQ(ndi.Seen().receivers[1].bandwidth, 0);
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
   source->ExecuteCustomActionCommand("taskndisource::reconnect");
-  Until([&] { return ndi.ReceiversCreated().size() == 3; });
-  EXPECT_EQ(ndi.ReceiversCreated()[2].bandwidth, 0);
+  Until([&] { return ndi.Seen().receivers.size() == 3; });
+  EXPECT_EQ(ndi.Seen().receivers[2].bandwidth, 0);
 }
 
 TEST_F(LoopTest, ConcurrentReconnectsNeverRunTwoLoops) {
   ndi.SetSources({Entry{kName, kUrl}});
-  Make();
-  source->Start();
+  Run();
   std::vector<std::thread> threads;
   for (int t = 0; t < 3; ++t) {
     threads.emplace_back([this, t] {
@@ -345,20 +339,19 @@ TEST_F(LoopTest, ConcurrentReconnectsNeverRunTwoLoops) {
     });
   }
   for (auto& thread : threads) thread.join();
-  Until([&] { return ndi.FindersCreated() - ndi.FindersDestroyed() == 1; });
-  EXPECT_EQ(ndi.MaxLiveFinders(), 1);
+  Until([&] { return ndi.Seen().findersCreated - ndi.Seen().findersDestroyed == 1; });
+  EXPECT_EQ(ndi.Seen().maxLiveFinders, 1);
   source->Stop();
-  EXPECT_EQ(ndi.FindersCreated(), ndi.FindersDestroyed());
+  EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
   EXPECT_EQ(*env.exits, 0);
 }
 
 TEST_F(LoopTest, SourceReleasedWhileRunningStopsItsLoop) {
   ndi.SetSources({Entry{kName, kUrl}});
-  Make();
-  source->Start();
-  Until([&] { return ndi.Captures() > 0; });
+  Run();
+  Until([&] { return ndi.Seen().captures > 0; });
   source.reset();
-  EXPECT_EQ(ndi.FindersCreated(), ndi.FindersDestroyed());
+  EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
 }
 
 TEST_F(LoopTest, ShortUniqueIdLooksForAnEmptyNameWithoutFailing) {

@@ -19,53 +19,22 @@ ScriptedNdi& Current() {
   return *current;
 }
 
-std::string Number(float value) {
+std::string Text(float value) {
   char text[32];
   std::snprintf(text, sizeof text, "%g", static_cast<double>(value));
   return text;
 }
+std::string Text(int value) { return std::to_string(value); }
 
-bool IsSupportedCpu() { return true; }
-bool Initialize() { return true; }
-const char* Version() { return "scripted"; }
-void Destroy() {}
-void* FindCreate(const ndi_find_create* s) { return Current().FindCreate(s); }
-void FindDestroy(void* f) { Current().FindDestroy(f); }
-const ndi_source* FindList(void* f, std::uint32_t* count) { return Current().FindList(f, count); }
-void* RecvCreate(const ndi_recv_create* s) { return Current().RecvCreate(s); }
-void RecvDestroy(void* r) { Current().RecvDestroy(r); }
-int Connections(void* r) { return Current().Connections(r); }
-std::int32_t CaptureFn(void* r, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
-                       std::uint32_t timeoutMs) {
-  return Current().Capture(r, v, a, m, timeoutMs);
+// Records "name(a,b)" as a PTZ call.
+template <typename... Args>
+bool PtzCall(const char* name, Args... args) {
+  std::string call = std::string(name) + "(";
+  [[maybe_unused]] const char* separator = "";
+  ((call += separator + Text(args), separator = ","), ...);
+  return Current().Ptz(call + ")");
 }
-void FreeVideo(void*, const ndi_video_frame_v2* v) { Current().Free(0, v->data); }
-void FreeAudio(void*, const ndi_audio_frame_v2* a) { Current().Free(1, a->data); }
-void FreeMetadata(void*, const ndi_metadata_frame* m) { Current().Free(2, m->data); }
-bool SetTally(void*, const ndi_tally* t) { return Current().SetTally(t); }
-bool SendMetadata(void*, const ndi_metadata_frame* m) { return Current().SendMetadata(m); }
-bool PtzSupported(void*) { return Current().PtzSupported(); }
-bool RecallPreset(void*, int preset, float speed) {
-  return Current().Ptz("recall_preset(" + std::to_string(preset) + "," + Number(speed) + ")");
-}
-bool StorePreset(void*, int preset) { return Current().Ptz("store_preset(" + std::to_string(preset) + ")"); }
-bool PanTilt(void*, float p, float t) { return Current().Ptz("pan_tilt(" + Number(p) + "," + Number(t) + ")"); }
-bool PanTiltSpeed(void*, float p, float t) {
-  return Current().Ptz("pan_tilt_speed(" + Number(p) + "," + Number(t) + ")");
-}
-bool Zoom(void*, float z) { return Current().Ptz("zoom(" + Number(z) + ")"); }
-bool Focus(void*, float f) { return Current().Ptz("focus(" + Number(f) + ")"); }
-bool FocusSpeed(void*, float f) { return Current().Ptz("focus_speed(" + Number(f) + ")"); }
-bool AutoFocus(void*) { return Current().Ptz("auto_focus()"); }
-bool ExposureAuto(void*) { return Current().Ptz("exposure_auto()"); }
-bool ExposureManual(void*, float l) { return Current().Ptz("exposure_manual(" + Number(l) + ")"); }
-bool WbAuto(void*) { return Current().Ptz("white_balance_auto()"); }
-bool WbIndoor(void*) { return Current().Ptz("white_balance_indoor()"); }
-bool WbOutdoor(void*) { return Current().Ptz("white_balance_outdoor()"); }
-bool WbOneshot(void*) { return Current().Ptz("white_balance_oneshot()"); }
-bool WbManual(void*, float r, float b) {
-  return Current().Ptz("white_balance_manual(" + Number(r) + "," + Number(b) + ")");
-}
+
 void Interleave(const ndi_audio_frame_v2* src, ndi_audio_frame_interleaved_32f* dst) {
   for (int s = 0; s < src->no_samples; ++s) {
     for (int c = 0; c < src->no_channels; ++c) {
@@ -149,38 +118,39 @@ ScriptedNdi::~ScriptedNdi() { g_current.store(nullptr); }
 
 std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   auto api = std::make_shared<TaskNDISource::NdiApi>();
-  api->is_supported_CPU = IsSupportedCpu;
-  api->initialize = Initialize;
-  api->version = Version;
-  api->destroy = Destroy;
-  api->find_create_v2 = nditest::FindCreate;
-  api->find_get_current_sources = nditest::FindList;
-  api->find_destroy = nditest::FindDestroy;
-  api->recv_create_v2 = nditest::RecvCreate;
-  api->recv_destroy = nditest::RecvDestroy;
-  api->recv_get_no_connections = nditest::Connections;
-  api->recv_capture_v2 = CaptureFn;
-  api->recv_free_video_v2 = FreeVideo;
-  api->recv_free_audio_v2 = FreeAudio;
-  api->recv_free_metadata = FreeMetadata;
-  api->recv_set_tally = nditest::SetTally;
-  api->recv_send_metadata = nditest::SendMetadata;
-  api->recv_ptz_is_supported = nditest::PtzSupported;
-  api->recv_ptz_recall_preset = RecallPreset;
-  api->recv_ptz_store_preset = StorePreset;
-  api->recv_ptz_pan_tilt = PanTilt;
-  api->recv_ptz_pan_tilt_speed = PanTiltSpeed;
-  api->recv_ptz_zoom = Zoom;
-  api->recv_ptz_focus = Focus;
-  api->recv_ptz_focus_speed = FocusSpeed;
-  api->recv_ptz_auto_focus = AutoFocus;
-  api->recv_ptz_exposure_auto = ExposureAuto;
-  api->recv_ptz_exposure_manual = ExposureManual;
-  api->recv_ptz_white_balance_auto = WbAuto;
-  api->recv_ptz_white_balance_indoor = WbIndoor;
-  api->recv_ptz_white_balance_outdoor = WbOutdoor;
-  api->recv_ptz_white_balance_oneshot = WbOneshot;
-  api->recv_ptz_white_balance_manual = WbManual;
+  api->is_supported_CPU = [] { return true; };
+  api->initialize = [] { return true; };
+  api->version = [] { return "scripted"; };
+  api->destroy = [] {};
+  api->find_create_v2 = [](const ndi_find_create* s) { return Current().FindCreate(s); };
+  api->find_get_current_sources = [](void* f, std::uint32_t* count) { return Current().FindList(f, count); };
+  api->find_destroy = [](void* f) { Current().FindDestroy(f); };
+  api->recv_create_v2 = [](const ndi_recv_create* s) { return Current().RecvCreate(s); };
+  api->recv_destroy = [](void* r) { Current().RecvDestroy(r); };
+  api->recv_get_no_connections = [](void* r) { return Current().Connections(r); };
+  api->recv_capture_v2 = [](void* r, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
+                            std::uint32_t timeoutMs) { return Current().Capture(r, v, a, m, timeoutMs); };
+  api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Current().Free(0, v->data); };
+  api->recv_free_audio_v2 = [](void*, const ndi_audio_frame_v2* a) { Current().Free(1, a->data); };
+  api->recv_free_metadata = [](void*, const ndi_metadata_frame* m) { Current().Free(2, m->data); };
+  api->recv_set_tally = [](void*, const ndi_tally* t) { return Current().SetTally(t); };
+  api->recv_send_metadata = [](void*, const ndi_metadata_frame* m) { return Current().SendMetadata(m); };
+  api->recv_ptz_is_supported = [](void*) { return Current().PtzSupported(); };
+  api->recv_ptz_recall_preset = [](void*, int preset, float speed) { return PtzCall("recall_preset", preset, speed); };
+  api->recv_ptz_store_preset = [](void*, int preset) { return PtzCall("store_preset", preset); };
+  api->recv_ptz_pan_tilt = [](void*, float p, float t) { return PtzCall("pan_tilt", p, t); };
+  api->recv_ptz_pan_tilt_speed = [](void*, float p, float t) { return PtzCall("pan_tilt_speed", p, t); };
+  api->recv_ptz_zoom = [](void*, float z) { return PtzCall("zoom", z); };
+  api->recv_ptz_focus = [](void*, float f) { return PtzCall("focus", f); };
+  api->recv_ptz_focus_speed = [](void*, float f) { return PtzCall("focus_speed", f); };
+  api->recv_ptz_auto_focus = [](void*) { return PtzCall("auto_focus"); };
+  api->recv_ptz_exposure_auto = [](void*) { return PtzCall("exposure_auto"); };
+  api->recv_ptz_exposure_manual = [](void*, float l) { return PtzCall("exposure_manual", l); };
+  api->recv_ptz_white_balance_auto = [](void*) { return PtzCall("white_balance_auto"); };
+  api->recv_ptz_white_balance_indoor = [](void*) { return PtzCall("white_balance_indoor"); };
+  api->recv_ptz_white_balance_outdoor = [](void*) { return PtzCall("white_balance_outdoor"); };
+  api->recv_ptz_white_balance_oneshot = [](void*) { return PtzCall("white_balance_oneshot"); };
+  api->recv_ptz_white_balance_manual = [](void*, float r, float b) { return PtzCall("white_balance_manual", r, b); };
   api->util_audio_to_interleaved_32f_v2 = Interleave;
   return api;
 }
@@ -189,28 +159,19 @@ std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
 
 void ScriptedNdi::SetSources(std::vector<Entry> entries) { LOCKED; entries_ = std::move(entries); }
 void ScriptedNdi::FailFinderCreate(bool fail) { LOCKED; failFinder_ = fail; }
-int ScriptedNdi::FindersCreated() { LOCKED; return findersCreated_; }
-int ScriptedNdi::FindersDestroyed() { LOCKED; return findersDestroyed_; }
-int ScriptedNdi::MaxLiveFinders() { LOCKED; return maxLiveFinders_; }
-int ScriptedNdi::ListCalls() { LOCKED; return listCalls_; }
 void ScriptedNdi::FailReceiverCreate(bool fail) { LOCKED; failReceiver_ = fail; }
-std::vector<ReceiverCreated> ScriptedNdi::ReceiversCreated() { LOCKED; return receivers_; }
-int ScriptedNdi::ReceiversDestroyed() { LOCKED; return receiversDestroyed_; }
 void ScriptedNdi::SetConnections(int count) { LOCKED; connections_ = count; }
-int ScriptedNdi::ConnectionQueries() { LOCKED; return connectionQueries_; }
 void ScriptedNdi::SetTallyResult(bool ok) { LOCKED; tallyOk_ = ok; }
-std::vector<ndi_tally> ScriptedNdi::Tallies() { LOCKED; return tallies_; }
 void ScriptedNdi::SetMetadataResult(bool ok) { LOCKED; metadataOk_ = ok; }
-std::vector<std::string> ScriptedNdi::MetadataSent() { LOCKED; return metadataSent_; }
-std::vector<int> ScriptedNdi::MetadataLengths() { LOCKED; return metadataLengths_; }
 void ScriptedNdi::SetPtzSupported(bool supported) { LOCKED; ptzSupported_ = supported; }
-std::vector<std::string> ScriptedNdi::PtzCalls() { LOCKED; return ptzCalls_; }
-int ScriptedNdi::Captures() { LOCKED; return captures_; }
-int ScriptedNdi::CapturesQueued() { LOCKED; return static_cast<int>(queue_.size()); }
-int ScriptedNdi::VideoFrees() { LOCKED; return frees_[0]; }
-int ScriptedNdi::AudioFrees() { LOCKED; return frees_[1]; }
-int ScriptedNdi::MetadataFrees() { LOCKED; return frees_[2]; }
-bool ScriptedNdi::FreesMatched() { LOCKED; return freesMatched_ && handedOut_.empty(); }
+
+Observed ScriptedNdi::Seen() {
+  LOCKED;
+  Observed seen = seen_;
+  seen.queued = static_cast<int>(queue_.size());
+  seen.freesMatched = seen_.freesMatched && handedOut_.empty();
+  return seen;
+}
 
 void ScriptedNdi::Push(std::shared_ptr<nditest::Capture> capture) {
   LOCKED;
@@ -227,16 +188,16 @@ void ScriptedNdi::BlockCapture(bool block) {
 void* ScriptedNdi::FindCreate(const ndi_find_create* settings) {
   LOCKED;
   if (failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
-  ++findersCreated_;
-  maxLiveFinders_ = std::max(maxLiveFinders_, findersCreated_ - findersDestroyed_);
+  ++seen_.findersCreated;
+  seen_.maxLiveFinders = std::max(seen_.maxLiveFinders, seen_.findersCreated - seen_.findersDestroyed);
   return &handleSpace_[++handles_ % 64];
 }
 
-void ScriptedNdi::FindDestroy(void*) { LOCKED; ++findersDestroyed_; }
+void ScriptedNdi::FindDestroy(void*) { LOCKED; ++seen_.findersDestroyed; }
 
 const ndi_source* ScriptedNdi::FindList(void*, std::uint32_t* count) {
   LOCKED;
-  ++listCalls_;
+  ++seen_.listCalls;
   list_.clear();
   for (const Entry& entry : entries_) {
     list_.push_back(ndi_source{entry.name ? entry.name->c_str() : nullptr, entry.url ? entry.url->c_str() : nullptr});
@@ -254,22 +215,22 @@ void* ScriptedNdi::RecvCreate(const ndi_recv_create* settings) {
   created.colorFormat = settings->color_format;
   created.bandwidth = settings->bandwidth;
   created.allowFields = settings->allow_video_fields;
-  receivers_.push_back(created);
+  seen_.receivers.push_back(created);
   return &handleSpace_[++handles_ % 64];
 }
 
-void ScriptedNdi::RecvDestroy(void*) { LOCKED; ++receiversDestroyed_; }
+void ScriptedNdi::RecvDestroy(void*) { LOCKED; ++seen_.receiversDestroyed; }
 
 int ScriptedNdi::Connections(void*) {
   LOCKED;
-  ++connectionQueries_;
+  ++seen_.connectionQueries;
   return connections_;
 }
 
 std::int32_t ScriptedNdi::Capture(void*, ndi_video_frame_v2* video, ndi_audio_frame_v2* audio,
                                   ndi_metadata_frame* metadata, std::uint32_t) {
   std::unique_lock<std::mutex> lock(mutex_);
-  ++captures_;
+  ++seen_.captures;
   changed_.notify_all();
   changed_.wait(lock, [this] { return !block_; });
   if (queue_.empty()) changed_.wait_for(lock, std::chrono::milliseconds(1), [this] { return !queue_.empty(); });
@@ -297,21 +258,21 @@ std::int32_t ScriptedNdi::Capture(void*, ndi_video_frame_v2* video, ndi_audio_fr
 
 void ScriptedNdi::Free(int kind, const void* data) {
   LOCKED;
-  ++frees_[kind];
-  if (handedOut_.erase(data) != 1) freesMatched_ = false;
+  ++seen_.frees[kind];
+  if (handedOut_.erase(data) != 1) seen_.freesMatched = false;
 }
 
 bool ScriptedNdi::SetTally(const ndi_tally* tally) {
   LOCKED;
-  tallies_.push_back(*tally);
+  seen_.tallies.push_back(*tally);
   return tallyOk_;
 }
 
 bool ScriptedNdi::SendMetadata(const ndi_metadata_frame* frame) {
   LOCKED;
-  metadataLengths_.push_back(frame->length);
+  seen_.metadataLengths.push_back(frame->length);
   if (!metadataOk_) return false;
-  metadataSent_.emplace_back(frame->data, frame->length > 0 ? static_cast<std::size_t>(frame->length) - 1 : 0);
+  seen_.metadataSent.emplace_back(frame->data, frame->length > 0 ? static_cast<std::size_t>(frame->length) - 1 : 0);
   return true;
 }
 
@@ -319,7 +280,7 @@ bool ScriptedNdi::PtzSupported() { LOCKED; return ptzSupported_; }
 
 bool ScriptedNdi::Ptz(const std::string& call) {
   LOCKED;
-  ptzCalls_.push_back(call);
+  seen_.ptzCalls.push_back(call);
   return true;
 }
 

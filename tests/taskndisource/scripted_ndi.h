@@ -55,6 +55,25 @@ struct Entry {
   std::optional<std::string> url;
 };
 
+// What the task did to the runtime, as one snapshot.
+struct Observed {
+  int findersCreated = 0;
+  int findersDestroyed = 0;
+  int maxLiveFinders = 0;  // most finders alive at one time
+  int listCalls = 0;
+  std::vector<ReceiverCreated> receivers;
+  int receiversDestroyed = 0;
+  int connectionQueries = 0;
+  std::vector<ndi_tally> tallies;
+  std::vector<std::string> metadataSent;  // texts without the terminating zero
+  std::vector<int> metadataLengths;       // the lengths passed
+  std::vector<std::string> ptzCalls;      // "zoom(0.5)", "recall_preset(3,1)", ...
+  int captures = 0;
+  int queued = 0;  // captures pushed and not yet handed out
+  int frees[3] = {0, 0, 0};  // video, audio, metadata
+  bool freesMatched = true;  // every frame handed out was freed, each once
+};
+
 class ScriptedNdi {
  public:
   // Installs this object as the one the table's functions act on.
@@ -65,41 +84,21 @@ class ScriptedNdi {
 
   // The table; every entry is filled.
   std::shared_ptr<const TaskNDISource::NdiApi> Api() const;
+  Observed Seen();
 
-  // Finder.
+  // Script.
   void SetSources(std::vector<Entry> entries);
   void FailFinderCreate(bool fail);
-  int FindersCreated();
-  int FindersDestroyed();
-  int MaxLiveFinders();  // most finders alive at one time
-  int ListCalls();
-
-  // Receiver.
   void FailReceiverCreate(bool fail);
-  std::vector<ReceiverCreated> ReceiversCreated();
-  int ReceiversDestroyed();
   void SetConnections(int count);
-  int ConnectionQueries();
   void SetTallyResult(bool ok);
-  std::vector<ndi_tally> Tallies();
   void SetMetadataResult(bool ok);
-  std::vector<std::string> MetadataSent();   // texts without the terminating zero
-  std::vector<int> MetadataLengths();        // the lengths passed
   void SetPtzSupported(bool supported);
-  std::vector<std::string> PtzCalls();       // "zoom(0.5)", "recall_preset(3,1)", ...
-
   // Capture: frames are handed out in order; with none queued a capture
   // waits up to a millisecond (real time) and returns "none". While blocked,
   // a capture waits until unblocked.
   void Push(std::shared_ptr<Capture> capture);
   void BlockCapture(bool block);
-  int Captures();
-  int CapturesQueued();
-  // Frees of each kind, and whether each freed frame was the one handed out.
-  int VideoFrees();
-  int AudioFrees();
-  int MetadataFrees();
-  bool FreesMatched();
 
   // Called by the table's functions.
   void* FindCreate(const ndi_find_create* settings);
@@ -119,31 +118,18 @@ class ScriptedNdi {
  private:
   std::mutex mutex_;  // guards everything below
   std::condition_variable changed_;
+  Observed seen_;
   std::vector<Entry> entries_;
   std::vector<ndi_source> list_;  // handed out by FindList, valid until its next call
   bool failFinder_ = false;
-  int findersCreated_ = 0;
-  int findersDestroyed_ = 0;
-  int maxLiveFinders_ = 0;
-  int listCalls_ = 0;
   bool failReceiver_ = false;
-  std::vector<ReceiverCreated> receivers_;
-  int receiversDestroyed_ = 0;
   int connections_ = 1;
-  int connectionQueries_ = 0;
   bool tallyOk_ = true;
-  std::vector<ndi_tally> tallies_;
   bool metadataOk_ = true;
-  std::vector<std::string> metadataSent_;
-  std::vector<int> metadataLengths_;
   bool ptzSupported_ = false;
-  std::vector<std::string> ptzCalls_;
   std::deque<std::shared_ptr<nditest::Capture>> queue_;
   std::map<const void*, std::shared_ptr<nditest::Capture>> handedOut_;
   bool block_ = false;
-  int captures_ = 0;
-  int frees_[3] = {0, 0, 0};
-  bool freesMatched_ = true;
   int handles_ = 0;  // handle values are distinct small addresses within this object
   char handleSpace_[64] = {};
 };

@@ -1,5 +1,6 @@
-// Settings-dialog widgets: their exact JSON, what FromJson reads, pop-up
-// validation and selection, FromGui, and a whole dialog round trip.
+// Settings-dialog widgets: what FromJson reads, pop-up
+// validation and selection, FromGui, and a whole dialog round trip with its
+// exact JSON.
 #include <gtest/gtest.h>
 
 #include "pm/cfg/object.h"
@@ -33,31 +34,6 @@ Json Write(pm::cfg::Object& o) {
 }
 
 // ---------------------------------------------------------------------------
-// Exact JSON
-
-TEST(WidgetJson, FreshWidgetsWriteEveryKeyWithItsType) {
-  SourceGui gui;
-  const Json out = Write(gui);
-  EXPECT_EQ(pmjson::Dump(out["status"]),
-            R"({"ghosted":false,"indication":0,"justification":108,"pm::order":2,)"
-            R"("title":"p_status_label","type":"static_text","value":"","visible":true})");
-  EXPECT_EQ(pmjson::Dump(out["bandwidth"]),
-            R"({"ghosted":false,"pm::order":0,"title":"ndi_bandwidth_label","type":"popup","value":0,)"
-            R"("valueSetID":"","values":["ndi_bandwidth_highest","ndi_bandwidth_lowest",)"
-            R"("ndi_bandwidth_audio_only"],"visible":true})");
-  EXPECT_EQ(pmjson::Dump(out["reconnect"]),
-            R"({"action":1668641652,"command":"taskndisource::reconnect","ghosted":false,)"
-            R"("pm::order":1,"title":"ndi_reconnect_button","type":"button","visible":true})");
-  EXPECT_EQ(out.size(), 5u);
-  EXPECT_FALSE(out.contains("type"));
-  // Numbers are integers, not doubles or strings, so the host reads them as such.
-  EXPECT_TRUE(out["status"]["justification"].is_number_integer());
-  EXPECT_TRUE(out["status"]["indication"].is_number_integer());
-  EXPECT_TRUE(out["bandwidth"]["value"].is_number_integer());
-  EXPECT_TRUE(out["reconnect"]["action"].is_number_integer());
-}
-
-// ---------------------------------------------------------------------------
 // What FromJson reads
 
 TEST(WidgetFromJson, ReadsOnlyValue) {
@@ -77,6 +53,8 @@ TEST(WidgetFromJson, ReadsOnlyValue) {
   EXPECT_EQ(gui.status.justification.Get(), pm::cfg::Justify::Left);
   EXPECT_EQ(gui.status.indication.Get(), pm::cfg::VisualIndication::None);
   EXPECT_EQ(gui.status.title.value, "p_status_label");
+  gui.status.FromJson(Json::parse(R"({"value":["a",2,true]})"));  // an array: its last element
+  EXPECT_EQ(gui.status.value.value, "1");
 }
 
 TEST(WidgetFromJson, MissingValueOrNonObjectLeavesTheValue) {
@@ -92,12 +70,6 @@ TEST(WidgetFromJson, MissingValueOrNonObjectLeavesTheValue) {
   EXPECT_EQ(gui.bandwidth.value.value, 2);
 }
 
-TEST(WidgetFromJson, ArrayValueOnStaticTextKeepsTheLastElement) {
-  SourceGui gui;
-  gui.status.FromJson(Json::parse(R"({"value":["a",2,true]})"));
-  EXPECT_EQ(gui.status.value.value, "1");
-}
-
 TEST(WidgetFromJson, ButtonHasNoValueAndReadingChangesNothing) {
   SourceGui gui;
   const Json before = Write(gui)["reconnect"];
@@ -109,62 +81,55 @@ TEST(WidgetFromJson, ButtonHasNoValueAndReadingChangesNothing) {
 }
 
 // ---------------------------------------------------------------------------
-// Pop-up
+// Pop-up: an index into its entries; Validate resets one out of range to 0,
+// SelectText picks the first entry equal byte for byte and ignores others,
+// and the root validates after reading and before writing.
 
-TEST(Popup, ValidateResetsAnOutOfRangeIndex) {
-  SourceGui gui;
-  for (std::int64_t bad : {std::int64_t{7}, std::int64_t{3}, std::int64_t{-1}, INT64_MIN, INT64_MAX}) {
-    gui.bandwidth.value = bad;
-    gui.bandwidth.Validate();
-    EXPECT_EQ(gui.bandwidth.value.value, 0) << bad;
+TEST(Popup, IndexValidationSelectionAndReading) {
+  enum Op { kValidate, kSelect, kRead, kWrite };
+  struct Case {
+    std::vector<std::string> entries;
+    std::int64_t start;
+    Op op;
+    const char* arg;  // the text to select, or the JSON to read
+    std::int64_t value;
+    const char* selected;
+  } cases[] = {
+      {{"a", "b", "c"}, 7, kValidate, "", 0, "a"},
+      {{"a", "b", "c"}, 3, kValidate, "", 0, "a"},
+      {{"a", "b", "c"}, -1, kValidate, "", 0, "a"},
+      {{"a", "b", "c"}, INT64_MIN, kValidate, "", 0, "a"},
+      {{"a", "b", "c"}, INT64_MAX, kValidate, "", 0, "a"},
+      {{"a", "b", "c"}, 2, kValidate, "", 2, "c"},
+      {{"a", "b", "c"}, 3, kSelect, "b", 1, "b"},
+      {{"a", "b", "c"}, 1, kSelect, "B", 1, "b"},
+      {{"a", "b", "c"}, 1, kSelect, "", 1, "b"},
+      {{"a", "b", "c"}, 3, kSelect, "x", 3, ""},
+      {{"a", "b", "c"}, -1, kSelect, "x", -1, ""},
+      {{"a", "b", "b"}, 0, kSelect, "b", 1, "b"},
+      {{}, 0, kValidate, "", 0, ""},
+      {{}, 0, kSelect, "a", 0, ""},
+      {{"a", "b", "c"}, 1, kRead, R"({"p":{"value":7}})", 0, "a"},
+      {{"a", "b", "c"}, 1, kRead, R"({"p":{"value":18446744073709551615}})", 0, "a"},
+      {{"a", "b", "c"}, 0, kRead, R"({"p":{"value":"2"}})", 2, "c"},
+      {{"a", "b", "c"}, -1, kWrite, "", 0, "a"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(testing::Message() << c.start << " " << c.op << " " << c.arg << " of " << c.entries.size());
+    struct G : pm::cfg::Gui {
+      explicit G(std::vector<std::string> entries) : Gui(nullptr, "", "gui", true), p(this, "p", "t", std::move(entries)) {}
+      pm::cfg::Popup p;
+    } gui(c.entries);
+    gui.p.value = c.start;
+    switch (c.op) {
+      case kValidate: gui.p.Validate(); break;
+      case kSelect: gui.p.SelectText(c.arg); break;
+      case kRead: gui.FromJson(Json::parse(c.arg)); break;
+      case kWrite: EXPECT_EQ(Write(gui)["p"]["value"], c.value); break;
+    }
+    EXPECT_EQ(gui.p.value.value, c.value);
+    EXPECT_EQ(gui.p.SelectedText(), c.selected);
   }
-  gui.bandwidth.value = 2;
-  gui.bandwidth.Validate();
-  EXPECT_EQ(gui.bandwidth.value.value, 2);
-}
-
-TEST(Popup, RootValidatesAfterReadingAndBeforeWriting) {
-  SourceGui gui;
-  gui.FromJson(Json::parse(R"({"bandwidth":{"value":7}})"));
-  EXPECT_EQ(gui.bandwidth.value.value, 0);
-  gui.FromJson(Json::parse(R"({"bandwidth":{"value":18446744073709551615}})"));
-  EXPECT_EQ(gui.bandwidth.value.value, 0);
-  gui.FromJson(Json::parse(R"({"bandwidth":{"value":"2"}})"));
-  EXPECT_EQ(gui.bandwidth.value.value, 2);
-  EXPECT_EQ(gui.bandwidth.SelectedText(), "ndi_bandwidth_audio_only");
-
-  gui.bandwidth.value = -1;  // set directly, then written
-  EXPECT_EQ(Write(gui)["bandwidth"]["value"], 0);
-}
-
-TEST(Popup, SelectTextAndSelectedText) {
-  SourceGui gui;
-  gui.bandwidth.SelectText("ndi_bandwidth_lowest");
-  EXPECT_EQ(gui.bandwidth.value.value, 1);
-  gui.bandwidth.SelectText("NDI_BANDWIDTH_LOWEST");  // byte for byte only
-  gui.bandwidth.SelectText("");
-  EXPECT_EQ(gui.bandwidth.value.value, 1);
-  EXPECT_EQ(gui.bandwidth.SelectedText(), "ndi_bandwidth_lowest");
-  gui.bandwidth.value = 3;
-  EXPECT_EQ(gui.bandwidth.SelectedText(), "");
-  gui.bandwidth.value = -1;
-  EXPECT_EQ(gui.bandwidth.SelectedText(), "");
-}
-
-TEST(Popup, SelectTextTakesTheFirstOfEqualEntries) {
-  pm::cfg::Popup p(nullptr, "p", "t", {"a", "b", "b"});
-  p.SelectText("b");
-  EXPECT_EQ(p.value.value, 1);
-}
-
-TEST(Popup, WithoutEntriesValidatesToZeroAndSelectsNothing) {
-  pm::cfg::Popup p(nullptr, "p", "t", {});
-  p.value = 0;
-  p.Validate();
-  EXPECT_EQ(p.value.value, 0);
-  EXPECT_EQ(p.SelectedText(), "");
-  p.SelectText("a");
-  EXPECT_EQ(p.value.value, 0);
 }
 
 // ---------------------------------------------------------------------------

@@ -2,7 +2,6 @@
 #include <gtest/gtest.h>
 
 #include <cmath>
-#include <random>
 
 #include "pm/runtime/json.h"
 #include "support/log_capture.h"
@@ -11,28 +10,15 @@ namespace {
 
 using pmjson::Json;
 
-TEST(Parse, EmptyTextIsNullWithoutALogLine) {
+// Text that is not JSON is null with one line naming the label and the text;
+// empty text is null without a line. (Garbage of every kind is the fuzzer's.)
+TEST(Parse, BadTextIsNullWithOneLineAndEmptyTextWithNone) {
   pmtest::LogCapture capture;
   EXPECT_TRUE(pmjson::Parse("", "label").is_null());
-  EXPECT_TRUE(capture.Lines().empty());
-}
-
-TEST(Parse, BadTextLogsLabelAndTextAndIsNull) {
-  pmtest::LogCapture capture;
   EXPECT_TRUE(pmjson::Parse("{\"a\":", "validate_gui").is_null());
-  EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"pmjson::Parse failed: validate_gui '{\"a\":'\n"}));
-}
-
-TEST(Parse, GarbageOfAnyKindNeverThrows) {
-  pmtest::LogCapture capture;
   EXPECT_TRUE(pmjson::Parse("\"\xC3\x28\"", "utf8").is_null());  // invalid UTF-8 in a string
-  EXPECT_TRUE(pmjson::Parse(std::string("\0\1\2", 3), "nul").is_null());
-  EXPECT_TRUE(pmjson::Parse(std::string(100000, '['), "deep").is_null());
-  std::mt19937 random(7);
-  std::string garbage(1 << 20, '\0');
-  for (char& c : garbage) c = static_cast<char>(random());
-  EXPECT_TRUE(pmjson::Parse(garbage, "garbage").is_null());
-  EXPECT_EQ(capture.Lines().size(), 4u);
+  EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"pmjson::Parse failed: validate_gui '{\"a\":'\n",
+                                                       "pmjson::Parse failed: utf8 '\"\xC3\x28\"'\n"}));
 }
 
 // Nesting beyond the limit is refused before a value is built (copying or
@@ -86,6 +72,7 @@ TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
 TEST(Parse, ValidTextKeepsKeysInByteOrder) {
   const Json j = pmjson::Parse("{\"b\":1,\"a\":[true,null],\"B\":2.5}", "x");
   EXPECT_EQ(pmjson::Dump(j), "{\"B\":2.5,\"a\":[true,null],\"b\":1}");
+  EXPECT_NO_THROW(pmjson::Dump(Json(std::string("a\xFF"))));  // names from the network need not be UTF-8
 }
 
 struct Row {
@@ -145,11 +132,6 @@ TEST(FieldReaders, UseTheDefaultForMissingKeysAndNonObjects) {
   EXPECT_EQ(pmjson::FieldAsString(Json::array({"unique_id"}), "unique_id", "d"), "d");
   EXPECT_EQ(pmjson::FieldAsString(Json(nullptr), "unique_id", "d"), "d");
   EXPECT_EQ(pmjson::FieldAsInteger(Json("text"), "x", 3), 3);
-}
-
-TEST(Dump, NeverThrowsOnInvalidUtf8) {
-  const Json j = std::string("a\xFF");
-  EXPECT_NO_THROW(pmjson::Dump(j));
 }
 
 }  // namespace

@@ -1,4 +1,5 @@
-// Line assembly of Log and LogText, and lines of any length.
+// Line assembly of Log and LogText, what the sink is handed, and lines of any
+// length.
 #include <gtest/gtest.h>
 
 #include <string>
@@ -12,79 +13,56 @@ namespace {
 using pm::Log;
 using pm::LogText;
 using pm::LogType;
+using Lines = std::vector<std::string>;
 
-TEST(Log, JoinsTagAndMessageWithExactlyOneNewline) {
+// Exactly one newline ends each line; a null tag or text counts as empty; a
+// null format writes nothing.
+TEST(Log, JoinsTagAndTextWithExactlyOneNewline) {
   pmtest::LogCapture capture;
   Log(LogType::Normal, "#ndisource: ", "%s", "x");
   Log(LogType::Normal, "#ndisource: ", "already %d\n", 1);
   Log(LogType::Normal, nullptr, "%s", "");
-  EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"#ndisource: x\n", "#ndisource: already 1\n", "\n"}));
-}
-
-TEST(Log, PassesTheLevelToTheSink) {
-  pm::Context* context = pm::GetContext();
-  auto previous = context->logSink;
-  int seen = -1;
-  context->logSink = [&](LogType level, const char*) { seen = static_cast<int>(level); };
-  Log(LogType::Normal, "", "a");
-  LogText("", "b");
-  context->logSink = previous;
-  EXPECT_EQ(seen, 100);
-}
-
-TEST(Log, BadFormatWritesNothing) {
-  pmtest::LogCapture capture;
   Log(LogType::Normal, "", nullptr);
-  EXPECT_TRUE(capture.Lines().empty());
-}
-
-TEST(LogText, CompleteLineWithEmptyTagIsHandedThroughWithoutCopy) {
-  pm::Context* context = pm::GetContext();
-  auto previous = context->logSink;
-  const char* seen = nullptr;
-  context->logSink = [&](LogType, const char* line) { seen = line; };
-  const char* text = "abc\n";
-  LogText("", text);
-  context->logSink = previous;
-  EXPECT_EQ(seen, text);
-}
-
-TEST(LogText, AddsTagAndNewlineAndTreatsNullAsEmptyLine) {
-  pmtest::LogCapture capture;
   LogText("#ndisource: ", "waiting for source to be found");
   LogText("#ndisource: ", "failed to create NDI receiver\n");
   LogText("", nullptr);
   LogText(nullptr, "plain");
-  EXPECT_EQ(capture.Lines(),
-            (std::vector<std::string>{"#ndisource: waiting for source to be found\n",
-                                      "#ndisource: failed to create NDI receiver\n", "\n", "plain\n"}));
+  EXPECT_EQ(capture.Lines(), (Lines{"#ndisource: x\n", "#ndisource: already 1\n", "\n",
+                                    "#ndisource: waiting for source to be found\n",
+                                    "#ndisource: failed to create NDI receiver\n", "\n", "plain\n"}));
 }
 
-TEST(LogLongLines, AreDeliveredWholeByBothEntryPoints) {
+TEST(Log, LongLinesAreDeliveredWholeByBothEntryPointsAndLeaveNothingBehind) {
   pmtest::LogCapture capture;
+  Lines expected;
   for (std::size_t size : {1021u, 1022u, 1023u, 2000u, 100000u}) {
     const std::string message(size, 'm');
     Log(LogType::Normal, "tag: ", "%s", message.c_str());
     LogText("tag: ", message.c_str());
+    expected.insert(expected.end(), 2, "tag: " + message + "\n");
   }
-  const auto lines = capture.Lines();
-  ASSERT_EQ(lines.size(), 10u);
-  std::size_t i = 0;
-  for (std::size_t size : {1021u, 1022u, 1023u, 2000u, 100000u}) {
-    const std::string expected = "tag: " + std::string(size, 'm') + "\n";
-    EXPECT_EQ(lines[i++], expected) << size;
-    EXPECT_EQ(lines[i++], expected) << size;
-  }
-}
-
-TEST(LogLongLines, ShortLineAfterLongOneIsNotPolluted) {
-  pmtest::LogCapture capture;
-  Log(LogType::Normal, "", "%s", std::string(5000, 'z').c_str());
   Log(LogType::Normal, "", "short");
-  EXPECT_EQ(capture.Lines().back(), "short\n");
+  expected.push_back("short\n");
+  EXPECT_EQ(capture.Lines(), expected);
 }
 
-TEST(LogDefaultSink, ServesAnEmptySlotWithoutWritingIt) {
+// The sink gets the level, and a complete line without a tag is handed
+// through as it is, without a copy.
+TEST(LogSink, GetsTheLevelAndACompleteUntaggedLineUncopied) {
+  pm::Context* context = pm::GetContext();
+  auto previous = context->logSink;
+  std::vector<std::pair<int, const char*>> seen;
+  context->logSink = [&](LogType level, const char* line) { seen.emplace_back(static_cast<int>(level), line); };
+  const char* text = "abc\n";
+  Log(LogType::Normal, "", "a");
+  LogText("", text);
+  context->logSink = previous;
+  ASSERT_EQ(seen.size(), 2u);
+  EXPECT_EQ(seen[0].first, 100);
+  EXPECT_EQ(seen[1], std::make_pair(100, text));
+}
+
+TEST(LogSink, DefaultServesAnEmptySlotWithoutWritingIt) {
   pm::Context* context = pm::GetContext();
   auto previous = context->logSink;
   context->logSink = nullptr;

@@ -1,16 +1,10 @@
 // The host's side of a source and of discovery: every notification's exact
 // JSON, the buffer queue's announcement, buffer requests and their limits,
-// holds of sent and unsent buffers, and a host process reading the frames.
+// holds of sent and unsent buffers.
 #include <gtest/gtest.h>
-
-#include <sys/mman.h>
-#include <sys/wait.h>
-#include <fcntl.h>
-#include <unistd.h>
 
 #include <cstring>
 
-#include "pm/shm/shared_memory.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "pm/task/callbacks.h"
 #include "support/host_link.h"
@@ -47,12 +41,24 @@ struct Fixture {
   std::unique_ptr<pmtest::QueueReader> OpenQueue() {
     callbacks->OpenBufferQueue(link.Dispatcher(), "NDICaptureDevice~HOST (Cam 1)");
     json start = Next("NDICaptureDevice~HOST (Cam 1)::start_queue");
-    auto reader = std::make_unique<pmtest::QueueReader>(start["port"].get<int>());
-    memoryBase = start["memoryBase"].get<std::string>();
-    return reader;
+    return std::make_unique<pmtest::QueueReader>(start["port"].get<int>());
   }
-  std::string memoryBase;
 };
+
+// A source's callbacks with the buffer queue open and a host reader on it.
+class QueueTest : public ::testing::Test, public Fixture {
+ protected:
+  void SetUp() override { reader = OpenQueue(); }
+  std::unique_ptr<pmtest::QueueReader> reader;
+};
+
+pm::VideoFormat Video(std::uint32_t code, int width, int height) {
+  pm::VideoFormat format;
+  format.code = code;
+  format.width = static_cast<std::int16_t>(width);
+  format.height = static_cast<std::int16_t>(height);
+  return format;
+}
 
 TEST(SourceNotifications, CarryExactlyTheirKeysAndTypes) {
   Fixture f;
@@ -111,93 +117,67 @@ TEST(DiscoveryNotifications, AnnounceAndWithdrawSources) {
   EXPECT_EQ(Payload(*gone), json({{"unique_id", "NDICaptureDevice~A (b)"}}));
 }
 
-TEST(BufferQueue, IsAnnouncedWithAPortAndAShortIdMemoryBase) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  EXPECT_TRUE(reader->Connected());
-  EXPECT_EQ(f.memoryBase.size(), 22u);
-}
-
-TEST(AudioRequests, AreSizedFromChannelsSampleCodeAndCount) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  auto buffer = f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480);
+TEST_F(QueueTest, AudioRequests_AreSizedFromChannelsSampleCodeAndCount) {
+  auto buffer = callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480);
   ASSERT_TRUE(buffer);
   EXPECT_EQ(buffer->ByteSize(), 3840);
-  auto pcm = f.callbacks->RequestAudioBuffer({pm::kCodeSowt, 48000, 2}, 480);
+  auto pcm = callbacks->RequestAudioBuffer({pm::kCodeSowt, 48000, 2}, 480);
   ASSERT_TRUE(pcm);
   EXPECT_EQ(pcm->ByteSize(), 1920);
-  EXPECT_EQ(f.callbacks->RequestAudioBuffer({pm::FourCC('a', 'b', 'c', 'd'), 48000, 2}, 480), nullptr);
-  EXPECT_EQ(f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 0), nullptr);
-  EXPECT_EQ(f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 100)->ByteSize(), 127 * 100 * 4);
+  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::FourCC('a', 'b', 'c', 'd'), 48000, 2}, 480), nullptr);
+  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 0), nullptr);
+  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 100)->ByteSize(), 127 * 100 * 4);
 }
 
-TEST(AudioRequests, NegativeOrOverflowingSizesNeverReachThePool) {
-  Fixture f;
-  auto reader = f.OpenQueue();
+TEST_F(QueueTest, AudioRequests_NegativeOrOverflowingSizesNeverReachThePool) {
   // A free segment is in the pool: a negative minimum would match it.
-  f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480).reset();
+  callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 480).reset();
   for (int channels : {128, 200, 255}) {
-    EXPECT_EQ(f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, static_cast<std::uint8_t>(channels)}, 480),
+    EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, static_cast<std::uint8_t>(channels)}, 480),
               nullptr)
         << channels;
   }
   // 127 x 4 x 2^31-1 does not fit 32 bits; it is refused, not wrapped.
-  EXPECT_EQ(f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 0x7FFFFFFF), nullptr);
-  EXPECT_EQ(f.callbacks->AudioBufferCount(), 1);
+  EXPECT_EQ(callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 127}, 0x7FFFFFFF), nullptr);
+  EXPECT_EQ(callbacks->AudioBufferCount(), 1);
 }
 
-TEST(VideoRequests, JpegNeedsAByteSizeAndGetsStrideOne) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  pm::VideoFormat jpeg;
-  jpeg.code = pm::kCodeJpeg;
-  jpeg.width = 640;
-  jpeg.height = 480;
+TEST_F(QueueTest, VideoRequests_JpegNeedsAByteSizeAndGetsStrideOne) {
+  pm::VideoFormat jpeg = Video(pm::kCodeJpeg, 640, 480);
   {
     pmtest::LogCapture capture;
-    EXPECT_EQ(f.callbacks->RequestVideoBuffer(jpeg, 0), nullptr);
+    EXPECT_EQ(callbacks->RequestVideoBuffer(jpeg, 0), nullptr);
     EXPECT_EQ(capture.Lines(), (std::vector<std::string>{"Compressed buffer must have bytesize\n"}));
   }
   jpeg.byteSize = 1000;
-  auto buffer = f.callbacks->RequestVideoBuffer(jpeg, 0);
+  auto buffer = callbacks->RequestVideoBuffer(jpeg, 0);
   ASSERT_TRUE(buffer);
   EXPECT_EQ(buffer->MapData().second, 1);
   buffer->UnmapData();
 }
 
-TEST(VideoRequests, StopCreatingSegmentsAtTheLimit) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  f.callbacks->SetMaxVideoBuffers(2);
-  pm::VideoFormat format;
-  format.code = pm::kCode2vuy;
-  format.width = 64;
-  format.height = 64;
-  auto a = f.callbacks->RequestVideoBuffer(format, 0);
-  auto b = f.callbacks->RequestVideoBuffer(format, 0);
+TEST_F(QueueTest, VideoRequests_StopCreatingSegmentsAtTheLimit) {
+  callbacks->SetMaxVideoBuffers(2);
+  pm::VideoFormat format = Video(pm::kCode2vuy, 64, 64);
+  auto a = callbacks->RequestVideoBuffer(format, 0);
+  auto b = callbacks->RequestVideoBuffer(format, 0);
   ASSERT_TRUE(a && b);
-  EXPECT_EQ(f.callbacks->RequestVideoBuffer(format, 0), nullptr);
+  EXPECT_EQ(callbacks->RequestVideoBuffer(format, 0), nullptr);
   a.reset();  // unsent: its segment is free again at once
-  EXPECT_NE(f.callbacks->RequestVideoBuffer(format, 0), nullptr);
+  EXPECT_NE(callbacks->RequestVideoBuffer(format, 0), nullptr);
 }
 
-TEST(VideoSends, HoldTheSegmentUntilTheHostReturnsTheToken) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  f.callbacks->SetMaxVideoBuffers(1);
-  pm::VideoFormat format;
-  format.code = pm::kCode2vuy;
-  format.width = 64;
-  format.height = 64;
+TEST_F(QueueTest, VideoSends_HoldTheSegmentUntilTheHostReturnsTheToken) {
+  callbacks->SetMaxVideoBuffers(1);
+  pm::VideoFormat format = Video(pm::kCode2vuy, 64, 64);
   format.scan = 'P';
-  auto buffer = f.callbacks->RequestVideoBuffer(format, 0);
+  auto buffer = callbacks->RequestVideoBuffer(format, 0);
   ASSERT_TRUE(buffer);
   std::vector<std::uint8_t> picture(64 * 2 * 64, 0x5A);
   buffer->CopyFrame(picture.data(), 128);
   // A record sent before the host's connection arrived would be released at once.
-  ASSERT_TRUE(pmtest::WaitFor([&] { return f.callbacks->Producer()->HostConnected(); }));
-  f.callbacks->SendVideoBuffer(123456789, buffer);
+  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Producer()->HostConnected(); }));
+  callbacks->SendVideoBuffer(123456789, buffer);
   buffer.reset();
   std::uint32_t token = 0;
   std::uint8_t record[60];
@@ -206,23 +186,18 @@ TEST(VideoSends, HoldTheSegmentUntilTheHostReturnsTheToken) {
   std::memcpy(&time, record + 24, 8);
   EXPECT_EQ(time, 123456789);
   EXPECT_EQ(std::memcmp(record + 32, &format, sizeof format), 0);
-  EXPECT_EQ(f.callbacks->RequestVideoBuffer(format, 0), nullptr);  // still held, limit reached
+  EXPECT_EQ(callbacks->RequestVideoBuffer(format, 0), nullptr);  // still held, limit reached
   reader->ReturnToken(token);
-  EXPECT_TRUE(pmtest::WaitFor([&] { return f.callbacks->RequestVideoBuffer(format, 0) != nullptr; }));
+  EXPECT_TRUE(pmtest::WaitFor([&] { return callbacks->RequestVideoBuffer(format, 0) != nullptr; }));
 }
 
-TEST(VideoSends, WhileMappedLogTheOutstandingMappingAndStillSend) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  pm::VideoFormat format;
-  format.code = pm::kCodeRgba;
-  format.width = 16;
-  format.height = 16;
-  auto buffer = f.callbacks->RequestVideoBuffer(format, 0);
+TEST_F(QueueTest, VideoSends_WhileMappedLogTheOutstandingMappingAndStillSend) {
+  pm::VideoFormat format = Video(pm::kCodeRgba, 16, 16);
+  auto buffer = callbacks->RequestVideoBuffer(format, 0);
   ASSERT_TRUE(buffer);
   buffer->MapData();
   pmtest::LogCapture capture;
-  f.callbacks->SendVideoBuffer(0, buffer);
+  callbacks->SendVideoBuffer(0, buffer);
   EXPECT_EQ(capture.Count("Source has outstanding mapping while sending buffer"), 1);
   buffer->UnmapData();
 }
@@ -235,61 +210,21 @@ class ForeignVideoBuffer : public pm::VideoBuffer {
   pm::VideoFormat Format() const override { return {}; }
 };
 
-TEST(VideoSends, OfForeignBuffersAreIgnored) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  f.callbacks->SendVideoBuffer(0, std::make_shared<ForeignVideoBuffer>());
-  f.callbacks->SendVideoBuffer(0, nullptr);
+TEST_F(QueueTest, VideoSends_OfForeignBuffersAreIgnored) {
+  callbacks->SendVideoBuffer(0, std::make_shared<ForeignVideoBuffer>());
+  callbacks->SendVideoBuffer(0, nullptr);
   std::uint32_t token;
   std::uint8_t record[60];
   EXPECT_FALSE(reader->ReadRecord(&token, record, 200));
 }
 
-TEST(AudioSends, FeedTheMediaClock) {
-  Fixture f;
-  auto reader = f.OpenQueue();
+TEST_F(QueueTest, AudioSends_FeedTheMediaClock) {
   for (int i = 0; i < 30; ++i) {
-    auto buffer = f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 1600);
+    auto buffer = callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 1600);
     ASSERT_TRUE(buffer);
-    f.callbacks->SendAudioBuffer(f.callbacks->AudioTime(48000), buffer);
+    callbacks->SendAudioBuffer(callbacks->AudioTime(48000), buffer);
   }
-  EXPECT_EQ(f.callbacks->AudioTime(48000), 705600000);
-}
-
-TEST(HostProcess, MapsTheSegmentByNameAndReadsTheFrame) {
-  Fixture f;
-  auto reader = f.OpenQueue();
-  auto buffer = f.callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 4);
-  ASSERT_TRUE(buffer);
-  buffer->Fill([](void* data, std::int64_t bytes) {
-    auto* samples = static_cast<float*>(data);
-    for (std::int64_t i = 0; i < bytes / 4; ++i) samples[i] = 0.5f + static_cast<float>(i);
-  });
-  ASSERT_TRUE(pmtest::WaitFor([&] { return f.callbacks->Producer()->HostConnected(); }));
-  f.callbacks->SendAudioBuffer(0, buffer);
-  std::uint32_t token = 0;
-  std::uint8_t record[60];
-  ASSERT_TRUE(reader->ReadRecord(&token, record));
-  const std::string name = "/" + f.memoryBase + std::to_string(token);
-
-  const pid_t child = ::fork();
-  if (child == 0) {
-    // The host: open the segment by name, check the 8 samples.
-    const int fd = ::shm_open(name.c_str(), O_RDWR, 0);
-    if (fd < 0) ::_exit(2);
-    void* map = ::mmap(nullptr, 4096, PROT_READ, MAP_SHARED, fd, 0);
-    if (map == MAP_FAILED) ::_exit(3);
-    const auto* samples = static_cast<const float*>(map);
-    for (int i = 0; i < 8; ++i) {
-      if (samples[i] != 0.5f + static_cast<float>(i)) ::_exit(4);
-    }
-    ::_exit(0);
-  }
-  int status = 0;
-  ASSERT_EQ(::waitpid(child, &status, 0), child);
-  EXPECT_TRUE(WIFEXITED(status));
-  EXPECT_EQ(WEXITSTATUS(status), 0);
-  reader->ReturnToken(token);
+  EXPECT_EQ(callbacks->AudioTime(48000), 705600000);
 }
 
 }  // namespace

@@ -11,9 +11,13 @@ constexpr std::int64_t kSecondNs = 1000000000;
 
 constexpr std::uint32_t Rate(std::uint32_t frames, std::uint32_t seconds) { return frames | seconds << 16; }
 
-TEST(MediaClock, CurrentTimeCountsTicksFromTheEpoch) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+class MediaClock : public ::testing::Test {
+ protected:
+  std::shared_ptr<pmtest::ManualClock> t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
+  pm::MediaClock clock{t};
+};
+
+TEST_F(MediaClock, CurrentTimeCountsTicksFromTheEpoch) {
   EXPECT_EQ(clock.CurrentTime(), 0);
   t->Advance(kSecondNs);
   EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
@@ -21,9 +25,7 @@ TEST(MediaClock, CurrentTimeCountsTicksFromTheEpoch) {
   EXPECT_EQ(clock.CurrentTime(), pm::kTicksPerSecond);
 }
 
-TEST(MediaClock, AudioTimeOfOneSecondOfSamples) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, AudioTimeOfOneSecondOfSamples) {
   EXPECT_EQ(clock.AudioTime(48000), 0);
   for (int i = 0; i < 30; ++i) clock.AudioSent(1600);
   EXPECT_EQ(clock.AudioTime(48000), 705600000);
@@ -31,18 +33,14 @@ TEST(MediaClock, AudioTimeOfOneSecondOfSamples) {
   EXPECT_EQ(clock.AudioTime(44100), 1473599736);
 }
 
-TEST(MediaClock, AudioTimeWithoutARateFollowsTheSteadyClock) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, AudioTimeWithoutARateFollowsTheSteadyClock) {
   clock.AudioSent(48000);
   t->Advance(kSecondNs / 2);
   EXPECT_EQ(clock.AudioTime(0), pm::kTicksPerSecond / 2);
   EXPECT_EQ(clock.AudioTime(-1), pm::kTicksPerSecond / 2);
 }
 
-TEST(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock) {
   for (std::int64_t i = 1; i <= 10; ++i) {
     EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(i, true));
   }
@@ -50,9 +48,7 @@ TEST(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock)
   EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(2 * pm::kTicksPerSecond, false));
 }
 
-TEST(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
   // 48 kHz audio in 1601/1602-sample buffers, video at 30000/1001.
   std::int64_t previous = -1;
   for (int frame = 0; frame < 300; ++frame) {
@@ -67,9 +63,7 @@ TEST(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
   }
 }
 
-TEST(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
   clock.AudioSent(1600);
   clock.AudioTime(48000);
   const auto first = clock.NextVideoTime(Rate(30, 1));
@@ -81,9 +75,7 @@ TEST(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
   EXPECT_FALSE(second.second);
 }
 
-TEST(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
   for (int i = 0; i < 100; ++i) clock.AudioSent(1600);
   clock.AudioTime(48000);
   const auto first = clock.NextVideoTime(Rate(30, 1));
@@ -94,9 +86,7 @@ TEST(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
   EXPECT_EQ(second, std::make_pair(first.first + 1, true));
 }
 
-TEST(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
   clock.AudioSent(4800);
   const std::int64_t audio = clock.AudioTime(48000);
   EXPECT_EQ(clock.NextVideoTime(Rate(0, 1)), std::make_pair(audio, false));
@@ -104,9 +94,7 @@ TEST(MediaClock, ZeroFrameRateReturnsTheAudioTimeWithoutStoringIt) {
   EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(audio, false));  // first real one
 }
 
-TEST(MediaClock, ResetStartsTheEpochAgainAndReturnsToTheFallback) {
-  auto t = std::make_shared<pmtest::ManualClock>(5 * kSecondNs);
-  pm::MediaClock clock(t);
+TEST_F(MediaClock, ResetStartsTheEpochAgainAndReturnsToTheFallback) {
   clock.AudioSent(48000);
   clock.AudioTime(48000);
   clock.NextVideoTime(Rate(25, 1));

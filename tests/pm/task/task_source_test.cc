@@ -69,24 +69,20 @@ class ScriptedSource : public pm::Source {
     if (script_.throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
   }
   const std::string& Tag() const { return tag_; }
-  std::string ValidateGui(std::string text) override {
-    journal_->Add("validate " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
-  std::string GuiToConfiguration(std::string text) override {
-    journal_->Add("to_config " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
-  std::string ConfigurationToGui(std::string text) override {
-    journal_->Add("to_gui " + tag_ + " " + text);
-    return script_.guiAnswer;
-  }
+  std::string ValidateGui(std::string text) override { return Answer("validate ", text); }
+  std::string GuiToConfiguration(std::string text) override { return Answer("to_config ", text); }
+  std::string ConfigurationToGui(std::string text) override { return Answer("to_gui ", text); }
   void ExecuteCustomActionCommand(std::string command) override { journal_->Add("action " + tag_ + " " + command); }
   void ExecutePtzCommand(const Json& request) override { journal_->Add("ptz " + tag_ + " " + request.value("zoom", "")); }
   void HandleShotEvent(std::string event) override { journal_->Add("shot " + tag_ + " " + event); }
   void SourceHotplugEvent() override { journal_->Add("hotplug " + tag_); }
 
  private:
+  std::string Answer(const char* call, const std::string& text) {
+    journal_->Add(call + tag_ + " " + text);
+    return script_.guiAnswer;
+  }
+
   std::string tag_;
   Journal* journal_;
   Script script_;
@@ -112,6 +108,20 @@ class ScriptedDiscovery : public pm::SourceDiscovery {
   std::function<void()> onStart_;
 };
 
+// Sends a command on `peer` and returns its reply (discarded when none
+// comes), skipping other frames.
+Json AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
+  body["pm::command"] = command;
+  body["pm::unique_id"] = id;
+  body["pm::request"] = true;
+  if (!peer.WriteJson(body)) return Json::value_t::discarded;
+  for (;;) {
+    const Json frame = peer.ReadJson(5s);
+    if (frame.is_discarded()) return frame;
+    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
+  }
+}
+
 // A task with scripted factories, one dispatcher attached as the runner
 // attaches it, and the host's end of that connection.
 class TaskSourceTest : public ::testing::Test {
@@ -129,14 +139,7 @@ class TaskSourceTest : public ::testing::Test {
         if (CurrentScript().throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
       });
     });
-    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener_.Port());
-    ASSERT_TRUE(connection);
-    host_ = listener_.Accept();
-    ASSERT_TRUE(host_.Valid());
-    dispatcher_ = std::make_shared<pm::RpcDispatcher>(std::move(connection));
-    task_->AddDispatcher(dispatcher_);
-    task_->AttachDispatcher(dispatcher_);
-    dispatcher_->Start();
+    host_ = Attach(listener_, &dispatcher_);
   }
   void TearDown() override {
     discoveryMayStart_ = true;
@@ -144,33 +147,27 @@ class TaskSourceTest : public ::testing::Test {
     dispatcher_.reset();
   }
 
-  // Attaches one more connection as the runner attaches it; returns the
-  // host's end.
-  pmtest::HostPeer AttachAnother() {
-    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(anotherListener_.Port());
-    pmtest::HostPeer peer = anotherListener_.Accept();
-    EXPECT_TRUE(connection && peer.Valid());
+  // Attaches a connection from `listener` as the runner attaches it; returns
+  // the host's end.
+  pmtest::HostPeer Attach(pmtest::HostListener& listener, std::shared_ptr<pm::RpcDispatcher>* kept = nullptr) {
+    std::shared_ptr<pm::ipc::Connection> connection = pm::ipc::Connection::Open(listener.Port());
+    pmtest::HostPeer peer = listener.Accept();
+    if (!connection || !peer.Valid()) {
+      ADD_FAILURE() << "no connection";
+      return peer;
+    }
     auto dispatcher = std::make_shared<pm::RpcDispatcher>(std::move(connection));
     task_->AddDispatcher(dispatcher);
     task_->AttachDispatcher(dispatcher);
     dispatcher->Start();
+    if (kept != nullptr) *kept = dispatcher;
     return peer;
   }
+  pmtest::HostPeer AttachAnother() { return Attach(anotherListener_); }
 
   // Sends a command and returns its reply, skipping the task's own requests
   // (a started source announces its buffer queue).
-  Json Ask(const std::string& command, Json body = Json::object()) {
-    const std::uint64_t id = ++requestId_;
-    body["pm::command"] = command;
-    body["pm::unique_id"] = id;
-    body["pm::request"] = true;
-    EXPECT_TRUE(host_.WriteJson(body));
-    for (;;) {
-      const Json frame = host_.ReadJson(5s);
-      if (frame.is_discarded()) return frame;
-      if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
-    }
-  }
+  Json Ask(const std::string& command, Json body = Json::object()) { return AskOn(host_, ++requestId_, command, body); }
   void StartSource(const std::string& id, const Json* config = nullptr) {
     Json body = {{"unique_id", id}};
     if (config) body["config"] = *config;
@@ -204,19 +201,6 @@ class TaskSourceTest : public ::testing::Test {
 
 using Lines = std::vector<std::string>;
 
-// Sends a command on `peer` and waits for its reply, skipping other frames.
-bool AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
-  body["pm::command"] = command;
-  body["pm::unique_id"] = id;
-  body["pm::request"] = true;
-  if (!peer.WriteJson(body)) return false;
-  for (;;) {
-    const Json frame = peer.ReadJson(5s);
-    if (frame.is_discarded()) return false;
-    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return true;
-  }
-}
-
 // Every object started and not the survivor was stopped, and the survivor was not.
 void ExpectOnlySurvivorRunning(const Lines& lines, const std::string& prefix, const std::string& survivor) {
   int started = 0;
@@ -231,20 +215,16 @@ void ExpectOnlySurvivorRunning(const Lines& lines, const std::string& prefix, co
 }
 
 TEST_F(TaskSourceTest, EmptyConfigurationsGiveEmptyTextAndOthersStayExact) {
-  const Json cases[] = {Json::object(), Json::array(), Json(), Json::parse(R"({"a":1})"), Json::parse(R"([1,"x"])"),
-                        Json("text"), Json(0), Json(false)};
+  const std::pair<Json, const char*> cases[] = {
+      {Json::object(), ""}, {Json::array(), ""}, {Json(), ""}, {Json::parse(R"({"a":1})"), R"({"a":1})"},
+      {Json::parse(R"([1,"x"])"), R"([1,"x"])"}, {Json("text"), R"("text")"}, {Json(0), "0"}, {Json(false), "false"}};
   StartSource("absent");
-  for (std::size_t i = 0; i < std::size(cases); ++i) StartSource("s" + std::to_string(i), &cases[i]);
-  const Lines lines = journal_.Lines();
-  EXPECT_EQ(lines[0], "config absent#1 ");
-  EXPECT_EQ(lines[2], "config s0#2 ");
-  EXPECT_EQ(lines[4], "config s1#3 ");
-  EXPECT_EQ(lines[6], "config s2#4 ");
-  EXPECT_EQ(lines[8], R"(config s3#5 {"a":1})");
-  EXPECT_EQ(lines[10], R"(config s4#6 [1,"x"])");
-  EXPECT_EQ(lines[12], R"(config s5#7 "text")");
-  EXPECT_EQ(lines[14], "config s6#8 0");
-  EXPECT_EQ(lines[16], "config s7#9 false");
+  EXPECT_EQ(journal_.Lines()[0], "config absent#1 ");
+  for (std::size_t i = 0; i < std::size(cases); ++i) {
+    const std::string id = "s" + std::to_string(i);
+    StartSource(id, &cases[i].first);
+    EXPECT_EQ(journal_.Lines()[2 * i + 2], "config " + id + "#" + std::to_string(i + 2) + " " + cases[i].second);
+  }
   EXPECT_EQ(task_->SourceCount(), 9u);
 }
 
@@ -284,24 +264,26 @@ TEST_F(TaskSourceTest, SecondStartForARunningIdStopsTheOldSourceBeforeTheNewStar
   EXPECT_EQ(journal_.Lines(), (Lines{"hotplug a#2"}));
 }
 
-TEST_F(TaskSourceTest, StartThatThrowsStopsTheSourceAndLogsTheRequest) {
-  EditScript([](Script& script) { script.throwOnStart = true; });
-  pmtest::LogCapture log;
-  StartSource("a");
-  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 ", "start a#1", "stop a#1"}));
-  EXPECT_EQ(task_->SourceCount(), 0u);
-  // The whole request, indented by 4.
-  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
-  EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
-}
-
-TEST_F(TaskSourceTest, ConfigurationThatThrowsLeavesNothingAndStartsNothing) {
-  EditScript([](Script& script) { script.throwOnConfiguration = true; });
-  pmtest::LogCapture log;
-  StartSource("a");
-  EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 "}));
-  EXPECT_EQ(task_->SourceCount(), 0u);
-  EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception"), 1);
+// A start or configuration that throws leaves no source behind (a started
+// one is stopped) and logs the whole request, indented by 4.
+TEST_F(TaskSourceTest, FailedStartOrConfigurationLeavesNothingAndLogsTheRequest) {
+  struct Case {
+    bool throwOnConfiguration;
+    Lines journal;
+  } cases[] = {{false, {"config a#1 ", "start a#1", "stop a#1"}}, {true, {"config a#2 "}}};
+  for (const Case& c : cases) {
+    EditScript([&](Script& script) {
+      script.throwOnStart = true;
+      script.throwOnConfiguration = c.throwOnConfiguration;
+    });
+    journal_.Clear();
+    pmtest::LogCapture log;
+    StartSource("a");
+    EXPECT_EQ(journal_.Lines(), c.journal);
+    EXPECT_EQ(task_->SourceCount(), 0u);
+    EXPECT_EQ(log.Count("pm::tsrc::start_source : Caught exception : {\n    \"pm::command\""), 1);
+    EXPECT_TRUE(log.Contains("\n    \"unique_id\": \"a\"\n}"));
+  }
 }
 
 TEST_F(TaskSourceTest, StartWithANumericOrMissingIdIsLoggedAndChangesNothing) {
@@ -395,10 +377,10 @@ TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut)
   ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::start_discovery"}, {"pm::unique_id", 900},
                                {"pm::request", true}}));
   ASSERT_TRUE(pmtest::WaitFor([&] { return discoveryStarting_.load(); }));
-  EXPECT_TRUE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}));
+  EXPECT_FALSE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}).is_discarded());
   discoveryMayStart_ = true;
   EXPECT_FALSE(Ask("pm::tsrc::discovery_hotplug_event").is_discarded());
-  EXPECT_TRUE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}));
+  EXPECT_FALSE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}).is_discarded());
   EXPECT_EQ(task_->DispatcherCount(), 2u);
   EXPECT_EQ(journal_.Lines(),
             (Lines{"config a#1 ", "start a#1", "start discovery#1", "stop a#1", "hotplug discovery#1"}));
@@ -416,8 +398,8 @@ TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopThe
   constexpr int kRounds = 15;
   const auto drive = [](pmtest::HostPeer& peer) {
     for (int i = 0; i < kRounds; ++i) {
-      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()));
-      EXPECT_TRUE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}));
+      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()).is_discarded());
+      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}).is_discarded());
     }
   };
   std::thread other([&] { drive(second); });

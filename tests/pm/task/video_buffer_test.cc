@@ -85,87 +85,63 @@ Bytes SourcePicture(const pm::VideoFormat& format, std::int32_t stride) {
 
 // ---------------------------------------------------------------- CopyFrame
 
-TEST(VideoBufferCopyFrame, DifferentStridesCopyEveryNV12RowButNotThePadding) {
-  const pm::VideoFormat f = Format(pm::kCodeNV12, 1920, 1080);
-  const Bytes source = SourcePicture(f, 2048);
-  MemoryVideoBuffer buffer(f, 1936);
-  buffer.CopyFrame(source.data.get(), 2048);
-  EXPECT_EQ(buffer.maps, 1);
-  EXPECT_EQ(buffer.unmaps, 1);
-  // 1080 luma rows and 540 chroma rows of 1920 bytes; the 16 padding bytes of
-  // each destination row are left alone.
-  for (int plane = 0; plane < 2; ++plane) {
-    const int rows = plane == 0 ? 1080 : 540;
-    for (int r = 0; r < rows; ++r) {
-      const std::uint8_t* row = buffer.Row(plane, r);
-      for (int c = 0; c < 1920; ++c) ASSERT_EQ(row[c], Pattern(plane, r, c)) << plane << " " << r << " " << c;
-      for (int c = 1920; c < 1936; ++c) ASSERT_EQ(row[c], kUntouched) << plane << " " << r;
+// Every row of every plane is copied for its row bytes and the destination's
+// padding is left alone; with equal strides a plane goes as one block, padding
+// and all; a source stride of 0 means the default stride.
+TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
+  struct Case {
+    std::uint32_t code;
+    int width, height, sourceStride, stride, rowBytes, copiedBytes;
+  } cases[] = {
+      {pm::kCodeNV12, 1920, 1080, 2048, 1936, 1920, 1920},
+      {pm::kCode2vuy, 5, 7, 16, 16, 10, 16},
+      {pm::kCodeRgba, 3, 4, 0, 16, 12, 12},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.code);
+    const pm::VideoFormat f = Format(c.code, c.width, c.height);
+    const Bytes source = SourcePicture(f, c.sourceStride == 0 ? c.rowBytes : c.sourceStride);
+    MemoryVideoBuffer buffer(f, c.stride);
+    buffer.CopyFrame(source.data.get(), c.sourceStride);
+    EXPECT_EQ(buffer.maps, 1);
+    EXPECT_EQ(buffer.unmaps, 1);
+    const pm::VideoPlanes planes = pm::LayoutPlanes(f, source.data.get(), c.stride);
+    for (int plane = 0; plane < planes.planeCount; ++plane) {
+      for (int r = 0; r < planes.plane[plane].rows; ++r) {
+        const std::uint8_t* row = buffer.Row(plane, r);
+        for (int k = 0; k < c.stride; ++k) {
+          ASSERT_EQ(row[k], k < c.copiedBytes ? Pattern(plane, r, k) : kUntouched) << plane << " " << r << " " << k;
+        }
+      }
     }
   }
 }
 
-TEST(VideoBufferCopyFrame, EqualStridesCopyTheWholePlaneAsOneBlock) {
-  // 2vuy 5 pixels: rows of 10 bytes in a stride of 16. With equal strides the
-  // padding comes along, which a row-by-row copy would leave untouched.
-  const pm::VideoFormat f = Format(pm::kCode2vuy, 5, 7);
-  const Bytes source = SourcePicture(f, 16);
-  MemoryVideoBuffer buffer(f, 16);
-  buffer.CopyFrame(source.data.get(), 16);
-  for (int r = 0; r < 7; ++r)
-    for (int c = 0; c < 16; ++c) ASSERT_EQ(buffer.Row(0, r)[c], Pattern(0, r, c));
-}
-
-TEST(VideoBufferCopyFrame, SourceStrideZeroMeansTheDefaultStride) {
-  const pm::VideoFormat f = Format(pm::kCodeRgba, 3, 4);
-  const Bytes source = SourcePicture(f, 12);
-  MemoryVideoBuffer buffer(f, 16);
-  buffer.CopyFrame(source.data.get(), 0);
-  for (int r = 0; r < 4; ++r) {
-    for (int c = 0; c < 12; ++c) ASSERT_EQ(buffer.Row(0, r)[c], Pattern(0, r, c));
-    for (int c = 12; c < 16; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
-  }
-}
-
 TEST(VideoBufferCopyFrame, UnusableSourcesWriteNothingAndStillUnmap) {
-  const pm::VideoFormat f = Format(pm::kCode2vuy, 8, 4);
-  {  // a stride smaller than a row would read past the source
-    const Bytes source(8 * 4);
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.CopyFrame(source.data.get(), 8);
+  struct Case {
+    const char* what;
+    std::uint32_t code;
+    int sourceStride, stride;
+    bool noSource, mapless;
+  } cases[] = {
+      {"a source stride smaller than a row would read past the source", pm::kCode2vuy, 8, 16, false, false},
+      {"no source at all", pm::kCode2vuy, 16, 16, true, false},
+      {"a destination stride smaller than a row would write past the segment", pm::kCode2vuy, 32, 8, false, false},
+      {"a buffer that cannot be mapped", pm::kCode2vuy, 16, 16, false, true},
+      // A 'JPEG' segment has stride 1: copying lines of width x 4 bytes would
+      // run far past its 4 bytes.
+      {"a compressed picture is not copied as lines", pm::kCodeJpeg, 256, 1, false, false},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.what);
+    const pm::VideoFormat f = Format(c.code, 8, 4);
+    const Bytes source(static_cast<std::size_t>(c.sourceStride) * 4);
+    MemoryVideoBuffer buffer(f, c.stride);
+    buffer.mapless = c.mapless;
+    buffer.CopyFrame(c.noSource ? nullptr : source.data.get(), c.sourceStride);
     EXPECT_TRUE(buffer.AllUntouched());
-    EXPECT_EQ(buffer.unmaps, buffer.maps);
+    EXPECT_EQ(buffer.maps, buffer.unmaps);
   }
-  {  // no source at all
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.CopyFrame(nullptr, 16);
-    EXPECT_TRUE(buffer.AllUntouched());
-    EXPECT_EQ(buffer.maps, 1);
-    EXPECT_EQ(buffer.unmaps, 1);
-  }
-  {  // a destination stride smaller than a row would write past the segment
-    const Bytes source = SourcePicture(f, 32);
-    MemoryVideoBuffer buffer(f, 8);
-    buffer.CopyFrame(source.data.get(), 32);
-    EXPECT_TRUE(buffer.AllUntouched());
-  }
-  {  // a buffer that cannot be mapped
-    const Bytes source = SourcePicture(f, 16);
-    MemoryVideoBuffer buffer(f, 16);
-    buffer.mapless = true;
-    buffer.CopyFrame(source.data.get(), 16);
-    EXPECT_EQ(buffer.maps, 1);
-    EXPECT_EQ(buffer.unmaps, 1);
-  }
-}
-
-TEST(VideoBufferCopyFrame, CompressedPictureIsNotCopiedAsLines) {
-  // A 'JPEG' segment has stride 1; copying width x 4 bytes per line with a
-  // stride of 1 would run far past its byteSize.
-  pm::VideoFormat f = Format(pm::kCodeJpeg, 64, 64);
-  const Bytes source(64 * 64 * 4);
-  MemoryVideoBuffer buffer(f, 1);  // 64 bytes of room
-  buffer.CopyFrame(source.data.get(), 256);
-  EXPECT_TRUE(buffer.AllUntouched());
 }
 
 // ------------------------------------------------------------- ConvertFrame
@@ -265,48 +241,44 @@ TEST(VideoBufferConvertFrame, PlanarRefusalsStopBeforeWritingPastAnyPlane) {
   }
 }
 
-TEST(VideoBufferConvertFrame, BGRXGetsOpaqueAlphaTopDownAndBottomUp) {
-  const int w = 7, h = 5;  // 7 pixels: one 4-pixel vector step and a tail
-  for (bool bottomUp : {false, true}) {
-    SCOPED_TRACE(bottomUp ? "bottom-up" : "top-down");
-    const int stride = 4 * w + 4;
-    Bytes pixels(static_cast<std::size_t>(stride) * h);
-    for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i);
-    pm::VideoPlanes src;
-    src.planeCount = 1;
-    // Bottom-up: the first picture row is the last one in memory.
-    src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                            : pm::Plane{pixels.data.get(), h, stride};
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w);
-    buffer.ConvertFrame(pm::kCodeBGRX, src);
-    for (int r = 0; r < h; ++r) {
-      const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-      for (int c = 0; c < 4 * w; ++c)
-        ASSERT_EQ(buffer.Row(0, r)[c], c % 4 == 3 ? 0xFF : in[c]) << r << " " << c;
-    }
-  }
+// BGRX copies 4 bytes a pixel, BGR0 widens 3 to 4; both set the fourth byte
+// to 0xFF and write nothing past the row, top-down and bottom-up (the first
+// picture row last in memory). 7 pixels: one 4-pixel vector step and a tail.
+struct Packed {
+  std::uint32_t code;
+  int inBytes;    // per pixel
+  int padding;    // source bytes after a row
+  int dstExtra;   // destination bytes after a row
+};
+constexpr Packed kPacked[] = {{pm::kCodeBGRX, 4, 4, 0}, {pm::kCodeBGR0, 3, 0, 8}};
+
+pm::VideoPlanes PackedSource(Bytes& pixels, int h, int stride, bool bottomUp) {
+  pm::VideoPlanes src;
+  src.planeCount = 1;
+  src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
+                          : pm::Plane{pixels.data.get(), h, stride};
+  return src;
 }
 
-TEST(VideoBufferConvertFrame, BGR0WidensThreeBytesToFour) {
-  const int w = 5, h = 3;
-  for (bool bottomUp : {false, true}) {
-    SCOPED_TRACE(bottomUp ? "bottom-up" : "top-down");
-    const int stride = 3 * w;  // no padding: the tightest source
-    Bytes pixels(static_cast<std::size_t>(stride) * h);
-    for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i + 9);
-    pm::VideoPlanes src;
-    src.planeCount = 1;
-    src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                            : pm::Plane{pixels.data.get(), h, stride};
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + 8);
-    buffer.ConvertFrame(pm::kCodeBGR0, src);
-    for (int r = 0; r < h; ++r) {
-      const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-      for (int p = 0; p < w; ++p) {
-        for (int k = 0; k < 3; ++k) ASSERT_EQ(buffer.Row(0, r)[4 * p + k], in[3 * p + k]);
-        ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
+  const int w = 7, h = 5;
+  for (const Packed& k : kPacked) {
+    for (bool bottomUp : {false, true}) {
+      SCOPED_TRACE(testing::Message() << k.code << (bottomUp ? " bottom-up" : " top-down"));
+      const int stride = k.inBytes * w + k.padding;
+      Bytes pixels(static_cast<std::size_t>(stride) * h);
+      for (std::size_t i = 0; i < pixels.size; ++i) pixels.data[i] = static_cast<std::uint8_t>(i + 9);
+      const pm::VideoPlanes src = PackedSource(pixels, h, stride, bottomUp);
+      MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
+      buffer.ConvertFrame(k.code, src);
+      for (int r = 0; r < h; ++r) {
+        const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
+        for (int p = 0; p < w; ++p) {
+          for (int b = 0; b < 3; ++b) ASSERT_EQ(buffer.Row(0, r)[4 * p + b], in[k.inBytes * p + b]) << r << " " << p;
+          ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+        }
+        for (int c = 4 * w; c < 4 * w + k.dstExtra; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
       }
-      for (int c = 4 * w; c < 4 * w + 8; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
     }
   }
 }
@@ -314,32 +286,31 @@ TEST(VideoBufferConvertFrame, BGR0WidensThreeBytesToFour) {
 TEST(VideoBufferConvertFrame, PackedRefusalsWriteNothing) {
   const int w = 6, h = 3;
   Bytes pixels(static_cast<std::size_t>(4 * w) * h);
-  auto refused = [&](std::uint32_t code, pm::VideoPlanes src, std::int32_t dstStride) {
-    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), dstStride);
-    buffer.ConvertFrame(code, src);
-    return buffer.AllUntouched() && buffer.maps == 1 && buffer.unmaps == 1;
+  struct Case {
+    std::uint32_t code;
+    int planeCount, rows, stride;
+    bool noData;
+    int dstStride;
+  } cases[] = {
+      {pm::kCodeBGRX, 2, h, 4 * w, false, 4 * w},
+      {pm::kCodeBGRX, 1, h + 1, 4 * w, false, 4 * w},
+      {pm::kCodeBGRX, 1, h, 4 * w - 1, false, 4 * w},
+      {pm::kCodeBGRX, 1, h, -(4 * w - 1), false, 4 * w},
+      {pm::kCodeBGRX, 1, h, 4 * w, false, 4 * w - 4},  // destination too narrow
+      {pm::kCodeBGR0, 1, h, 3 * w - 1, false, 4 * w},
+      {pm::kCodeBGR0, 1, h, 4 * w, true, 4 * w},
   };
-  pm::VideoPlanes good;
-  good.planeCount = 1;
-  good.plane[0] = {pixels.data.get(), h, 4 * w};
-  pm::VideoPlanes p = good;
-  p.planeCount = 2;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p = good;
-  p.plane[0].rows = h + 1;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p = good;
-  p.plane[0].stride = 4 * w - 1;
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  p.plane[0].stride = -(4 * w - 1);
-  EXPECT_TRUE(refused(pm::kCodeBGRX, p, 4 * w));
-  EXPECT_TRUE(refused(pm::kCodeBGRX, good, 4 * w - 4));  // destination too narrow
-  p = good;
-  p.plane[0].stride = 3 * w - 1;
-  EXPECT_TRUE(refused(pm::kCodeBGR0, p, 4 * w));
-  p = good;
-  p.plane[0].data = nullptr;
-  EXPECT_TRUE(refused(pm::kCodeBGR0, p, 4 * w));
+  for (const Case& c : cases) {
+    SCOPED_TRACE(testing::Message() << c.code << " rows " << c.rows << " stride " << c.stride << " to " << c.dstStride);
+    pm::VideoPlanes src;
+    src.planeCount = c.planeCount;
+    src.plane[0] = {c.noData ? nullptr : pixels.data.get(), c.rows, c.stride};
+    MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), c.dstStride);
+    buffer.ConvertFrame(c.code, src);
+    EXPECT_TRUE(buffer.AllUntouched());
+    EXPECT_EQ(buffer.maps, 1);
+    EXPECT_EQ(buffer.unmaps, 1);
+  }
 }
 
 TEST(VideoBufferConvertFrame, UnlistedPairsMapNothing) {

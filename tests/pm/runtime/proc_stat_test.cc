@@ -1,0 +1,50 @@
+// /proc/PID/stat as the liveness checks and CPU figures read it: a live
+// process, a child that ended but is not reaped yet (a zombie, which still
+// answers kill(pid, 0)), and one that is gone.
+#include <gtest/gtest.h>
+
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <fstream>
+#include <string>
+
+#include "pm/runtime/proc_stat.h"
+#include "pm/runtime/system.h"
+
+namespace {
+
+TEST(ProcStat, ReadsALiveProcessAZombieChildAndNothingOfOneGone) {
+  std::string command;
+  std::getline(std::ifstream("/proc/self/comm"), command);
+  pm::ProcStat self;
+  ASSERT_TRUE(pm::ReadProcStat(::getpid(), &self));
+  EXPECT_EQ(self.command, command);
+  EXPECT_EQ(self.state, 'R');
+  EXPECT_EQ(self.parent, ::getppid());
+  EXPECT_TRUE(pm::ProcessAlive(::getpid()));
+  // Busy until a clock tick of CPU time was used (10 ms).
+  const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (pm::ProcessCpuSeconds(::getpid()) == 0 && std::chrono::steady_clock::now() < limit) {
+  }
+  EXPECT_GT(pm::ProcessCpuSeconds(::getpid()), 0);
+
+  const pid_t child = ::fork();
+  ASSERT_GE(child, 0);
+  if (child == 0) ::_exit(0);
+  pm::ProcStat ended;
+  while (pm::ReadProcStat(child, &ended) && ended.state != 'Z') ::usleep(1000);
+  EXPECT_EQ(ended.state, 'Z');
+  EXPECT_EQ(ended.parent, ::getpid());
+  EXPECT_FALSE(pm::ProcessAlive(child));
+  EXPECT_EQ(pm::ChildrenNamed(::getpid(), command), std::vector<pid_t>{child});
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_FALSE(pm::ReadProcStat(child, &ended));
+  EXPECT_EQ(pm::ProcessCpuSeconds(child), 0);
+  EXPECT_FALSE(pm::ProcessAlive(child));
+  EXPECT_TRUE(pm::ChildrenNamed(::getpid(), command).empty());
+}
+
+}  // namespace
