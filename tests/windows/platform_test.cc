@@ -1,8 +1,11 @@
 // The Windows side of the platform layer, run under Wine: loopback sockets
 // on Winsock 2 (started by the first socket; a shutdown or an acceptor's
 // close wakes a thread blocked on the socket, which shutdown alone does not
-// do there) and CPU segments as named file mappings in the paging file.
+// do there), CPU segments as named file mappings in the paging file, and
+// what the system tells about a process (liveness, CPU time).
 #include <gtest/gtest.h>
+
+#include <windows.h>
 
 #include <chrono>
 #include <cstring>
@@ -176,5 +179,29 @@ INSTANTIATE_TEST_SUITE_P(
                     BadSegment{"OpenMissing",
                                [](pm::SharedCpuMemory& s) { return s.Open(UniqueName("missing"), 4096); }}),
     [](const testing::TestParamInfo<BadSegment>& info) { return std::string(info.param.name); });
+
+// A process that ended is no longer alive although it can still be opened
+// (here: its handle is still held); a process uses CPU time as it runs.
+TEST(WindowsProcess, AliveAndCpuTimeOfItselfAndOfAnEndedChild) {
+  const int self = pm::CurrentProcessId();
+  EXPECT_TRUE(pm::ProcessAlive(self));
+  const auto limit = std::chrono::steady_clock::now() + 60s;
+  while (pm::ProcessCpuSeconds(self) == 0 && std::chrono::steady_clock::now() < limit) {
+  }
+  EXPECT_GT(pm::ProcessCpuSeconds(self), 0);
+
+  char program[MAX_PATH] = {};
+  ASSERT_GT(::GetModuleFileNameA(nullptr, program, MAX_PATH), 0u);
+  std::string line = std::string("\"") + program + "\" --gtest_filter=None.None";
+  STARTUPINFOA start{};
+  start.cb = sizeof start;
+  PROCESS_INFORMATION child{};
+  ASSERT_TRUE(::CreateProcessA(program, line.data(), nullptr, nullptr, FALSE, 0, nullptr, nullptr, &start, &child));
+  EXPECT_EQ(::WaitForSingleObject(child.hProcess, 60'000), WAIT_OBJECT_0);
+  EXPECT_FALSE(pm::ProcessAlive(static_cast<int>(child.dwProcessId)));
+  ::CloseHandle(child.hThread);
+  ::CloseHandle(child.hProcess);
+  EXPECT_FALSE(pm::ProcessAlive(0));
+}
 
 }  // namespace
