@@ -102,6 +102,12 @@ int main(int argc, char** argv) {
   demoCommand->add_option("--png", demo.png, "where to write the snapshot (relative: in the current folder)")
       ->capture_default_str();
   demoCommand->add_flag("--json", demo.json, "print the summary as one JSON document");
+#ifdef PM_NDI_VENDOR_RUNTIME
+  demo.lossy = true;  // built on the vendor runtime
+#endif
+  demoCommand->add_flag("--lossy", demo.lossy,
+                        "check the pictures within a lossy codec's tolerance (the vendor runtime's; the default when "
+                        "built on it)");
   for (CLI::App* command : {listCommand, receiveCommand, demoCommand}) AddHostOptions(command, host);
 
   try {
@@ -136,9 +142,6 @@ int main(int argc, char** argv) {
   }
   demo.host = host;
   demo.interrupted = &g_interrupted;
-#ifdef PM_NDI_VENDOR_RUNTIME
-  demo.lossy = true;  // built on the vendor runtime
-#endif
   demo.progress = demo.json ? pmhost::Progress::None : progress;
   return pmhost::RunDemo(demo);
 }
