@@ -1,7 +1,5 @@
 // The exported C interface of the loopback runtime. Every entry point accepts
 // null handles and pointers and never lets an exception out.
-#include <poll.h>
-
 #include <chrono>
 #include <cstring>
 #include <memory>
@@ -12,10 +10,11 @@
 #include "ndi-loopback/receiver.h"
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/sender.h"
+#include "pm/runtime/export.h"
 #include "pm/runtime/log.h"
 #include "ndi/ndi_abi.h"
 
-#define NDILB_EXPORT extern "C" __attribute__((visibility("default")))
+#define NDILB_EXPORT extern "C" PM_EXPORT
 
 namespace ndilb {
 namespace {

@@ -1,118 +1,121 @@
 #include "ndi-loopback/net.h"
 
-#include <arpa/inet.h>
-#include <fcntl.h>
-#include <netinet/in.h>
-#include <netinet/tcp.h>
-#include <poll.h>
-#include <sys/eventfd.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <climits>
 #include <cstdlib>
 
+#include "pm/runtime/clock.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
 
 namespace ndilb {
 
-int ListenLoopback(int* port) {
-  const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) {
-    pm::Log(pm::LogType::Normal, "", "ndi-loopback: socket failed: %s", pm::ErrnoText(errno).c_str());
-    return -1;
+namespace sys = pm::ip::sys;
+using pm::ip::LastSocketError;
+
+namespace {
+
+constexpr const char* kLoopbackHost = "127.0.0.1";
+
+// Calls f() again while it fails with an interruption; returns its result.
+template <class F>
+auto Retry(F&& f) -> decltype(f()) {
+  for (;;) {
+    auto r = f();
+    if (!(r < 0 && LastSocketError::Read().Interrupted())) return r;
   }
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  addr.sin_port = 0;
+}
+
+}  // namespace
+
+SocketHandle ListenLoopback(int* port) {
+  if (!sys::StartOnce()) return kNoSocket;
+  const SocketHandle fd = sys::OpenTcp(false);
+  if (fd == kNoSocket) {
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: socket failed: %s",
+            pm::ip::ErrorText(LastSocketError::Read()).c_str());
+    return kNoSocket;
+  }
   // The lowest free port from NDI_LOOPBACK_FIRST_PORT on, as the vendor
   // runtime's senders take the lowest free one from 5961 (a port that a
   // dead sender left is taken again at once); else any port.
   const char* first = std::getenv("NDI_LOOPBACK_FIRST_PORT");
   const long from = first != nullptr ? std::strtol(first, nullptr, 10) : 0;
-  bool bound = false;
-  for (long p = from; !bound && p > 0 && p < from + kFirstPortTries && p <= 65535; ++p) {
-    addr.sin_port = htons(static_cast<std::uint16_t>(p));
-    bound = ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+  bool taken = false;
+  for (long p = from; !taken && p > 0 && p < from + kFirstPortTries && p <= 65535; ++p) {
+    taken = sys::BindLoopback(fd, static_cast<int>(p));
   }
-  if (!bound) addr.sin_port = 0;
-  socklen_t len = sizeof addr;
-  if ((!bound && ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) || ::listen(fd, 32) != 0 ||
-      ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) != 0) {
-    pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot listen on 127.0.0.1: %s", pm::ErrnoText(errno).c_str());
-    ::close(fd);
-    return -1;
+  const int bound = (taken || sys::BindLoopback(fd, 0)) && sys::Listen(fd, 32) ? sys::LocalPort(fd) : -1;
+  if (bound <= 0) {
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot listen on 127.0.0.1: %s",
+            pm::ip::ErrorText(LastSocketError::Read()).c_str());
+    sys::CloseHandle(fd);
+    return kNoSocket;
   }
-  *port = ntohs(addr.sin_port);
+  *port = bound;
   return fd;
 }
 
-int ConnectTo(const std::string& url, int timeout_ms) {
+SocketHandle AcceptFrom(SocketHandle listener) {
+  for (;;) {
+    const SocketHandle fd = sys::Accept(listener, nullptr);
+    if (fd != kNoSocket || !LastSocketError::Read().Interrupted()) return fd;
+  }
+}
+
+SocketHandle ConnectTo(const std::string& url, int timeout_ms) {
   const std::size_t colon = url.rfind(':');
-  if (colon == std::string::npos || colon == 0) return -1;
-  const std::string host = url.substr(0, colon);
+  if (colon == std::string::npos || url.compare(0, colon, kLoopbackHost) != 0 ||
+      colon != std::char_traits<char>::length(kLoopbackHost)) {
+    return kNoSocket;
+  }
   char* end = nullptr;
   const long port = std::strtol(url.c_str() + colon + 1, &end, 10);
-  if (end == url.c_str() + colon + 1 || *end != '\0' || port <= 0 || port > 65535) return -1;
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_port = htons(static_cast<std::uint16_t>(port));
-  if (::inet_pton(AF_INET, host.c_str(), &addr.sin_addr) != 1) return -1;
-  const int fd = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
-  if (fd < 0) return -1;
-  int rc = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-  if (rc != 0 && errno == EINPROGRESS) {
-    pollfd p{fd, POLLOUT, 0};
-    rc = pm::RetryEintr([&] { return ::poll(&p, 1, timeout_ms); });
-    int err = 0;
-    socklen_t len = sizeof err;
-    if (rc == 1 && ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &err, &len) == 0 && err == 0) {
-      rc = 0;
-    } else {
-      rc = -1;
+  if (end == url.c_str() + colon + 1 || *end != '\0' || port <= 0 || port > 65535) return kNoSocket;
+  if (!sys::StartOnce()) return kNoSocket;
+  const SocketHandle fd = sys::OpenTcp(true);
+  if (fd == kNoSocket) return kNoSocket;
+  bool connected = sys::ConnectLoopback(fd, static_cast<int>(port)) == 0;
+  if (!connected && LastSocketError::Read().InProgress()) {
+    const std::int64_t deadline = pm::SteadyNowNs() + std::int64_t{timeout_ms} * 1'000'000;
+    sys::PollEntry entry{fd, true, false};
+    int ready = 0;
+    for (;;) {
+      const std::int64_t left_ms = (deadline - pm::SteadyNowNs()) / 1'000'000;
+      ready = sys::Poll(&entry, 1, static_cast<int>(left_ms > 0 ? left_ms : 0));
+      if (!(ready < 0 && LastSocketError::Read().Interrupted())) break;
     }
+    connected = ready == 1 && sys::PendingError(fd) == 0;
   }
-  if (rc != 0) {
-    ::close(fd);
-    return -1;
+  if (!connected || !sys::SetNonBlocking(fd, false)) {
+    sys::CloseHandle(fd);
+    return kNoSocket;
   }
-  ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) & ~O_NONBLOCK);
   return fd;
 }
 
-void TuneConnection(int fd, int send_timeout_ms) {
-  int one = 1;
-  ::setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
-  timeval tv{};
-  tv.tv_sec = send_timeout_ms / 1000;
-  tv.tv_usec = (send_timeout_ms % 1000) * 1000;
-  ::setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof tv);
+void TuneConnection(SocketHandle fd, int send_timeout_ms) {
+  sys::SetNoDelay(fd);
+  sys::SetSendTimeout(fd, static_cast<std::uint32_t>(send_timeout_ms));
 }
 
-bool WriteAll(int fd, iovec* iov, int count) {
+bool WriteAll(SocketHandle fd, Piece* pieces, int count) {
   while (count > 0) {
-    if (iov->iov_len == 0) {
-      ++iov;
+    if (pieces->length == 0) {
+      ++pieces;
       --count;
       continue;
     }
-    msghdr msg{};
-    msg.msg_iov = iov;
-    msg.msg_iovlen = static_cast<std::size_t>(count < IOV_MAX ? count : IOV_MAX);
-    const ssize_t n = pm::RetryEintr([&] { return ::sendmsg(fd, &msg, MSG_NOSIGNAL); });
+    const std::size_t batch = static_cast<std::size_t>(count) < sys::kMaxChunks ? static_cast<std::size_t>(count)
+                                                                                 : sys::kMaxChunks;
+    const std::int64_t n = Retry([&] { return sys::SendGather(fd, pieces, batch); });
     if (n <= 0) return false;
     std::size_t left = static_cast<std::size_t>(n);
     while (left > 0 && count > 0) {
-      if (left >= iov->iov_len) {
-        left -= iov->iov_len;
-        ++iov;
+      if (left >= pieces->length) {
+        left -= pieces->length;
+        ++pieces;
         --count;
       } else {
-        iov->iov_base = static_cast<char*>(iov->iov_base) + left;
-        iov->iov_len -= left;
+        pieces->data = static_cast<const char*>(pieces->data) + left;
+        pieces->length -= left;
         left = 0;
       }
     }
@@ -120,21 +123,44 @@ bool WriteAll(int fd, iovec* iov, int count) {
   return true;
 }
 
-int MakeWakeFd() { return ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK); }
-
-void Wake(int fd) {
-  const std::uint64_t one = 1;
-  [[maybe_unused]] ssize_t n = ::write(fd, &one, sizeof one);
+void ShutdownSocket(SocketHandle fd) {
+  if (fd != kNoSocket) sys::Shutdown(fd);
 }
 
-void Drain(int fd) {
-  std::uint64_t value = 0;
-  [[maybe_unused]] ssize_t n = ::read(fd, &value, sizeof value);
+void CloseSocket(SocketHandle fd) {
+  if (fd != kNoSocket) sys::CloseHandle(fd);
 }
 
-bool WaitWake(int fd, int ms) {
-  pollfd p{fd, POLLIN, 0};
-  return pm::RetryEintr([&] { return ::poll(&p, 1, ms); }) == 1;
+Waker::Waker() {
+  if (!sys::StartOnce() || !sys::MakeWakePair(&pair_)) {
+    pair_ = sys::WakePair{};
+    pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot make a wake-up pair: %s",
+            pm::ip::ErrorText(LastSocketError::Read()).c_str());
+  }
+}
+
+Waker::~Waker() {
+  CloseSocket(pair_.read);
+  CloseSocket(pair_.write);
+}
+
+void Waker::Wake() {
+  // A full pair already wakes the reader; the byte may then be dropped.
+  const std::uint8_t one = 1;
+  if (pair_.write != kNoSocket) sys::Send(pair_.write, &one, 1);
+}
+
+void Waker::Drain() {
+  std::uint8_t buffer[64];
+  if (pair_.read == kNoSocket) return;
+  while (sys::Receive(pair_.read, buffer, sizeof buffer, sys::ReceiveMode::kDontWait) > 0) {
+  }
+}
+
+bool Waker::Wait(int ms) {
+  if (pair_.read == kNoSocket) return false;
+  sys::PollEntry entry{pair_.read, false, false};
+  return Retry([&] { return sys::Poll(&entry, 1, ms); }) == 1;
 }
 
 }  // namespace ndilb

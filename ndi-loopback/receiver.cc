@@ -1,9 +1,5 @@
 #include "ndi-loopback/receiver.h"
 
-#include <poll.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 #include <chrono>
 #include <cstdio>
 #include <cstring>
@@ -13,7 +9,6 @@
 #include "ndi-loopback/registry.h"
 #include "ndi-loopback/sender.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
 #include "pm/runtime/thread_name.h"
 
 namespace ndilb {
@@ -58,7 +53,6 @@ Receiver::Receiver(const ndi_recv_create& settings)
       bandwidth_(settings.bandwidth),
       color_format_(settings.color_format),
       pool_(std::make_shared<BufferPool>(4)) {
-  wake_fd_ = MakeWakeFd();
   // As with the vendor runtime, the first capture reports a status change
   // at once, before any connection; a later one comes with each connection
   // whose sender takes PTZ.
@@ -70,15 +64,14 @@ Receiver::Receiver(const ndi_recv_create& settings)
 
 Receiver::~Receiver() {
   stop_ = true;
-  if (wake_fd_ >= 0) Wake(wake_fd_);
+  wake_.Wake();
   {
     // Serve publishes its socket before it looks at stop_, so either it sees
     // stop_ or this sees the socket.
     std::lock_guard<std::mutex> lock(write_mutex_);
-    if (fd_ >= 0) ::shutdown(fd_, SHUT_RDWR);
+    ShutdownSocket(fd_);
   }
   if (thread_.joinable()) thread_.join();
-  if (wake_fd_ >= 0) ::close(wake_fd_);
 }
 
 std::string Receiver::ListedUrl() const {
@@ -95,51 +88,58 @@ void Receiver::Run() {
     // As with the vendor runtime: the URL first, whoever listens there; when
     // nothing answers, the URL listed for the name (a sender that came back
     // may listen on a new port).
-    int fd = url_.empty() ? -1 : ConnectTo(url_, kConnectTimeoutMs);
-    if (fd < 0) {
+    SocketHandle fd = url_.empty() ? kNoSocket : ConnectTo(url_, kConnectTimeoutMs);
+    if (fd == kNoSocket) {
       const std::string listed = ListedUrl();
       if (!listed.empty() && listed != url_) fd = ConnectTo(listed, kConnectTimeoutMs);
     }
-    if (fd >= 0) {
+    if (fd != kNoSocket) {
       Serve(fd);
       connected_ = false;
       ptz_ = false;
     }
     if (stop_) break;
-    if (wake_fd_ < 0) {
+    if (!wake_.ok()) {
       std::this_thread::sleep_for(std::chrono::milliseconds(kRetryMs));
-    } else {
-      WaitWake(wake_fd_, kRetryMs);
+    } else if (wake_.Wait(kRetryMs)) {
+      wake_.Drain();
     }
   }
   pm::ClearThreadName();
 }
 
-void Receiver::Serve(int fd) {
+void Receiver::Serve(SocketHandle fd) {
+  namespace sys = pm::ip::sys;
   TuneConnection(fd, kSendTimeoutMs);
   {
     std::lock_guard<std::mutex> lock(write_mutex_);
     EncodedHead hello = EncodeHello(bandwidth_, tally_.on_program, tally_.on_preview);
-    iovec iov{hello.bytes, hello.size};
-    if (!WriteAll(fd, &iov, 1)) {
-      ::close(fd);
+    Piece piece{hello.bytes, hello.size};
+    if (!WriteAll(fd, &piece, 1)) {
+      CloseSocket(fd);
       return;
     }
     fd_ = fd;
+    broken_ = false;
   }
   Decoder decoder(ReceiverSideLimits(), pool_);
   bool open = true;
-  while (open && !stop_) {
+  while (open && !stop_ && !broken_) {
     std::span<std::uint8_t> span = decoder.WritableSpan();
     // The rest of a large picture is read in one blocking call straight into
     // its buffer; the destructor shuts the socket down to end such a wait.
-    const int flags = span.size() >= kBlockingReadBytes ? MSG_WAITALL : MSG_DONTWAIT;
-    const ssize_t n = pm::RetryEintr([&] { return ::recv(fd, span.data(), span.size(), flags); });
+    const auto mode = span.size() >= kBlockingReadBytes ? sys::ReceiveMode::kWaitAll : sys::ReceiveMode::kDontWait;
+    std::int64_t n = 0;
+    pm::ip::LastSocketError error;
+    do {
+      n = sys::Receive(fd, span.data(), span.size(), mode);
+      error = n < 0 ? pm::ip::LastSocketError::Read() : pm::ip::LastSocketError{};
+    } while (n < 0 && error.Interrupted());
     if (n == 0) break;
     if (n < 0) {
-      if (errno != EAGAIN && errno != EWOULDBLOCK) break;
-      pollfd p[2] = {{fd, POLLIN, 0}, {wake_fd_, POLLIN, 0}};
-      pm::RetryEintr([&] { return ::poll(p, wake_fd_ >= 0 ? 2 : 1, 250); });
+      if (!error.WouldBlock()) break;
+      sys::PollEntry p[2] = {{fd, false, false}, {wake_.handle(), false, false}};
+      if (sys::Poll(p, wake_.ok() ? 2 : 1, 250) > 0 && wake_.ok() && p[1].ready) wake_.Drain();
       continue;
     }
     if (!decoder.Commit(static_cast<std::size_t>(n))) {
@@ -178,8 +178,8 @@ void Receiver::Serve(int fd) {
   }
   {
     std::lock_guard<std::mutex> lock(write_mutex_);
-    ::close(fd);
-    fd_ = -1;
+    CloseSocket(fd);
+    fd_ = kNoSocket;
   }
   // Frames of the connection that are still queued stay capturable.
 }
@@ -326,10 +326,13 @@ void Receiver::FreeMetadata(const ndi_metadata_frame& frame) {
 
 bool Receiver::WriteMessage(const void* head, std::size_t head_size, const std::string& text) {
   // Called with write_mutex_ held.
-  if (fd_ < 0) return false;
-  iovec iov[2] = {{const_cast<void*>(head), head_size}, {const_cast<char*>(text.data()), text.size()}};
-  if (WriteAll(fd_, iov, 2)) return true;
-  ::shutdown(fd_, SHUT_RDWR);  // the network thread notices and reconnects
+  if (fd_ == kNoSocket) return false;
+  Piece pieces[2] = {{head, head_size}, {text.data(), text.size()}};
+  if (WriteAll(fd_, pieces, 2)) return true;
+  // The network thread notices and reconnects.
+  ShutdownSocket(fd_);
+  broken_ = true;
+  wake_.Wake();
   return false;
 }
 
@@ -339,7 +342,7 @@ bool Receiver::SetTally(const ndi_tally& tally) {
   // Taken whether or not a sender is connected, as the vendor runtime does.
   // Once the hello is out (fd_ is set under this lock right after it), the
   // change must follow it on the wire even before the sender's Ready.
-  if (fd_ < 0) return true;
+  if (fd_ == kNoSocket) return true;
   EncodedHead head = EncodeTally(tally.on_program, tally.on_preview);
   WriteMessage(head.bytes, head.size, std::string());
   return true;

@@ -23,6 +23,7 @@
 #include <string>
 #include <thread>
 
+#include "ndi-loopback/net.h"
 #include "ndi-loopback/wire.h"
 #include "ndi/ndi_abi.h"
 
@@ -65,7 +66,7 @@ class Receiver {
   // The URL the registry lists for the name (empty without one).
   std::string ListedUrl() const;
   // Reads until the connection ends or the receiver stops.
-  void Serve(int fd);
+  void Serve(SocketHandle fd);
   void Enqueue(std::unique_ptr<Item> item);
   // Turns a received picture into what the vendor runtime would deliver for
   // this receiver's colour format (FourCC, 16-pixel stride); false when it
@@ -78,14 +79,17 @@ class Receiver {
   const std::int32_t bandwidth_;
   const std::int32_t color_format_;
   const std::shared_ptr<BufferPool> pool_;
-  int wake_fd_ = -1;
+  Waker wake_;
   std::atomic<bool> stop_{false};
+  // Set when a write on the connection failed: the network thread ends it
+  // (a poll does not report our own shutdown everywhere).
+  std::atomic<bool> broken_{false};
   std::atomic<bool> connected_{false};
   std::atomic<bool> ptz_{false};
   std::thread thread_;
 
   std::mutex write_mutex_;  // guards fd_ (for writes; closed under it) and tally_
-  int fd_ = -1;
+  SocketHandle fd_ = kNoSocket;
   ndi_tally tally_{false, false};
 
   mutable std::mutex mutex_;  // guards the queue, the counts and held_

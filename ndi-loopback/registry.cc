@@ -1,23 +1,18 @@
 #include "ndi-loopback/registry.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <atomic>
 #include <cctype>
-#include <cerrno>
+#include <chrono>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
+#include <filesystem>
 #include <map>
+#include <system_error>
 
+#include "ndi-loopback/registry_system.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/proc_stat.h"
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 
 namespace ndilb {
 namespace {
@@ -27,9 +22,8 @@ constexpr const char* kGoneSuffix = ".gone";
 constexpr std::size_t kMaxEntryBytes = 4096;
 
 std::int64_t RealtimeNs() {
-  timespec ts{};
-  ::clock_gettime(CLOCK_REALTIME, &ts);
-  return std::int64_t{ts.tv_sec} * 1'000'000'000 + ts.tv_nsec;
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(std::chrono::system_clock::now().time_since_epoch())
+      .count();
 }
 
 bool EndsWith(const std::string& s, const char* suffix) {
@@ -38,19 +32,8 @@ bool EndsWith(const std::string& s, const char* suffix) {
 }
 
 bool ReadSmallFile(const std::string& path, std::string* out) {
-  const int fd = pm::RetryEintr([&] { return ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW); });
-  if (fd < 0) return false;
-  char buffer[kMaxEntryBytes + 1];
-  std::size_t have = 0;
-  while (have < sizeof buffer) {
-    const ssize_t n = pm::RetryEintr([&] { return ::read(fd, buffer + have, sizeof buffer - have); });
-    if (n <= 0) break;
-    have += static_cast<std::size_t>(n);
-  }
-  ::close(fd);
-  if (have > kMaxEntryBytes) return false;  // not one of ours
-  out->assign(buffer, have);
-  return true;
+  // Anything longer is not one of ours.
+  return sys::ReadSmallFile(path, kMaxEntryBytes, out) && out->size() <= kMaxEntryBytes;
 }
 
 std::string Clean(const std::string& text) {
@@ -67,14 +50,13 @@ std::string RegistryDir() {
   std::string dir;
   if (const char* env = std::getenv("NDI_LOOPBACK_DIR"); env != nullptr && env[0] != '\0') {
     dir = env;
-  } else if (const char* xdg = std::getenv("XDG_RUNTIME_DIR"); xdg != nullptr && xdg[0] != '\0') {
-    dir = std::string(xdg) + "/ndi-loopback";
   } else {
-    dir = "/tmp/ndi-loopback-" + std::to_string(::getuid());
+    dir = sys::DefaultRegistryDir();
   }
-  if (::mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) {
+  int error = 0;
+  if (!sys::MakePrivateDir(dir, &error)) {
     pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot create registry folder %s: %s", dir.c_str(),
-            pm::ErrnoText(errno).c_str());
+            pm::SystemErrorText(error).c_str());
   }
   return dir;
 }
@@ -94,33 +76,22 @@ std::string EntryText(const RegistryEntry& e) {
 bool Publish(const std::string& dir, const std::string& path, const std::string& text, bool quiet = false) {
   static std::atomic<unsigned> serial{0};
   const std::string temp =
-      dir + "/." + std::to_string(::getpid()) + "-" + std::to_string(serial.fetch_add(1)) + ".tmp";
-  const int fd = pm::RetryEintr(
-      [&] { return ::open(temp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600); });
-  if (fd < 0) {
+      dir + "/." + std::to_string(pm::CurrentProcessId()) + "-" + std::to_string(serial.fetch_add(1)) + ".tmp";
+  int error = 0;
+  if (!sys::WriteNewFile(temp, text, &error)) {
     if (!quiet) {
       pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot write registry entry %s: %s", temp.c_str(),
-              pm::ErrnoText(errno).c_str());
+              pm::SystemErrorText(error).c_str());
     }
+    sys::RemoveFile(temp);
     return false;
   }
-  std::size_t done = 0;
-  bool ok = true;
-  while (done < text.size()) {
-    const ssize_t n = pm::RetryEintr([&] { return ::write(fd, text.data() + done, text.size() - done); });
-    if (n <= 0) {
-      ok = false;
-      break;
-    }
-    done += static_cast<std::size_t>(n);
-  }
-  ::close(fd);
-  if (!ok || ::rename(temp.c_str(), path.c_str()) != 0) {
+  if (!sys::RenameFile(temp, path, &error)) {
     if (!quiet) {
       pm::Log(pm::LogType::Normal, "", "ndi-loopback: cannot publish registry entry %s: %s", path.c_str(),
-              pm::ErrnoText(errno).c_str());
+              pm::SystemErrorText(error).c_str());
     }
-    ::unlink(temp.c_str());
+    sys::RemoveFile(temp);
     return false;
   }
   return true;
@@ -130,7 +101,7 @@ bool Publish(const std::string& dir, const std::string& path, const std::string&
 // e.gone; false when the ".gone" entry cannot be written.
 bool Retire(const std::string& dir, const std::string& base, const RegistryEntry& e, bool quiet) {
   if (!Publish(dir, dir + "/" + base + kGoneSuffix, EntryText(e), quiet)) return false;
-  ::unlink((dir + "/" + base + kSuffix).c_str());
+  sys::RemoveFile(dir + "/" + base + kSuffix);
   return true;
 }
 
@@ -155,11 +126,11 @@ void RetireRegistryEntry(const std::string& path) {
   std::string text;
   RegistryEntry e;
   if (!ReadSmallFile(path, &text) || !ParseRegistryEntry(text, &e)) {
-    ::unlink(path.c_str());
+    sys::RemoveFile(path);
     return;
   }
   e.gone = RealtimeNs();
-  if (!Retire(dir, file.substr(0, file.size() - std::strlen(kSuffix)), e, false)) ::unlink(path.c_str());
+  if (!Retire(dir, file.substr(0, file.size() - std::strlen(kSuffix)), e, false)) sys::RemoveFile(path);
 }
 
 namespace {
@@ -209,22 +180,13 @@ bool ParseRegistryEntry(const std::string& text, RegistryEntry* out) {
   return true;
 }
 
-bool ProcessAlive(int pid) {
-  if (pid <= 0) return false;
-  if (::kill(pid, 0) != 0 && errno == ESRCH) return false;
-  // A killed child that its parent has not reaped yet still answers kill().
-  pm::ProcStat stat;
-  return !(pm::ReadProcStat(pid, &stat) && (stat.state == 'Z' || stat.state == 'X'));
-}
-
 std::vector<RegistryEntry> ListRegistry() {
   const std::string dir = RegistryDir();
   const std::int64_t now = RealtimeNs();
   std::map<std::string, RegistryEntry> byName;  // per name, the entry made first
-  DIR* d = ::opendir(dir.c_str());
-  if (d == nullptr) return {};
-  while (dirent* ent = ::readdir(d)) {
-    const std::string file = ent->d_name;
+  std::error_code error;
+  for (std::filesystem::directory_iterator at(dir, error), end; !error && at != end; at.increment(error)) {
+    const std::string file = at->path().filename().string();
     const bool present = EndsWith(file, kSuffix);
     if (file[0] == '.' || (!present && !EndsWith(file, kGoneSuffix))) continue;
     std::string text;
@@ -232,7 +194,7 @@ std::vector<RegistryEntry> ListRegistry() {
     if (!ReadSmallFile(dir + "/" + file, &text) || !ParseRegistryEntry(text, &e)) continue;
     if (present && e.gone != 0) continue;   // not one of ours
     if (!present && e.gone == 0) continue;
-    if (present && !ProcessAlive(e.pid)) {
+    if (present && !pm::ProcessAlive(e.pid)) {
       // Found gone just now. Where that cannot be written down (a folder
       // this process may not write), it is not listed at all: each look
       // would find it gone "just now" again.
@@ -244,7 +206,7 @@ std::vector<RegistryEntry> ListRegistry() {
       // is not listed either.
       const std::int64_t goneMs = (now - e.gone) / 1'000'000;
       if (goneMs < 0 || goneMs >= kListedAfterGoneMs) {
-        if (goneMs >= kKeptAfterGoneMs || goneMs <= -kKeptAfterGoneMs) ::unlink((dir + "/" + file).c_str());
+        if (goneMs >= kKeptAfterGoneMs || goneMs <= -kKeptAfterGoneMs) sys::RemoveFile(dir + "/" + file);
         continue;
       }
     }
@@ -253,7 +215,6 @@ std::vector<RegistryEntry> ListRegistry() {
       it->second = std::move(e);
     }
   }
-  ::closedir(d);
   std::vector<RegistryEntry> entries;
   entries.reserve(byName.size());
   for (auto& [name, e] : byName) entries.push_back(std::move(e));
@@ -261,9 +222,7 @@ std::vector<RegistryEntry> ListRegistry() {
 }
 
 std::string FullSourceName(const std::string& name) {
-  char host[256] = {};
-  if (::gethostname(host, sizeof host - 1) != 0 || host[0] == '\0') std::strcpy(host, "localhost");
-  std::string upper = host;
+  std::string upper = pm::HostName();
   for (char& c : upper) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
   return upper + " (" + name + ")";
 }

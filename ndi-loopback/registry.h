@@ -61,9 +61,6 @@ std::vector<RegistryEntry> ListRegistry();
 // Parses one entry's text; false when malformed.
 bool ParseRegistryEntry(const std::string& text, RegistryEntry* out);
 
-// Whether the process exists and is not a zombie.
-bool ProcessAlive(int pid);
-
 // "HOSTNAME (name)" with the host name upper-cased.
 std::string FullSourceName(const std::string& name);
 

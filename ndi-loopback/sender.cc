@@ -1,10 +1,5 @@
 #include "ndi-loopback/sender.h"
 
-#include <poll.h>
-#include <sys/socket.h>
-#include <time.h>
-#include <unistd.h>
-
 #include <chrono>
 #include <cstring>
 
@@ -13,7 +8,7 @@
 #include "ndi-loopback/registry.h"
 #include "pm/runtime/clock.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 #include "pm/runtime/thread_name.h"
 
 namespace ndilb {
@@ -32,14 +27,13 @@ std::string TextOf(const ndi_metadata_frame& frame) {
   return std::string(frame.data);
 }
 
-iovec Iov(const void* p, std::size_t n) { return iovec{const_cast<void*>(p), n}; }
+Piece Iov(const void* p, std::size_t n) { return Piece{p, n}; }
 
 }  // namespace
 
 std::int64_t NowTimestamp() {
-  timespec ts{};
-  ::clock_gettime(CLOCK_REALTIME, &ts);
-  return static_cast<std::int64_t>(ts.tv_sec) * 10'000'000 + ts.tv_nsec / 100;
+  const auto since_1970 = std::chrono::system_clock::now().time_since_epoch();
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(since_1970).count() / 100;
 }
 
 bool AnnouncesPtz(const std::string& xml) {
@@ -54,20 +48,15 @@ std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
   std::unique_ptr<Sender> s(new Sender());
   const std::string short_name = settings.ndi_name != nullptr && settings.ndi_name[0] != '\0'
                                      ? settings.ndi_name
-                                     : "sender " + std::to_string(::getpid());
+                                     : "sender " + std::to_string(pm::CurrentProcessId());
   s->name_ = FullSourceName(short_name);
   s->clock_video_ = settings.clock_video;
   int port = 0;
   s->listen_fd_ = ListenLoopback(&port);
-  if (s->listen_fd_ < 0) return nullptr;
-  s->wake_fd_ = MakeWakeFd();
-  if (s->wake_fd_ < 0) {
-    pm::Log(pm::LogType::Normal, "", "ndi-loopback: eventfd failed: %s", pm::ErrnoText(errno).c_str());
-    return nullptr;
-  }
+  if (s->listen_fd_ == kNoSocket || !s->wake_.ok()) return nullptr;  // logged
   s->url_ = "127.0.0.1:" + std::to_string(port);
   s->thread_ = std::thread([p = s.get()] { p->Run(); });
-  s->registry_path_ = WriteRegistryEntry(RegistryEntry{s->name_, s->url_, static_cast<int>(::getpid())});
+  s->registry_path_ = WriteRegistryEntry(RegistryEntry{s->name_, s->url_, pm::CurrentProcessId()});
   if (s->registry_path_.empty()) return nullptr;  // the destructor stops the thread
   return s;
 }
@@ -75,7 +64,7 @@ std::unique_ptr<Sender> Sender::Create(const ndi_send_create& settings) {
 Sender::~Sender() {
   RetireRegistryEntry(registry_path_);
   stop_ = true;
-  if (wake_fd_ >= 0) Wake(wake_fd_);
+  wake_.Wake();
   if (thread_.joinable()) thread_.join();
   std::vector<std::shared_ptr<Conn>> conns;
   {
@@ -84,44 +73,47 @@ Sender::~Sender() {
   }
   for (auto& c : conns) {
     std::lock_guard<std::mutex> lock(c->write_mutex);
-    if (c->fd >= 0) ::close(c->fd);
-    c->fd = -1;
+    CloseSocket(c->fd);
+    c->fd = kNoSocket;
     c->dead = true;
   }
-  if (listen_fd_ >= 0) ::close(listen_fd_);
-  if (wake_fd_ >= 0) ::close(wake_fd_);
+  CloseSocket(listen_fd_);
 }
 
 void Sender::Run() {
   pm::SetThreadName("ndi-lb sender");
-  std::vector<pollfd> fds;
+  std::vector<pm::ip::sys::PollEntry> fds;
   std::vector<std::shared_ptr<Conn>> polled;
   while (!stop_) {
     fds.clear();
     polled.clear();
-    fds.push_back({wake_fd_, POLLIN, 0});
-    fds.push_back({listen_fd_, POLLIN, 0});
+    fds.push_back({wake_.handle(), false, false});
+    fds.push_back({listen_fd_, false, false});
     {
       std::lock_guard<std::mutex> lock(mutex_);
       polled = conns_;
     }
     bool waiting_for_hello = false;
     for (auto& c : polled) {
-      fds.push_back({c->fd, POLLIN, 0});
+      fds.push_back({c->fd, false, false});
       waiting_for_hello = waiting_for_hello || !c->hello;
     }
-    const int n = pm::RetryEintr([&] { return ::poll(fds.data(), fds.size(), waiting_for_hello ? 250 : -1); });
+    int n = 0;
+    do {
+      n = pm::ip::sys::Poll(fds.data(), fds.size(), waiting_for_hello ? 250 : -1);
+    } while (n < 0 && pm::ip::LastSocketError::Read().Interrupted());
     if (n < 0) {
-      pm::Log(pm::LogType::Normal, "", "ndi-loopback: sender poll failed: %s", pm::ErrnoText(errno).c_str());
+      pm::Log(pm::LogType::Normal, "", "ndi-loopback: sender poll failed: %s",
+              pm::ip::ErrorText(pm::ip::LastSocketError::Read()).c_str());
       break;
     }
-    if (fds[0].revents != 0) Drain(wake_fd_);
+    if (fds[0].ready) wake_.Drain();
     if (stop_) break;
-    if (fds[1].revents != 0) Accept();
+    if (fds[1].ready) Accept();
     const std::int64_t now = pm::SteadyNowNs();
     for (std::size_t i = 0; i < polled.size(); ++i) {
       Conn& c = *polled[i];
-      if (fds[i + 2].revents != 0 && !ReadFrom(c)) {
+      if (c.broken.load() || (fds[i + 2].ready && !ReadFrom(c))) {
         Drop(polled[i]);
       } else if (!c.hello && now - c.accepted_ns > kHelloTimeoutNs) {
         pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a connection that never said hello", name_.c_str());
@@ -133,8 +125,8 @@ void Sender::Run() {
 }
 
 void Sender::Accept() {
-  const int fd = pm::RetryEintr([&] { return ::accept4(listen_fd_, nullptr, nullptr, SOCK_CLOEXEC); });
-  if (fd < 0) return;
+  const SocketHandle fd = AcceptFrom(listen_fd_);
+  if (fd == kNoSocket) return;
   TuneConnection(fd, kSendTimeoutMs);
   std::lock_guard<std::mutex> lock(mutex_);
   conns_.push_back(std::make_shared<Conn>(fd, pm::SteadyNowNs()));
@@ -144,9 +136,14 @@ bool Sender::ReadFrom(Conn& conn) {
   for (;;) {
     std::span<std::uint8_t> span = conn.decoder.WritableSpan();
     if (span.empty()) return false;
-    const ssize_t n = pm::RetryEintr([&] { return ::recv(conn.fd, span.data(), span.size(), MSG_DONTWAIT); });
+    std::int64_t n = 0;
+    pm::ip::LastSocketError error;
+    do {
+      n = pm::ip::sys::Receive(conn.fd, span.data(), span.size(), pm::ip::sys::ReceiveMode::kDontWait);
+      error = n < 0 ? pm::ip::LastSocketError::Read() : pm::ip::LastSocketError{};
+    } while (n < 0 && error.Interrupted());
     if (n == 0) return false;
-    if (n < 0) return errno == EAGAIN || errno == EWOULDBLOCK;
+    if (n < 0) return error.WouldBlock();
     if (!conn.decoder.Commit(static_cast<std::size_t>(n))) {
       pm::Log(pm::LogType::Normal, "", "ndi-loopback: %s dropped a receiver connection: %s", name_.c_str(),
               conn.decoder.error().c_str());
@@ -180,12 +177,12 @@ bool Sender::Handle(Conn& conn, Message& m) {
       // a status change) before it captures the connection metadata.
       std::lock_guard<std::mutex> lock(conn.write_mutex);
       EncodedHead ready = EncodeReady(ptz);
-      iovec iov[1] = {Iov(ready.bytes, ready.size)};
+      Piece iov[1] = {Iov(ready.bytes, ready.size)};
       if (conn.dead || !WriteAll(conn.fd, iov, 1)) return false;
       for (const std::string& xml : metadata) {
         if (AnnouncesPtz(xml)) continue;
         EncodedHead head = EncodeMetadata(MessageType::ConnMetadata, 0, static_cast<std::uint32_t>(xml.size()));
-        iovec parts[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+        Piece parts[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
         if (conn.dead || !WriteAll(conn.fd, parts, 2)) return false;
       }
       if (!WriteTallyEcho(conn, m.on_program, m.on_preview)) return false;
@@ -233,7 +230,7 @@ bool Sender::WriteTallyEcho(Conn& conn, bool on_program, bool on_preview) {
   const std::string xml = std::string("<ndi_tally_echo on_program=\"") + (on_program ? "true" : "false") +
                           "\" on_preview=\"" + (on_preview ? "true" : "false") + "\"/>";
   EncodedHead head = EncodeMetadata(MessageType::Metadata, 0, static_cast<std::uint32_t>(xml.size()));
-  iovec iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
+  Piece iov[2] = {Iov(head.bytes, head.size), Iov(xml.data(), xml.size())};
   return !conn.dead && WriteAll(conn.fd, iov, 2);
 }
 
@@ -254,8 +251,8 @@ void Sender::UpdateTallyLocked() {
 void Sender::Drop(const std::shared_ptr<Conn>& conn) {
   {
     std::lock_guard<std::mutex> lock(conn->write_mutex);
-    if (conn->fd >= 0) ::close(conn->fd);
-    conn->fd = -1;
+    CloseSocket(conn->fd);
+    conn->fd = kNoSocket;
     conn->dead = true;
   }
   std::lock_guard<std::mutex> lock(mutex_);
@@ -273,13 +270,17 @@ void Sender::Drop(const std::shared_ptr<Conn>& conn) {
   }
 }
 
-bool Sender::WriteTo(Conn& conn, iovec* iov, int count) {
-  std::lock_guard<std::mutex> lock(conn.write_mutex);
-  if (conn.dead) return false;
-  if (WriteAll(conn.fd, iov, count)) return true;
-  // The I/O thread sees the shut-down socket and drops the connection.
-  conn.dead = true;
-  ::shutdown(conn.fd, SHUT_RDWR);
+bool Sender::WriteTo(Conn& conn, Piece* pieces, int count) {
+  {
+    std::lock_guard<std::mutex> lock(conn.write_mutex);
+    if (conn.dead) return false;
+    if (WriteAll(conn.fd, pieces, count)) return true;
+    conn.dead = true;
+    ShutdownSocket(conn.fd);
+  }
+  // The I/O thread drops the connection at its next pass.
+  conn.broken = true;
+  wake_.Wake();
   return false;
 }
 
@@ -349,7 +350,7 @@ void Sender::SendVideo(const ndi_video_frame_v2& frame) {
     const bool full = c->bandwidth == kNdiBandwidthHighest || c->bandwidth > kNdiBandwidthAudioOnly;
     if (full || (c->bandwidth == kNdiBandwidthLowest && proxy_same)) {
       EncodedHead head = EncodeVideo(info, static_cast<std::uint32_t>(text.size()), bytes);
-      iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(frame.data, bytes)};
+      Piece iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(frame.data, bytes)};
       WriteTo(*c, iov, 3);
     } else if (c->bandwidth == kNdiBandwidthLowest) {
       if (!proxy_done) {
@@ -363,7 +364,7 @@ void Sender::SendVideo(const ndi_video_frame_v2& frame) {
       small.yres = proxy.yres;
       small.line_stride = proxy.stride;
       EncodedHead head = EncodeVideo(small, static_cast<std::uint32_t>(text.size()), proxy.bytes.size());
-      iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()),
+      Piece iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()),
                       Iov(proxy.bytes.data(), proxy.bytes.size())};
       WriteTo(*c, iov, 3);
     }
@@ -407,7 +408,7 @@ void Sender::SendAudio(const ndi_audio_frame_v2& frame) {
   for (const auto& c : conns) {
     if (c->bandwidth == kNdiBandwidthMetadataOnly) continue;
     EncodedHead head = EncodeAudio(info, static_cast<std::uint32_t>(text.size()), bytes);
-    iovec iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(data, bytes)};
+    Piece iov[3] = {Iov(head.bytes, head.size), Iov(text.data(), text.size()), Iov(data, bytes)};
     WriteTo(*c, iov, 3);
   }
 }
@@ -418,7 +419,7 @@ void Sender::SendMetadata(const ndi_metadata_frame& frame) {
   const std::int64_t timecode = frame.timecode == kNdiSendTimecodeSynthesize ? NowTimestamp() : frame.timecode;
   for (const auto& c : ActiveConns()) {
     EncodedHead head = EncodeMetadata(MessageType::Metadata, timecode, static_cast<std::uint32_t>(text.size()));
-    iovec iov[2] = {Iov(head.bytes, head.size), Iov(text.data(), text.size())};
+    Piece iov[2] = {Iov(head.bytes, head.size), Iov(text.data(), text.size())};
     WriteTo(*c, iov, 2);
   }
 }

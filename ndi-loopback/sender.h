@@ -9,8 +9,6 @@
 // Lock order: Sender::mutex_ and a Conn's write_mutex are never held
 // together (frame writes copy the connection list under mutex_, release it,
 // then take each Conn's lock in turn); at most one Conn lock at a time.
-#include <sys/uio.h>
-
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
@@ -22,6 +20,7 @@
 #include <thread>
 #include <vector>
 
+#include "ndi-loopback/net.h"
 #include "ndi-loopback/wire.h"
 #include "ndi/ndi_abi.h"
 
@@ -50,10 +49,13 @@ class Sender {
 
  private:
   struct Conn {
-    Conn(int f, std::int64_t now_ns) : fd(f), accepted_ns(now_ns), decoder(SenderSideLimits(), nullptr) {}
+    Conn(SocketHandle f, std::int64_t now_ns) : fd(f), accepted_ns(now_ns), decoder(SenderSideLimits(), nullptr) {}
     std::mutex write_mutex;  // guards fd (for writes and the close) and dead
-    int fd;
+    SocketHandle fd;
     bool dead = false;
+    // Set with dead by a failed write; the I/O thread drops the connection
+    // (a poll does not report our own shutdown everywhere).
+    std::atomic<bool> broken{false};
     const std::int64_t accepted_ns;  // steady clock
     Decoder decoder;          // I/O thread only
     bool hello = false;       // I/O thread only
@@ -74,7 +76,7 @@ class Sender {
   bool Handle(Conn& conn, Message& message);
   void Drop(const std::shared_ptr<Conn>& conn);
   // Writes one message to a connection; marks it dead on failure.
-  bool WriteTo(Conn& conn, iovec* iov, int count);
+  bool WriteTo(Conn& conn, Piece* pieces, int count);
   std::vector<std::shared_ptr<Conn>> ActiveConns();
   void UpdateTallyLocked();
   // The vendor runtime's answer to a receiver's tally, sent to that receiver
@@ -87,8 +89,8 @@ class Sender {
   std::string url_;
   std::string registry_path_;
   bool clock_video_ = false;
-  int listen_fd_ = -1;
-  int wake_fd_ = -1;
+  SocketHandle listen_fd_ = kNoSocket;
+  Waker wake_;
   std::atomic<bool> stop_{false};
   std::thread thread_;
 
@@ -116,7 +118,8 @@ class Sender {
 // support from it (a status change) and never capture it as metadata.
 bool AnnouncesPtz(const std::string& xml);
 
-// Sender's clock for frame stamps: CLOCK_REALTIME in 100 ns units.
+// Sender's clock for frame stamps: the system's wall clock (since 1970) in
+// 100 ns units.
 std::int64_t NowTimestamp();
 
 }  // namespace ndilb

@@ -4,19 +4,19 @@
 // With --sizes the picture size changes every --frames-per-size frames (round
 // and round through the list), each change announced as
 // {"event":"size","width":W,"height":H,"frame":N} before frame N goes out.
-#include <signal.h>
 #include <tinyxml2.h>
-#include <unistd.h>
 
 #include <CLI/CLI.hpp>
 #include <atomic>
 #include <chrono>
 #include <cmath>
+#include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <memory>
 #include <optional>
 #include <mutex>
+#include <numbers>
 #include <nlohmann/json.hpp>
 #include <set>
 #include <string>
@@ -25,6 +25,7 @@
 
 #include "ndi-testsrc/pattern.h"
 #include "ndi/ndi_abi.h"
+#include "pm/runtime/system.h"
 
 namespace {
 
@@ -72,9 +73,7 @@ bool ParseRate(const std::string& text, int* n, int* d) {
 }
 
 std::string UpperHost() {
-  char host[256] = {};
-  if (::gethostname(host, sizeof host - 1) != 0 || host[0] == '\0') std::strcpy(host, "localhost");
-  std::string s = host;
+  std::string s = pm::HostName();
   for (char& c : s) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
   return s;
 }
@@ -297,7 +296,7 @@ int Run(const Options& o) {
           for (int s = 0; s < audio_samples; ++s) {
             const std::int64_t t = samples_sent + s;
             out[s] = ramp_sound ? ndits::AudioRampSample(t, c)
-                          : 0.25f * static_cast<float>(std::sin(2.0 * M_PI * 1000.0 * static_cast<double>(t) / o.audio_rate));
+                          : 0.25f * static_cast<float>(std::sin(2.0 * std::numbers::pi * 1000.0 * static_cast<double>(t) / o.audio_rate));
           }
         }
         ndi_audio_frame_v2 frame{};
@@ -385,10 +384,7 @@ int main(int argc, char** argv) {
     return app.exit(e) == 0 ? 0 : 2;  // help and --version: 0; a mistake on the line: 2
   }
 
-  struct sigaction action {};
-  action.sa_handler = OnSignal;
-  sigemptyset(&action.sa_mask);
-  sigaction(SIGTERM, &action, nullptr);
-  sigaction(SIGINT, &action, nullptr);
+  std::signal(SIGTERM, OnSignal);
+  std::signal(SIGINT, OnSignal);  // also Ctrl-C in a Windows console
   return Run(o);
 }

@@ -6,6 +6,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <numbers>
 #include <vector>
 
 #include "ndi-testsrc/pattern.h"
@@ -105,7 +106,7 @@ std::string CheckTone(const AudioFrame& frame) {
   if (frame.rate <= 0 || frame.channels <= 0 || frame.samples <= 0) return "empty sound";
   const auto* samples = reinterpret_cast<const float*>(frame.data);
   auto tone = [&](std::int64_t t) {
-    return static_cast<float>(0.25 * std::sin(2.0 * M_PI * 1000.0 * static_cast<double>(t) / frame.rate));
+    return static_cast<float>(0.25 * std::sin(2.0 * std::numbers::pi * 1000.0 * static_cast<double>(t) / frame.rate));
   };
   // The tone repeats every rate / gcd(rate, 1000) samples: find this
   // buffer's phase from its first samples, then check every sample.

@@ -1,9 +1,8 @@
 #include "pm-host/locate.h"
 
-#include <sys/stat.h>
-
 #include <algorithm>
 #include <filesystem>
+#include <system_error>
 
 #include "pm-host/process.h"
 #include "pm/runtime/log.h"
@@ -12,9 +11,9 @@ namespace pmhost {
 
 const char* CompanionName(Companion companion) {
   switch (companion) {
-    case Companion::Runner: return "pm-runner";
-    case Companion::Module: return "libtaskndisource.so";
-    case Companion::Sender: return "ndi-testsrc";
+    case Companion::Runner: return "pm-runner" PM_EXECUTABLE_SUFFIX;
+    case Companion::Module: return PM_MODULE_FILE;
+    case Companion::Sender: return "ndi-testsrc" PM_EXECUTABLE_SUFFIX;
   }
   return "";
 }
@@ -22,9 +21,11 @@ const char* CompanionName(Companion companion) {
 std::vector<std::string> CompanionCandidates(Companion companion) {
   const std::string name = CompanionName(companion);
   if (companion != Companion::Module) return {name, "../" + name + "/" + name};
-  // The install's own module folder first (from the configured layout), then
-  // the usual library folders, then the build tree's lib/.
-  std::vector<std::string> candidates{PM_MODULEDIR_FROM_BINDIR "/" + name};
+  // Beside the program first (a Windows build or install: one folder holds
+  // the programs, the module and the DLLs), then the install's own module
+  // folder (from the configured layout), the usual library folders, and the
+  // build tree's lib/.
+  std::vector<std::string> candidates{name, PM_MODULEDIR_FROM_BINDIR "/" + name};
   const std::string arch = PM_LIBRARY_ARCHITECTURE;
   if (!arch.empty()) candidates.push_back("../lib/" + arch + "/" PM_PACKAGE_NAME "/" + name);
   candidates.push_back("../lib/" PM_PACKAGE_NAME "/" + name);
@@ -38,9 +39,9 @@ std::vector<std::string> CompanionCandidates(Companion companion) {
 
 std::string LocateIn(Companion companion, const std::string& folder) {
   for (const std::string& candidate : CompanionCandidates(companion)) {
-    struct stat info {};
     const std::string path = folder + candidate;
-    if (::stat(path.c_str(), &info) == 0 && S_ISREG(info.st_mode)) return std::filesystem::path(path).lexically_normal();
+    std::error_code error;
+    if (std::filesystem::is_regular_file(path, error)) return std::filesystem::path(path).lexically_normal().string();
   }
   return {};
 }

@@ -1,6 +1,7 @@
 #pragma once
 // Where pm-host finds the programs it starts when no option names them:
-// relative to its own folder (/proc/self/exe), first as installed
+// relative to its own folder (/proc/self/exe), first beside it (a Windows
+// build or install keeps everything in one folder), then as installed
 // (bin/pm-runner and bin/ndi-testsrc beside bin/pm-host; the task module in
 // the package's folder under the library folder, lib/pm-ndisource or
 // lib/<multiarch>/pm-ndisource), then as built (build/pm-host/pm-host beside
@@ -13,7 +14,8 @@ namespace pmhost {
 
 enum class Companion { Runner, Module, Sender };
 
-// "pm-runner", "libtaskndisource.so", "ndi-testsrc".
+// "pm-runner", "libtaskndisource.so", "ndi-testsrc" (on Windows
+// "pm-runner.exe", "taskndisource.dll", "ndi-testsrc.exe", all in one folder).
 const char* CompanionName(Companion companion);
 
 // The paths tried, relative to the program's folder, in order.

@@ -12,28 +12,24 @@
 // Exit status: 0 success; 1 the job failed; 2 a usage error. Standard output
 // carries the results (with --json exactly one JSON document); log lines and
 // errors go to standard error.
-#include <signal.h>
-#include <unistd.h>
-
 #include <atomic>
 #include <cstdio>
 
 #include <CLI/CLI.hpp>
 #include <nlohmann/json.hpp>
 
+#include "pm-host/console.h"
 #include "pm-host/locate.h"
 #include "pm-host/process.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/context.h"
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 
 namespace {
 
 constexpr int kExitUsage = 2;
 
 std::atomic<bool> g_interrupted{false};
-
-void OnInterrupt(int) { g_interrupted = true; }
 
 // The default of --runner, --module or --sender as help shows it.
 std::string DefaultPath(pmhost::Companion companion) {
@@ -106,6 +102,12 @@ int main(int argc, char** argv) {
   demoCommand->add_option("--png", demo.png, "where to write the snapshot (relative: in the current folder)")
       ->capture_default_str();
   demoCommand->add_flag("--json", demo.json, "print the summary as one JSON document");
+#ifdef PM_NDI_VENDOR_RUNTIME
+  demo.lossy = true;  // built on the vendor runtime
+#endif
+  demoCommand->add_flag("--lossy", demo.lossy,
+                        "check the pictures within a lossy codec's tolerance (the vendor runtime's; the default when "
+                        "built on it)");
   for (CLI::App* command : {listCommand, receiveCommand, demoCommand}) AddHostOptions(command, host);
 
   try {
@@ -116,13 +118,8 @@ int main(int argc, char** argv) {
   }
 
   pm::GetContext()->logSink = [](pm::LogType, const char* line) { pm::WriteToStderr(line); };
-  struct sigaction action {};
-  action.sa_handler = OnInterrupt;
-  sigemptyset(&action.sa_mask);
-  ::sigaction(SIGINT, &action, nullptr);
-  ::sigaction(SIGTERM, &action, nullptr);
-  ::signal(SIGPIPE, SIG_IGN);
-  const pmhost::Progress progress = ::isatty(STDOUT_FILENO) ? pmhost::Progress::Terminal : pmhost::Progress::Lines;
+  pmhost::OnInterrupt(&g_interrupted);
+  const pmhost::Progress progress = pmhost::StdoutIsTerminal() ? pmhost::Progress::Terminal : pmhost::Progress::Lines;
 
   if (*listCommand) {
     list.host = host;
@@ -145,9 +142,6 @@ int main(int argc, char** argv) {
   }
   demo.host = host;
   demo.interrupted = &g_interrupted;
-#ifdef PM_NDI_VENDOR_RUNTIME
-  demo.lossy = true;  // built on the vendor runtime
-#endif
   demo.progress = demo.json ? pmhost::Progress::None : progress;
   return pmhost::RunDemo(demo);
 }

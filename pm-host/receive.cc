@@ -1,8 +1,5 @@
 #include "pm-host/receive.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <cmath>
@@ -18,12 +15,14 @@
 #include <thread>
 
 #include "pm-host/checks.h"
+#include "pm-host/files.h"
 #include "pm-host/locate.h"
 #include "pm-host/picture.h"
 #include "pm-host/wav.h"
+#include "pm/runtime/ids.h"
 #include "pm/runtime/json.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/proc_stat.h"
+#include "pm/runtime/system.h"
 #include "pm/shm/formats.h"
 
 namespace pmhost {
@@ -65,15 +64,19 @@ std::string Lower(std::string text) {
 
 bool Interrupted(const std::atomic<bool>* flag) { return flag != nullptr && flag->load(); }
 
-// Empty when `path` can be written: it is opened for writing (created when
-// missing, and then removed again), so that a run never ends by finding out
-// that its output cannot be kept.
-std::string CannotWrite(const std::string& path) {
-  const bool existed = ::access(path.c_str(), F_OK) == 0;
-  const int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_NONBLOCK | O_CLOEXEC, 0644);
-  if (fd < 0) return "cannot write " + path + ": " + std::strerror(errno);
-  ::close(fd);
-  if (!existed) ::unlink(path.c_str());
+// A new folder of ours in the system's temporary folder, named `prefix` and
+// a fresh short id; empty when none can be made.
+std::string MakePrivateTempFolder(const std::string& prefix) {
+  std::error_code error;
+  const std::filesystem::path base = std::filesystem::temp_directory_path(error);
+  if (error) return {};
+  for (int attempt = 0; attempt < 8; ++attempt) {
+    const std::filesystem::path folder = base / (prefix + pm::NewShortId());
+    if (std::filesystem::create_directory(folder, error)) {
+      std::filesystem::permissions(folder, std::filesystem::perms::owner_all, error);
+      return folder.string();
+    }
+  }
   return {};
 }
 
@@ -445,12 +448,11 @@ int RunDemo(const DemoOptions& options) {
   // With --json the one JSON document is the only thing on `out`; every
   // other line goes to `err`.
   std::FILE* info = options.json ? options.err : options.out;
-  std::string pattern = (std::filesystem::temp_directory_path() / "pm-host-demo-XXXXXX").string();
-  if (::mkdtemp(pattern.data()) == nullptr) {
+  const std::string folder = MakePrivateTempFolder("pm-host-demo-");
+  if (folder.empty()) {
     std::fprintf(options.err, "pm-host demo: cannot make a temporary folder\n");
     return 1;
   }
-  const std::string folder = pattern;
   const std::string registry = folder + "/registry";
   const std::string senderPath = options.senderPath.empty() ? Locate(Companion::Sender) : options.senderPath;
 

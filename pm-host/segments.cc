@@ -1,17 +1,6 @@
 #include "pm-host/segments.h"
 
-#include <dirent.h>
-#include <fcntl.h>
-#include <sys/mman.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
-#include <vector>
-
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
 
 namespace pmhost {
 
@@ -33,55 +22,9 @@ SegmentMapping& SegmentMapping::operator=(SegmentMapping&& other) noexcept {
   return *this;
 }
 
-void SegmentMapping::Reset() {
-  if (data_ != nullptr) ::munmap(const_cast<std::uint8_t*>(data_), size_);
-  data_ = nullptr;
-  size_ = 0;
-}
-
-SegmentMapping SegmentMapping::Open(const std::string& name, std::uint64_t size) {
-  SegmentMapping mapping;
-  if (size == 0) {
-    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: '%s' with size 0\n", name.c_str());
-    return mapping;
-  }
-  const int fd = pm::RetryEintr([&] { return ::shm_open(name.c_str(), O_RDONLY | O_CLOEXEC, 0); });
-  if (fd < 0) {
-    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot open '%s': %s\n", name.c_str(),
-            pm::ErrnoText(errno).c_str());
-    return mapping;
-  }
-  struct stat info {};
-  if (::fstat(fd, &info) != 0) {
-    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot stat '%s': %s\n", name.c_str(),
-            pm::ErrnoText(errno).c_str());
-    ::close(fd);
-    return mapping;
-  }
-  // Reading past the end of the file would raise SIGBUS: a segment smaller
-  // than the record says is refused.
-  if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) < size) {
-    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: '%s' has %lld bytes, the record says %llu\n",
-            name.c_str(), static_cast<long long>(info.st_size), static_cast<unsigned long long>(size));
-    ::close(fd);
-    return mapping;
-  }
-  void* data = ::mmap(nullptr, size, PROT_READ, MAP_SHARED, fd, 0);
-  const int err = errno;
-  ::close(fd);
-  if (data == MAP_FAILED) {
-    pm::Log(pm::LogType::Normal, "", "SegmentMapping::Open: cannot map '%s': %s\n", name.c_str(),
-            pm::ErrnoText(err).c_str());
-    return mapping;
-  }
-  mapping.data_ = static_cast<const std::uint8_t*>(data);
-  mapping.size_ = size;
-  return mapping;
-}
-
 bool ValidMemoryBase(const std::string& memoryBase) {
-  return !memoryBase.empty() && memoryBase.size() <= 200 && memoryBase.find('/') == std::string::npos &&
-         memoryBase.find('\0') == std::string::npos;
+  return !memoryBase.empty() && memoryBase.size() <= 200 && memoryBase.find_first_of(std::string("/\\\0", 3)) ==
+         std::string::npos;
 }
 
 std::shared_ptr<const SegmentMapping> SegmentCache::Map(std::uint32_t id, std::uint64_t size) {
@@ -95,7 +38,7 @@ std::shared_ptr<const SegmentMapping> SegmentCache::Map(std::uint32_t id, std::u
             memoryBase_.c_str());
     return nullptr;
   }
-  auto mapping = std::make_shared<SegmentMapping>(SegmentMapping::Open("/" + memoryBase_ + std::to_string(id), size));
+  auto mapping = std::make_shared<SegmentMapping>(SegmentMapping::Open(SegmentSystemName(memoryBase_ + std::to_string(id)), size));
   std::lock_guard<std::mutex> guard(lock_);
   if (!*mapping) {
     mappings_.erase(id);
@@ -123,44 +66,6 @@ void SegmentCache::Clear() {
 std::size_t SegmentCache::Count() const {
   std::lock_guard<std::mutex> guard(lock_);
   return mappings_.size();
-}
-
-namespace {
-
-// The names in `directory` that are memoryBase followed by digits.
-std::vector<std::string> SegmentNames(const std::string& memoryBase, const std::string& directory) {
-  std::vector<std::string> names;
-  if (!ValidMemoryBase(memoryBase)) return names;
-  DIR* dir = ::opendir(directory.c_str());
-  if (dir == nullptr) return names;
-  while (const dirent* entry = ::readdir(dir)) {
-    const std::string name = entry->d_name;
-    if (name.size() <= memoryBase.size() || name.compare(0, memoryBase.size(), memoryBase) != 0) continue;
-    bool digits = true;
-    for (std::size_t i = memoryBase.size(); i < name.size(); ++i) digits = digits && name[i] >= '0' && name[i] <= '9';
-    if (digits) names.push_back(name);
-  }
-  ::closedir(dir);
-  return names;
-}
-
-}  // namespace
-
-int CountSegments(const std::string& memoryBase, const std::string& directory) {
-  return static_cast<int>(SegmentNames(memoryBase, directory).size());
-}
-
-int RemoveSegments(const std::string& memoryBase, const std::string& directory) {
-  int removed = 0;
-  for (const std::string& name : SegmentNames(memoryBase, directory)) {
-    if (::shm_unlink(("/" + name).c_str()) == 0) {
-      ++removed;
-    } else if (errno != ENOENT) {
-      pm::Log(pm::LogType::Normal, "", "RemoveSegments: cannot remove '%s': %s\n", name.c_str(),
-              pm::ErrnoText(errno).c_str());
-    }
-  }
-  return removed;
 }
 
 }  // namespace pmhost

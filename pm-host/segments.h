@@ -1,7 +1,10 @@
 #pragma once
 // The host's view of a queue's shared-memory segments: read-only mappings of
-// "/" + memoryBase + id, cached per id, and the removal of segments that a
-// crashed runner left behind.
+// memoryBase + id, cached per id, and the removal of segments that a crashed
+// runner left behind. The system calls are one file per platform:
+// segments_posix.cc (POSIX named shared memory "/" + memoryBase + id) and
+// segments_win.cc (named file mappings memoryBase + id, which the system
+// removes with their last handle, so nothing is ever left to remove).
 //
 // Threads: a SegmentCache is shared by the queue's reader thread (Map) and the
 // dispatcher's receive thread (Forget on "::delete_memory"). A mapping handed
@@ -30,8 +33,9 @@ class SegmentMapping {
   SegmentMapping(const SegmentMapping&) = delete;
   SegmentMapping& operator=(const SegmentMapping&) = delete;
 
-  // Maps `size` bytes of the segment `name` ("/..."). Empty on failure
-  // (logged): no such segment, or one smaller than `size`.
+  // Maps `size` bytes of the segment whose system name is `name`
+  // (SegmentSystemName). Empty on failure (logged): no such segment, or one
+  // smaller than `size`.
   static SegmentMapping Open(const std::string& name, std::uint64_t size);
 
   const std::uint8_t* Data() const { return data_; }
@@ -44,8 +48,13 @@ class SegmentMapping {
   std::uint64_t size_ = 0;
 };
 
-// True when `memoryBase` can name segments: 1..200 bytes, no '/', no NUL.
+// True when `memoryBase` can name segments: 1..200 bytes, no '/', no '\',
+// no NUL.
 bool ValidMemoryBase(const std::string& memoryBase);
+
+// The system's name of the segment `name` (memoryBase + id): "/" + name for
+// POSIX shared memory, the name itself for a Windows file mapping.
+std::string SegmentSystemName(const std::string& name);
 
 class SegmentCache {
  public:
@@ -68,7 +77,7 @@ class SegmentCache {
 };
 
 // Removes every segment named memoryBase + decimal id from /dev/shm (what a
-// runner that crashed leaves behind). Returns how many were removed. Does
+// runner that crashed leaves behind; nothing on Windows). Returns how many were removed. Does
 // nothing for a memory base that cannot name segments. `directory` is for
 // tests; segments are always removed with shm_unlink.
 int RemoveSegments(const std::string& memoryBase, const std::string& directory = "/dev/shm");

@@ -16,16 +16,9 @@
 //
 // Threads: the main thread does all the set-up and the shutdown; each
 // dispatcher has a receive thread (runs the task's handlers) and an expiry
-// thread. Dispatchers report their end through a self-pipe that the main
-// thread polls; the signal handlers only write to that pipe.
+// thread. Dispatchers report their end, and the system its stop requests,
+// through stop_signal.h, on which the main thread waits.
 
-#include <dlfcn.h>
-#include <fcntl.h>
-#include <poll.h>
-#include <signal.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <chrono>
 #include <condition_variable>
 #include <cstdio>
@@ -41,72 +34,24 @@
 #include <CLI/CLI.hpp>
 
 #include "pm/ipc/connection.h"
+#include "pm-runner/stop_signal.h"
 #include "pm/ipc/dispatcher.h"
 #include "pm/runtime/context.h"
+#include "pm/runtime/export.h"
+#include "pm/runtime/library.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 #include "pm/task/task.h"
 
 namespace {
 
 pm::Context g_context;
 
-// The self-pipe: written by the signal handlers ('S') and by dispatchers whose
-// receiving side ended ('E'); read by the main thread.
-int g_wakeRead = -1;
-int g_wakeWrite = -1;
-
 constexpr int kExitFailed = 1;
 constexpr int kExitUsage = 2;
 constexpr int kExitModuleCannotRun = 3;
 constexpr int kExitNoConnection = 4;
 constexpr auto kStopLimit = std::chrono::seconds(5);
-
-void Wake(char reason) {
-  const int saved = errno;
-  [[maybe_unused]] ssize_t n = ::write(g_wakeWrite, &reason, 1);  // a full pipe already wakes
-  errno = saved;
-}
-
-void OnStopSignal(int) { Wake('S'); }
-
-bool InstallSignalHandlers() {
-  int fds[2];
-  if (::pipe2(fds, O_CLOEXEC | O_NONBLOCK) != 0) {
-    pm::Log(pm::LogType::Normal, "", "pm-runner: pipe failed: %s\n", pm::ErrnoText(errno).c_str());
-    return false;
-  }
-  g_wakeRead = fds[0];
-  g_wakeWrite = fds[1];
-  struct sigaction action {};
-  action.sa_handler = OnStopSignal;
-  sigemptyset(&action.sa_mask);
-  action.sa_flags = SA_RESTART;
-  ::sigaction(SIGINT, &action, nullptr);
-  ::sigaction(SIGTERM, &action, nullptr);
-  // Sends use MSG_NOSIGNAL; this also covers a host that closed our stderr.
-  ::signal(SIGPIPE, SIG_IGN);
-  return true;
-}
-
-// Keeps SIGINT/SIGTERM away from the worker threads started while it lives,
-// so that they land on the main thread.
-class BlockStopSignals {
- public:
-  BlockStopSignals() {
-    sigset_t set;
-    sigemptyset(&set);
-    sigaddset(&set, SIGINT);
-    sigaddset(&set, SIGTERM);
-    pthread_sigmask(SIG_BLOCK, &set, &previous_);
-  }
-  ~BlockStopSignals() { pthread_sigmask(SIG_SETMASK, &previous_, nullptr); }
-  BlockStopSignals(const BlockStopSignals&) = delete;
-  BlockStopSignals& operator=(const BlockStopSignals&) = delete;
-
- private:
-  sigset_t previous_;
-};
 
 // Ends the process with status 1 when the orderly shutdown has not finished
 // within kStopLimit: a worker that does not stop must not keep it alive.
@@ -148,19 +93,14 @@ void WaitForTheEnd(const std::vector<std::shared_ptr<pm::RpcDispatcher>>& dispat
       pm::Log(pm::LogType::Normal, "", "pm-runner: every connection has ended\n");
       return;
     }
-    pollfd pfd{g_wakeRead, POLLIN, 0};
-    const int ready = ::poll(&pfd, 1, -1);
-    if (ready < 0 && errno != EINTR) {
-      pm::Log(pm::LogType::Normal, "", "pm-runner: poll failed: %s\n", pm::ErrnoText(errno).c_str());
-      return;
-    }
-    char buffer[64];
-    ssize_t n = 0;
-    while ((n = ::read(g_wakeRead, buffer, sizeof buffer)) > 0) {
-      if (std::memchr(buffer, 'S', static_cast<std::size_t>(n)) != nullptr) {
+    switch (pmrunner::WaitForWake()) {
+      case pmrunner::Wake::kStop:
         pm::Log(pm::LogType::Normal, "", "pm-runner: stop signal received\n");
         return;
-      }
+      case pmrunner::Wake::kFailed:
+        return;
+      case pmrunner::Wake::kEnded:
+        break;
     }
   }
 }
@@ -170,7 +110,7 @@ using TaskFactory = pm::TaskBase* (*)();
 }  // namespace
 
 // The process-wide context of this runner and of every module it loads.
-extern "C" __attribute__((visibility("default"))) pm::Context* QFProcessManagementGlobals() {
+extern "C" PM_EXPORT pm::Context* QFProcessManagementGlobals() {
   return &g_context;
 }
 
@@ -196,14 +136,15 @@ int main(int argc, char** argv) {
   // Every line of the runner and of the task goes to stderr unchanged.
   pm::Context* context = pm::GetContext();
   context->logSink = [](pm::LogType, const char* line) { pm::WriteToStderr(line); };
-  if (!InstallSignalHandlers()) return kExitFailed;
+  if (!pmrunner::InstallStopHandlers()) return kExitFailed;
 
-  void* module = ::dlopen(modulePath.c_str(), RTLD_NOW | RTLD_LOCAL);
+  void* module = pm::OpenLibrary(modulePath);
   if (module == nullptr) {
-    pm::Log(pm::LogType::Normal, "", "pm-runner: cannot load '%s': %s\n", modulePath.c_str(), ::dlerror());
+    const std::string reason = pm::LastLibraryError();
+    pm::Log(pm::LogType::Normal, "", "pm-runner: cannot load '%s': %s\n", modulePath.c_str(), reason.c_str());
     return kExitModuleCannotRun;
   }
-  auto factory = reinterpret_cast<TaskFactory>(::dlsym(module, "pmTask_Factory"));
+  auto factory = reinterpret_cast<TaskFactory>(pm::FindSymbol(module, "pmTask_Factory"));
   if (factory == nullptr) {
     pm::Log(pm::LogType::Normal, "", "pm-runner: '%s' has no pmTask_Factory\n", modulePath.c_str());
     return kExitModuleCannotRun;
@@ -214,7 +155,7 @@ int main(int argc, char** argv) {
   {
     // The worker threads (the task's own and the dispatchers') start with the
     // stop signals blocked; only the main thread takes them.
-    BlockStopSignals blocked;
+    pmrunner::StopSignalsBlocked blocked;
     try {
       base = factory();
     } catch (const std::exception& e) {
@@ -256,7 +197,7 @@ int main(int argc, char** argv) {
     // a task that stops itself at the first request (StopTask on that
     // dispatcher's thread) finds every dispatcher there to stop. Started one by
     // one, a later connection joined after such a stop and kept the runner up.
-    for (auto& dispatcher : dispatchers) dispatcher->Start([] { Wake('E'); });
+    for (auto& dispatcher : dispatchers) dispatcher->Start([] { pmrunner::NotifyEnded(); });
   }
 
   WaitForTheEnd(dispatchers);

@@ -1,6 +1,6 @@
 #include "taskndisource/ndi_api.h"
 
-#include <dlfcn.h>
+#include "pm/runtime/library.h"
 
 namespace TaskNDISource {
 namespace {
@@ -9,7 +9,7 @@ namespace {
 // first missing name.
 template <typename Fn>
 bool Resolve(void* handle, const char* name, Fn* slot, std::string* missing) {
-  void* address = ::dlsym(handle, name);
+  void* address = pm::FindSymbol(handle, name);
   if (address == nullptr) {
     if (missing != nullptr) *missing = name;
     return false;
@@ -26,7 +26,7 @@ bool LoadNdiApi(const std::string& library, NdiApi* api, std::string* missing) {
   // The library stays loaded for the life of the process: the table's
   // pointers are handed to sources and discovery that may outlive any owner
   // we could give the handle.
-  void* handle = ::dlopen(library.c_str(), RTLD_NOW | RTLD_LOCAL);
+  void* handle = pm::OpenLibrary(library);
   if (handle == nullptr) {
     if (missing != nullptr) *missing = library;
     return false;

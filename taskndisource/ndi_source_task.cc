@@ -1,12 +1,11 @@
 // The NDI source task: runtime start-up, the two factories, runtime shutdown.
 #include "taskndisource/ndi_source_task.h"
 
-#include <dlfcn.h>
-#include <unistd.h>
-
 #include <utility>
 
+#include "pm/runtime/library.h"
 #include "pm/runtime/log.h"
+#include "pm/runtime/system.h"
 #include "taskndisource/discovery.h"
 #include "taskndisource/ndi_source.h"
 
@@ -33,12 +32,12 @@ pm::TaskBase* MakeTask(std::shared_ptr<const NdiApi> api) {
   pm::Log(pm::LogType::Normal, kLogTag, "Initialized NDIlib (%s)", version ? version : "");
 
   task->SetDiscoveryFactory([api](std::shared_ptr<pm::SourceDiscovery::Callbacks> callbacks) {
-    pm::Log(pm::LogType::Normal, kLogTag, "creating discovery in pid %d\n", static_cast<int>(::getpid()));
+    pm::Log(pm::LogType::Normal, kLogTag, "creating discovery in pid %d\n", pm::CurrentProcessId());
     return std::shared_ptr<pm::SourceDiscovery>(std::make_shared<Discovery>(std::move(callbacks), api));
   });
   task->SetSourceFactory([api](std::shared_ptr<pm::Source::Callbacks> callbacks, std::string uniqueId) {
     pm::Log(pm::LogType::Normal, kLogTag, "creating '%s' in pid %d\n", uniqueId.c_str(),
-            static_cast<int>(::getpid()));
+            pm::CurrentProcessId());
     return std::shared_ptr<pm::Source>(std::make_shared<NDISource>(std::move(callbacks), std::move(uniqueId), api));
   });
   return task.release();
@@ -50,8 +49,7 @@ pm::TaskBase* MakeTaskFromLibrary(const std::string& library) {
   if (!LoadNdiApi(library, api.get(), &missing)) {
     // Copied at once: the next loader call (the log's context lookup is one)
     // frees the loader's text.
-    const char* error = ::dlerror();
-    const std::string reason = error ? error : "not found";
+    const std::string reason = pm::LastLibraryError();
     if (missing == library) {
       pm::Log(pm::LogType::Normal, kLogTag, "failed initialization. Cannot load the NDI runtime '%s': %s\n",
               library.c_str(), reason.c_str());

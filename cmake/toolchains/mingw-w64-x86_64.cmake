@@ -11,9 +11,8 @@
 # default to folders under ${XDG_CACHE_HOME:-$HOME/.cache}/pm-ndisource and
 # follow the environment variables of the same names, as in the script.
 #
-# Executables and DLLs link libgcc, libstdc++ and winpthread statically, so
-# they run under Wine (and on Windows) without the compiler's DLLs beside
-# them. Tests run through CMAKE_CROSSCOMPILING_EMULATOR (Wine), so ctest and
+# Executables and DLLs import the compiler's C++ runtime DLLs, which the
+# build copies beside them (see below). Tests run through CMAKE_CROSSCOMPILING_EMULATOR (Wine), so ctest and
 # gtest_discover_tests work as in a native build.
 
 set(CMAKE_SYSTEM_NAME Windows)
@@ -63,11 +62,15 @@ set(ZLIB_USE_STATIC_LIBS ON)
 set(ENV{PKG_CONFIG_LIBDIR} "${PM_MINGW_DEPS}/lib/pkgconfig:${PM_MINGW_DEPS}/share/pkgconfig")
 set(ENV{PKG_CONFIG_PATH} "")
 
-# No compiler DLLs at run time: the C++ runtime, libgcc and winpthread are
-# linked into every executable and DLL.
-set(CMAKE_EXE_LINKER_FLAGS_INIT "-static")
-set(CMAKE_SHARED_LINKER_FLAGS_INIT "-static")
-set(CMAKE_MODULE_LINKER_FLAGS_INIT "-static")
+# One C++ runtime for the whole process: the runner and the task module hand
+# each other C++ objects (the context, dispatchers with their threads and
+# locks), which works only when both use the same libstdc++ and winpthread,
+# as programs built with a shared C runtime do. A runtime linked into each
+# module would give each its own thread table: a thread made by the runner
+# could not be joined, nor recognised, by the module. So the compiler's
+# libstdc++-6.dll, libgcc_s_seh-1.dll and libwinpthread-1.dll are imported,
+# and the build copies them beside the programs (PM_MINGW_RUNTIME_DLLS).
+set(PM_MINGW_RUNTIME_DLLS libstdc++-6.dll libgcc_s_seh-1.dll libwinpthread-1.dll)
 
 # Wine runs the .exe files for ctest and for gtest_discover_tests. It is not
 # on PATH in Debian's wine64 package; WINEDEBUG=-all keeps its own

@@ -1,22 +1,13 @@
 #include "pm/ip/socket.h"
 
-#include <arpa/inet.h>
-#include <fcntl.h>
-#include <netinet/tcp.h>
-#include <poll.h>
-#include <sys/socket.h>
-#include <sys/time.h>
-#include <sys/uio.h>
-#include <unistd.h>
-
 #include <algorithm>
-#include <cerrno>
+#include <chrono>
 #include <climits>
-#include <cstring>
+#include <thread>
 
+#include "pm/ip/socket_system.h"
 #include "pm/runtime/clock.h"
 #include "pm/runtime/log.h"
-#include "pm/runtime/syscall.h"
 
 namespace pm::ip {
 
@@ -26,49 +17,20 @@ constexpr int kListenBacklog = 5;
 constexpr int kConnectAttempts = 1024;
 constexpr std::int64_t kDefaultAcceptTimeoutMs = 60000;
 constexpr std::int64_t kAcceptFailurePauseMs = 100;
-constexpr short kPollAsk = POLLIN | POLLRDNORM | POLLRDBAND;
-constexpr short kPollReady = POLLIN | POLLRDNORM | POLLRDBAND | POLLPRI | POLLERR | POLLHUP | POLLNVAL;
+constexpr int kConnectSettleMs = 1000;
 
-sockaddr_in LoopbackAddress(int port) {
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_port = htons(static_cast<std::uint16_t>(port));
-  inet_pton(AF_INET, "127.0.0.1", &address.sin_addr);
-  return address;
-}
-
-// Keeps errno across a log call, so that callers can still classify the
-// failure that was logged.
-class KeepErrno {
+// Keeps the socket error across a log call, so that callers can still
+// classify the failure that was logged.
+class KeepSocketError {
  public:
-  KeepErrno() : saved_(errno) {}
-  ~KeepErrno() { errno = saved_; }
+  KeepSocketError() : saved_(LastSocketError::Read()) {}
+  ~KeepSocketError() { saved_.Restore(); }
 
  private:
-  int saved_;
+  LastSocketError saved_;
 };
 
 }  // namespace
-
-// ---------------------------------------------------------------------------
-// LastSocketError
-
-LastSocketError LastSocketError::Read() {
-  const int e = errno;
-  return LastSocketError{e, e};
-}
-
-bool LastSocketError::AlreadyConnected() const { return err == EISCONN; }
-
-bool LastSocketError::Interrupted() const { return err == EINTR || wsa == EINTR; }
-
-bool LastSocketError::Gone() const {
-  return wsa == ENOTSOCK || wsa == EBADF || wsa == ECONNRESET || wsa == EPIPE;
-}
-
-bool LastSocketError::TimedOut() const {
-  return wsa == ECONNABORTED || wsa == ETIMEDOUT || wsa == EAGAIN || wsa == EWOULDBLOCK;
-}
 
 std::string ErrorText(const LastSocketError& error) {
   return "[errno=" + std::to_string(error.err) + ",wsa=" + std::to_string(error.wsa) + "]";
@@ -77,32 +39,29 @@ std::string ErrorText(const LastSocketError& error) {
 // ---------------------------------------------------------------------------
 // Socket
 
-Socket::Socket() = default;
+Socket::Socket() { sys::StartOnce(); }
 
 Socket::~Socket() { Socket::Close(); }
 
 void Socket::Close() {
-  if (handle_ >= 0) {
-    // close() is not retried on EINTR: on Linux the descriptor is released
-    // whatever close() reports.
-    ::close(handle_);
-  }
-  address_ = sockaddr_in{};
-  handle_ = -1;
+  // Not retried on EINTR: on Linux the descriptor is released whatever
+  // close() reports.
+  if (handle_ != kNoSocket) sys::CloseHandle(handle_);
+  handle_ = kNoSocket;
 }
 
 bool Socket::Init(int port) {
   port_ = port;
-  address_ = LoopbackAddress(port);
-  handle_ = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
-  return handle_ >= 0;
+  shutDown_.store(false);
+  handle_ = sys::OpenTcp(false);
+  return handle_ != kNoSocket;
 }
 
 bool Socket::Bind() {
-  if (handle_ < 0) return false;
-  if (::bind(handle_, reinterpret_cast<const sockaddr*>(&address_), sizeof(address_)) != 0) {
+  if (handle_ == kNoSocket) return false;
+  if (!sys::BindLoopback(handle_, port_)) {
     const auto error = LastSocketError::Read();
-    KeepErrno keep;
+    KeepSocketError keep;
     Log(LogType::Normal, "", "ipc::Socket : Bind failed : err : %d, was : %d\n", error.err, error.wsa);
     return false;
   }
@@ -112,30 +71,29 @@ bool Socket::Bind() {
 
 int Socket::GetPort() {
   if (port_ > 0) return port_;
-  sockaddr_in bound{};
-  socklen_t length = sizeof(bound);
-  if (handle_ < 0 || ::getsockname(handle_, reinterpret_cast<sockaddr*>(&bound), &length) != 0) {
+  const int bound = handle_ == kNoSocket ? -1 : sys::LocalPort(handle_);
+  if (bound < 0) {
     const auto error = LastSocketError::Read();
-    KeepErrno keep;
+    KeepSocketError keep;
     Log(LogType::Normal, "", "ipc::Socket : Fetching assigned port failed : err : %d, was : %d\n", error.err,
         error.wsa);
     return 0;
   }
-  return ntohs(bound.sin_port);
+  return bound;
 }
 
 bool Socket::Listen() {
-  if (handle_ < 0) return false;
-  ::listen(handle_, kListenBacklog);
+  if (handle_ == kNoSocket) return false;
+  sys::Listen(handle_, kListenBacklog);
   SetBlocking(false);
   return true;
 }
 
 bool Socket::Connect() {
-  if (handle_ < 0) return false;
+  if (handle_ == kNoSocket) return false;
   LastSocketError error;
   for (int attempt = 0; attempt < kConnectAttempts; ++attempt) {
-    if (::connect(handle_, reinterpret_cast<const sockaddr*>(&address_), sizeof(address_)) == 0) {
+    if (sys::ConnectLoopback(handle_, port_) == 0) {
       SetNoDelay();
       return true;
     }
@@ -144,76 +102,79 @@ bool Socket::Connect() {
       SetNoDelay();
       return true;
     }
-    if (error.err == EALREADY) {
+    if (error.InProgress()) {
       // An interrupted connect goes on in the background; wait for it to
       // settle, then the next attempt reports its outcome.
-      pollfd entry{handle_, POLLOUT, 0};
-      RetryEintr([&] { return ::poll(&entry, 1, 1000); });
+      sys::PollEntry entry{handle_, true, false};
+      sys::Poll(&entry, 1, kConnectSettleMs);
       continue;
     }
     if (!error.Interrupted()) break;
   }
-  errno = error.err;
-  KeepErrno keep;
+  error.Restore();
+  KeepSocketError keep;
   Log(LogType::Normal, "", "Socket::Connect Failed : %s\n", ErrorText(error).c_str());
   return false;
 }
 
 void Socket::Shutdown() {
-  if (handle_ >= 0) ::shutdown(handle_, SHUT_RDWR);
+  shutDown_.store(true);
+  if (handle_ != kNoSocket) sys::Shutdown(handle_);
 }
 
 std::int64_t Socket::Send(const void* data, std::size_t length) {
-  if (handle_ < 0) return 0;
-  return RetryEintr([&] { return ::send(handle_, data, length, MSG_NOSIGNAL); });
+  if (handle_ == kNoSocket) return 0;
+  for (;;) {
+    const std::int64_t sent = sys::Send(handle_, data, length);
+    if (sent >= 0 || !LastSocketError::Read().Interrupted()) return sent;
+  }
 }
 
 std::int64_t Socket::SendAll(BufferList buffers) {
-  if (handle_ < 0) return 0;
-  // One sendmsg for the whole list (one system call, and the list leaves as
-  // one piece when the socket buffer has room); a partial write is continued
-  // from where it stopped.
-  std::vector<iovec> vectors;
-  vectors.reserve(buffers.size());
+  if (handle_ == kNoSocket) return 0;
+  // One gather send for the whole list (one system call, and the list leaves
+  // as one piece when the socket buffer has room); a partial write is
+  // continued from where it stopped.
+  std::vector<sys::Chunk> chunks;
+  chunks.reserve(buffers.size());
   std::int64_t total = 0;
   for (const auto& [pointer, length] : buffers) {
     if (length == 0) continue;
     if (pointer == nullptr) return 0;
-    vectors.push_back(iovec{const_cast<void*>(pointer), length});
+    chunks.push_back(sys::Chunk{pointer, length});
     total += length;
   }
   std::size_t first = 0;
-  while (first < vectors.size()) {
-    msghdr message{};
-    message.msg_iov = vectors.data() + first;
-    message.msg_iovlen = std::min<std::size_t>(vectors.size() - first, IOV_MAX);
-    const ssize_t sent = RetryEintr([&] { return ::sendmsg(handle_, &message, MSG_NOSIGNAL); });
+  while (first < chunks.size()) {
+    const std::size_t count = std::min(chunks.size() - first, sys::kMaxChunks);
+    const std::int64_t sent = sys::SendGather(handle_, chunks.data() + first, count);
+    if (sent < 0 && LastSocketError::Read().Interrupted()) continue;
     if (sent <= 0) return 0;
     auto left = static_cast<std::size_t>(sent);
-    while (first < vectors.size() && left >= vectors[first].iov_len) {
-      left -= vectors[first].iov_len;
+    while (first < chunks.size() && left >= chunks[first].length) {
+      left -= chunks[first].length;
       ++first;
     }
     if (left > 0) {
-      vectors[first].iov_base = static_cast<char*>(vectors[first].iov_base) + left;
-      vectors[first].iov_len -= left;
+      chunks[first].data = static_cast<const char*>(chunks[first].data) + left;
+      chunks[first].length -= left;
     }
   }
   return total;
 }
 
 std::int64_t Socket::Receive(void* data, std::size_t length) {
-  if (handle_ < 0) return 0;
-  return ::recv(handle_, data, length, 0);
+  if (handle_ == kNoSocket) return 0;
+  return sys::Receive(handle_, data, length, sys::ReceiveMode::kNormal);
 }
 
 std::int64_t Socket::ReceiveExact(void* data, std::size_t length) {
-  if (handle_ < 0) return -1;
+  if (handle_ == kNoSocket) return -1;
   if (length < 1) return 0;
   std::size_t have = 0;
   while (have < length) {
     const std::int64_t got = Receive(static_cast<char*>(data) + have, length - have);
-    if (got < 0 && errno == EINTR) continue;
+    if (got < 0 && LastSocketError::Read().Interrupted()) continue;
     if (got < 1) return got;
     have += static_cast<std::size_t>(got);
   }
@@ -221,29 +182,21 @@ std::int64_t Socket::ReceiveExact(void* data, std::size_t length) {
 }
 
 bool Socket::SetNoDelay() {
-  if (handle_ < 0) return false;
-  const int on = 1;
-  ::setsockopt(handle_, IPPROTO_TCP, TCP_NODELAY, &on, sizeof(on));
+  if (handle_ == kNoSocket) return false;
+  sys::SetNoDelay(handle_);
   return true;
 }
 
 bool Socket::SetBlocking(bool blocking) {
-  if (handle_ < 0) return false;
-  const int flags = ::fcntl(handle_, F_GETFL);
-  if (flags < 0) return false;
-  const int wanted = blocking ? (flags & ~O_NONBLOCK) : (flags | O_NONBLOCK);
-  return wanted == flags || ::fcntl(handle_, F_SETFL, wanted) == 0;
+  if (handle_ == kNoSocket) return false;
+  return sys::SetNonBlocking(handle_, !blocking);
 }
 
 bool Socket::SetReceiveTimeout(std::int64_t timeoutMs) {
-  if (handle_ < 0) return false;
-  timeval value{};
-  if (timeoutMs != kNoTimeout) {
-    const auto ms = static_cast<std::uint32_t>(timeoutMs);  // the low 32 bits
-    value.tv_sec = static_cast<time_t>(ms / 1000);
-    value.tv_usec = static_cast<suseconds_t>((ms % 1000) * 1000);
-  }
-  return ::setsockopt(handle_, SOL_SOCKET, SO_RCVTIMEO, &value, sizeof(value)) == 0;
+  if (handle_ == kNoSocket) return false;
+  // The low 32 bits as an unsigned count; 0 waits for ever.
+  const auto ms = timeoutMs == kNoTimeout ? 0u : static_cast<std::uint32_t>(timeoutMs);
+  return sys::SetReceiveTimeout(handle_, ms);
 }
 
 std::vector<Socket*> Socket::WaitReadable(const std::vector<Socket*>& sockets, std::int64_t timeoutMs) {
@@ -253,28 +206,46 @@ std::vector<Socket*> Socket::WaitReadable(const std::vector<Socket*>& sockets, s
   const std::int64_t deadline = forever ? 0 : timeoutMs * 1000000;
   if (!forever && SteadyNowNs() - start >= deadline) return {};
 
-  std::vector<pollfd> entries;
+  std::vector<sys::PollEntry> entries;
   std::vector<Socket*> owners;
   entries.reserve(sockets.size());
   owners.reserve(sockets.size());
   for (Socket* socket : sockets) {
-    if (socket == nullptr || socket->handle_ < 0) continue;
-    entries.push_back(pollfd{socket->handle_, kPollAsk, 0});
+    if (socket == nullptr || socket->handle_ == kNoSocket) continue;
+    entries.push_back(sys::PollEntry{socket->handle_, false, false});
     owners.push_back(socket);
   }
   for (;;) {
-    int waitMs = -1;
+    // A socket we shut down ends the wait like one that hung up; checked
+    // before each slice, as Windows' poll may not report it.
+    std::vector<Socket*> result;
+    for (Socket* owner : owners) {
+      if (owner->shutDown_.load()) result.push_back(owner);
+    }
+    if (!result.empty()) return result;
+    int waitMs = sys::kPollSliceMs;
     if (!forever) {
       const std::int64_t remaining = deadline - (SteadyNowNs() - start);
       if (remaining <= 0) return {};
-      waitMs = static_cast<int>(std::min<std::int64_t>(remaining / 1000000, INT_MAX));
+      waitMs = static_cast<int>(std::min<std::int64_t>(remaining / 1000000, sys::kPollSliceMs));
     }
-    const int ready = ::poll(entries.data(), entries.size(), waitMs);
-    if (ready < 0 && errno == EINTR) continue;
-    if (ready <= 0) return {};
-    std::vector<Socket*> result;
+    const int ready = sys::Poll(entries.data(), entries.size(), waitMs);
+    if (ready < 0) {
+      // On Windows our own Shutdown wakes the poll by cancelling it, which
+      // fails it: the flag checked above reports the socket.
+      const bool interrupted = LastSocketError::Read().Interrupted();
+      const bool shutDown =
+          std::any_of(owners.begin(), owners.end(), [](const Socket* owner) { return owner->shutDown_.load(); });
+      if (interrupted || shutDown) continue;
+      return {};
+    }
+    if (ready == 0) {
+      // Only a slice of the time passed: the deadline decides.
+      if (forever || deadline - (SteadyNowNs() - start) > 0) continue;
+      return {};
+    }
     for (std::size_t i = 0; i < entries.size(); ++i) {
-      if (entries[i].revents & kPollReady) result.push_back(owners[i]);
+      if (entries[i].ready || owners[i]->shutDown_.load()) result.push_back(owners[i]);
     }
     if (!result.empty()) return result;
   }
@@ -290,28 +261,35 @@ Acceptor::~Acceptor() {
 
 bool Acceptor::Accept(Socket& target, std::int64_t timeoutMs) {
   target.Close();
-  if (handle_ < 0) return false;
+  if (handle_ == kNoSocket) return false;
   if (stopRequested_.load()) return false;
   const std::int64_t waitMs = (timeoutMs == 0 || timeoutMs == kNoTimeout) ? kDefaultAcceptTimeoutMs : timeoutMs;
   WaitReadable({this}, waitMs);  // passes whatever it found; accept() decides
   if (stopRequested_.load()) return false;
-  socklen_t length = sizeof(target.address_);
-  const int accepted = RetryEintr(
-      [&] { return ::accept4(handle_, reinterpret_cast<sockaddr*>(&target.address_), &length, SOCK_CLOEXEC); });
-  if (accepted < 0) {
-    const auto error = LastSocketError::Read();
+  int peerPort = 0;
+  SocketHandle accepted = kNoSocket;
+  LastSocketError error;
+  do {
+    accepted = sys::Accept(handle_, &peerPort);
+    if (accepted != kNoSocket) break;
+    error = LastSocketError::Read();
+  } while (error.Interrupted());
+  if (accepted == kNoSocket) {
     target.Close();
-    if (error.err != EAGAIN && error.err != EWOULDBLOCK && error.err != ECONNABORTED && error.err != EINVAL) {
+    // Nothing pending, or the connection went before it was taken, or Close
+    // came between the wait and accept(): no fault of ours.
+    if (!error.WouldBlock() && !error.TimedOut() && !stopRequested_.load()) {
       // Out of descriptors or memory: the pending connection stays queued
       // and the socket keeps reporting readable, so a caller that loops on
       // Accept would spin. Pause before reporting the failure.
       Log(LogType::Normal, "", "Acceptor::Accept failed : %s\n", ErrorText(error).c_str());
-      if (!stopRequested_.load()) ::poll(nullptr, 0, static_cast<int>(kAcceptFailurePauseMs));
+      if (!stopRequested_.load()) std::this_thread::sleep_for(std::chrono::milliseconds(kAcceptFailurePauseMs));
     }
     return false;
   }
   target.handle_ = accepted;
-  target.port_ = ntohs(target.address_.sin_port);
+  target.port_ = peerPort;
+  target.shutDown_.store(false);
   target.SetNoDelay();
   target.SetBlocking(true);
   return true;
@@ -319,10 +297,12 @@ bool Acceptor::Accept(Socket& target, std::int64_t timeoutMs) {
 
 void Acceptor::Close() {
   stopRequested_.store(true);
-  // On Linux shutting a listening socket down ends its listening state: a
-  // poll() on it reports a hang-up at once and accept() fails. This takes the
-  // place of a wake-up connection to our own port, and keeps the descriptor
-  // number reserved until no Accept can be using it.
+  // Shutting the listening socket down wakes an Accept waiting on another
+  // thread: on Linux it ends the listening state (poll reports a hang-up and
+  // accept fails); on Windows the wait sees the shut-down flag within a poll
+  // slice, or at once through the cancelled poll. Either way the handle stays
+  // reserved until no Accept can be using it; no wake-up connection to our
+  // own port is needed.
   Shutdown();
 }
 

@@ -4,27 +4,29 @@
 // thread.
 //
 // Errors: nothing here throws. Operations report through their result and
-// write the log lines quoted beside them. A Socket without a descriptor makes
+// write the log lines quoted beside them. A Socket without a handle makes
 // every operation fail harmlessly.
 //
-// Every send uses MSG_NOSIGNAL: a peer that has gone makes the send fail with
-// EPIPE; it never raises SIGPIPE.
+// No send ever raises SIGPIPE: a peer that has gone makes the send fail.
 //
-// Threads and descriptor lifetime. A Socket is used by one thread at a time,
+// Threads and handle lifetime. A Socket is used by one thread at a time,
 // with two exceptions that are safe from any thread while another thread is
-// blocked in Receive, ReceiveExact, WaitReadable or Accept on it:
-//   - Socket::Shutdown (shutdown(SHUT_RDWR)), which makes a blocked or later
-//     receive return end of stream and a blocked poll report the socket;
+// blocked in Receive, ReceiveExact, SendAll, WaitReadable or Accept on it:
+//   - Socket::Shutdown, which makes a blocked or later receive return end of
+//     stream or fail as gone, and a blocked or later WaitReadable report the
+//     socket;
 //   - Acceptor::Close, which sets the stop flag and shuts the listening
 //     socket down (a waiting Accept wakes and fails at once).
-// Neither releases the descriptor number. On Linux close() wakes nobody, and
-// the number may be handed to the next open() at once, so a thread still
-// inside a call could end up reading or accepting on an unrelated file.
-// The number is released only by Socket::Close / the destructor, which the
+// Neither releases the handle. Closing wakes nobody on Linux, and the number
+// may be handed to the next open at once, so a thread still inside a call
+// could end up reading or accepting on an unrelated file or socket.
+// The handle is released only by Socket::Close / the destructor, which the
 // owner calls once no other thread can still use the socket (after joining
 // the listener thread; when the last shared owner of a Connection goes).
-
-#include <netinet/in.h>
+//
+// The system calls are in socket_system.h, one file per platform. On
+// Windows the socket library (Winsock 2) is started once per process, by the
+// first Socket.
 
 #include <atomic>
 #include <cstddef>
@@ -33,6 +35,8 @@
 #include <utility>
 #include <vector>
 
+#include "pm/ip/socket_types.h"
+
 namespace pm {
 // An ordered list of (pointer, length) pairs written back to back as one
 // logical write.
@@ -40,24 +44,6 @@ using BufferList = std::vector<std::pair<const void*, std::uint32_t>>;
 }  // namespace pm
 
 namespace pm::ip {
-
-// The C library's errno and the socket call's error number, read together
-// right after a failing call. On Linux both are the errno of the socket call.
-struct LastSocketError {
-  int err = 0;  // errno
-  int wsa = 0;  // the socket call's error number
-
-  // Reads errno now (call right after the failing call).
-  static LastSocketError Read();
-
-  bool AlreadyConnected() const;  // EISCONN
-  bool Interrupted() const;       // EINTR
-  bool Gone() const;              // ENOTSOCK, EBADF, ECONNRESET, EPIPE
-  bool TimedOut() const;          // ECONNABORTED, ETIMEDOUT, EAGAIN/EWOULDBLOCK (expired SO_RCVTIMEO)
-};
-
-// "[errno=E,wsa=W]", both numbers in decimal.
-std::string ErrorText(const LastSocketError& error);
 
 inline constexpr std::int64_t kNoTimeout = INT64_MAX;
 
@@ -68,14 +54,12 @@ class Socket {
   Socket(const Socket&) = delete;
   Socket& operator=(const Socket&) = delete;
 
-  // Closes the descriptor (when there is one), zeroes the address and sets
-  // the handle to -1. Not safe while another thread uses the socket: use
+  // Closes the handle (when there is one) and sets it to kNoSocket. Not safe while another thread uses the socket: use
   // Shutdown to wake such a thread first and Close once it is done.
   virtual void Close();
 
-  // Stores the port, sets the address to 127.0.0.1:port and creates the
-  // socket. True when a descriptor was created. An earlier descriptor is not
-  // closed.
+  // Stores the port (the address is always 127.0.0.1:port) and creates the
+  // socket. True when a handle was created. An earlier handle is not closed.
   bool Init(int port);
   // Binds to the address; on success the port becomes GetPort() (0 when the
   // system's port cannot be read back). Logs
@@ -86,33 +70,36 @@ class Socket {
   // when that fails.
   int GetPort();
   // listen() with a backlog of 5, then non-blocking. False only without a
-  // descriptor.
+  // handle.
   bool Listen();
   // Connects to the address (interrupted attempts repeat, up to 1024 in all),
   // switches Nagle off. Logs "Socket::Connect Failed : %s\n" with ErrorText on
-  // failure. errno after a false result is the last attempt's.
+  // failure. LastSocketError::Read after a false result gives the last
+  // attempt's error.
   bool Connect();
   // Wakes any thread blocked on this socket and ends both directions, keeping
-  // the descriptor number reserved (see the header comment). Any thread.
+  // the handle reserved (see the header comment). Any thread. Sets a flag
+  // that later waits check before blocking, since on Windows a wait that
+  // starts after the shutdown would not see it.
   void Shutdown();
 
-  // One send(MSG_NOSIGNAL); its result, or 0 without a descriptor.
+  // One send; its result, or 0 without a handle.
   std::int64_t Send(const void* data, std::size_t length);
   // The entries in order; 0 when any entry is not sent whole (also without a
-  // descriptor), else the total byte count. Partial writes are continued, so
+  // handle), else the total byte count. Partial writes are continued, so
   // a large entry is not cut short by a full socket buffer.
   std::int64_t SendAll(BufferList buffers);
-  // One recv(); its result, or 0 without a descriptor.
+  // One recv(); its result, or 0 without a handle.
   std::int64_t Receive(void* data, std::size_t length);
   // Reads exactly length bytes: the length on success, 0 for a length below
-  // 1, -1 without a descriptor; an end of stream (0) or an error (<0) is
+  // 1, -1 without a handle; an end of stream (0) or an error (<0) is
   // returned at once (bytes already read are lost). Interruptions repeat.
   std::int64_t ReceiveExact(void* data, std::size_t length);
 
-  // TCP_NODELAY on. False without a descriptor.
+  // TCP_NODELAY on. False without a handle.
   bool SetNoDelay();
-  // O_NONBLOCK off (true) or on (false). False without a descriptor or when
-  // fcntl fails.
+  // Blocking (true) or non-blocking (false): O_NONBLOCK, ioctlsocket(FIONBIO).
+  // False without a handle or when the call fails.
   bool SetBlocking(bool blocking);
   // SO_RCVTIMEO: kNoTimeout means wait for ever (0), other values are
   // milliseconds (the low 32 bits, as an unsigned count). False when the
@@ -120,19 +107,20 @@ class Socket {
   bool SetReceiveTimeout(std::int64_t timeoutMs);
 
   // The listed sockets that become readable, hang up or fail within
-  // timeoutMs, in list order. Sockets without a descriptor are not polled.
-  // Empty on timeout (0 returns at once without polling) or error.
+  // timeoutMs, in list order; a socket that was Shutdown counts as ready.
+  // Sockets without a handle are not polled. Empty on timeout (0 returns at
+  // once without polling) or error.
   static std::vector<Socket*> WaitReadable(const std::vector<Socket*>& sockets,
                                            std::int64_t timeoutMs);
 
-  int GetHandle() const { return handle_; }
+  SocketHandle GetHandle() const { return handle_; }
   int StoredPort() const { return port_; }
-  const sockaddr_in& Address() const { return address_; }
+  bool WasShutDown() const { return shutDown_.load(); }
 
  protected:
-  int handle_ = -1;       // the descriptor; -1 when none
-  int port_ = 0;          // Init's port, the bound port, or the peer's port after Accept
-  sockaddr_in address_{};  // 127.0.0.1:port; zeroed by Close
+  SocketHandle handle_ = kNoSocket;
+  int port_ = 0;  // Init's port, the bound port, or the peer's port after Accept
+  std::atomic<bool> shutDown_{false};  // set by Shutdown, cleared by Init and Accept
 
   friend class Acceptor;
 };
@@ -144,7 +132,7 @@ class Acceptor : public Socket {
 
   // Accepts one connection into target (closed first). Waits up to timeoutMs
   // (0 or kNoTimeout mean 60,000 ms) for a pending connection; false when
-  // none came, when there is no descriptor, or once Close has been called.
+  // none came, when there is no handle, or once Close has been called.
   // On success target holds the connection (blocking, Nagle off) and its port
   // is the peer's port. When accept itself fails for want of descriptors or
   // memory, logs "Acceptor::Accept failed : [errno=E,wsa=W]" and pauses
@@ -154,10 +142,10 @@ class Acceptor : public Socket {
 
   // Stops the acceptor: sets the stop flag (Accept fails from now on) and
   // shuts the listening socket down, which wakes an Accept waiting on
-  // another thread. Safe from any thread. The descriptor is released by
+  // another thread. Safe from any thread. The handle is released by
   // ReleaseDescriptor or the destructor, once no Accept can be running.
   void Close() override;
-  // Releases the descriptor. Only when no thread can be in Accept.
+  // Releases the handle. Only when no thread can be in Accept.
   void ReleaseDescriptor() { Socket::Close(); }
 
   bool StopRequested() const { return stopRequested_.load(); }

@@ -1,17 +1,15 @@
 #include "pm/runtime/context.h"
 
-#include <dlfcn.h>
-
 #include <atomic>
 
-#include "pm/runtime/syscall.h"
+#include "pm/runtime/system.h"
 
 namespace pm {
 namespace {
 
 std::atomic<Context*> g_context{nullptr};
 
-void DefaultSink(LogType, const char* line) { WriteToStderr(line); }
+void DefaultSink(LogType, const char* line) { WriteDefaultLogLine(line); }
 
 }  // namespace
 
@@ -22,7 +20,7 @@ Context* GetContext() {
   if (Context* cached = g_context.load(std::memory_order_acquire)) return cached;
 
   Context* context = nullptr;
-  if (void* symbol = ::dlsym(RTLD_DEFAULT, kContextExportName)) {
+  if (void* symbol = FindProgramExport(kContextExportName)) {
     auto exported = reinterpret_cast<ContextExport>(symbol);
     context = exported();
     if (context == nullptr) context = new Context();

@@ -35,8 +35,9 @@ inline constexpr const char* kContextExportName = "QFProcessManagementGlobals";
 // one when it exports none. Never null; the same pointer on every call.
 Context* GetContext();
 
-// The log sink of the context, or the default sink (one write of the line to
-// stderr) when the slot is empty; the slot itself is left as it is. Read
+// The log sink of the context, or the default sink (WriteDefaultLogLine: one
+// write of the line to stderr, or OutputDebugStringA on Windows) when the
+// slot is empty; the slot itself is left as it is. Read
 // without a lock: the runner installs its sink before the task starts logging.
 Context::LogSink CurrentLogSink();
 

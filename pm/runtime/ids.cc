@@ -1,26 +1,8 @@
 #include "pm/runtime/ids.h"
 
-#include <uuid/uuid.h>
-
 namespace pm {
 namespace {
 constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+_";
-}
-
-std::string NewUuidString() {
-  uuid_t uuid;
-  uuid_generate_random(uuid);
-  char text[37];
-  uuid_unparse_lower(uuid, text);
-  return std::string(text, 36);
-}
-
-std::string NewShortId() {
-  uuid_t uuid;
-  uuid_generate_random(uuid);
-  std::uint8_t bytes[16];
-  for (int i = 0; i < 16; ++i) bytes[i] = uuid[i];
-  return EncodeShortId(bytes);
 }
 
 std::string EncodeShortId(const std::uint8_t (&b)[16]) {

@@ -1,13 +1,13 @@
 #include "pm/runtime/load_function.h"
 
-#include <dlfcn.h>
+#include "pm/runtime/library.h"
 
 namespace pm {
 
 void* LoadFunction(const std::string& library, const std::string& function) {
-  void* handle = ::dlopen(library.c_str(), RTLD_NOW | RTLD_LOCAL);
+  void* handle = OpenLibrary(library);
   if (handle == nullptr) return nullptr;
-  return ::dlsym(handle, function.c_str());
+  return FindSymbol(handle, function.c_str());
 }
 
 }  // namespace pm

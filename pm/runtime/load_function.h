@@ -1,7 +1,7 @@
 #pragma once
-// Loads a shared library by name (dlopen) and looks a function up in it
-// (dlsym). Returns null when either step fails. The library stays loaded for
-// the life of the process.
+// Loads a library by name (OpenLibrary: dlopen, LoadLibraryA) and looks a
+// function up in it (dlsym, GetProcAddress). Returns null when either step
+// fails. The library stays loaded for the life of the process.
 #include <string>
 
 namespace pm {

@@ -39,13 +39,6 @@ bool ReadProcStat(pid_t pid, ProcStat* out) {
   return true;
 }
 
-double ProcessCpuSeconds(pid_t pid) {
-  ProcStat stat;
-  const long ticks = ::sysconf(_SC_CLK_TCK);
-  if (!ReadProcStat(pid, &stat) || ticks <= 0) return 0;
-  return static_cast<double>(stat.userTicks + stat.systemTicks) / static_cast<double>(ticks);
-}
-
 std::vector<pid_t> ChildrenNamed(pid_t parent, const std::string& command) {
   std::vector<pid_t> found;
   DIR* proc = ::opendir("/proc");

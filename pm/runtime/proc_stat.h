@@ -1,7 +1,8 @@
 #pragma once
 // What Linux tells about a process in /proc/PID/stat: its command name,
 // state, parent and CPU time. The one reader of that file for every program
-// here (liveness checks, CPU figures, finding a child by name).
+// here (liveness checks and CPU figures through pm/runtime/system.h, finding a
+// child by name). Linux only.
 #include <sys/types.h>
 
 #include <string>
@@ -19,9 +20,6 @@ struct ProcStat {
 
 // False when the process is gone or its line does not parse.
 bool ReadProcStat(pid_t pid, ProcStat* out);
-
-// User + system CPU seconds a process has used; 0 when it cannot be read.
-double ProcessCpuSeconds(pid_t pid);
 
 // The children of `parent` (zombies too) whose command name is `command`.
 std::vector<pid_t> ChildrenNamed(pid_t parent, const std::string& command);

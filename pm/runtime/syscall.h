@@ -18,9 +18,4 @@ auto RetryEintr(F&& f) -> decltype(f()) {
 // "<strerror> (errno N)".
 std::string ErrnoText(int err);
 
-// Writes the whole text to standard error: one write() when the pipe takes
-// it (so lines from several threads do not mix), the rest after a short
-// write, EINTR retried; gives up silently when stderr is gone.
-void WriteToStderr(const char* text);
-
 }  // namespace pm

@@ -1,6 +1,8 @@
 #pragma once
-// Thread names for debuggers and `ps -L`. Linux allows 15 bytes; longer names
-// are cut there (at a character boundary). Names must be valid UTF-8:
+// Thread names for debuggers and `ps -L`: pthread_setname_np on Linux, which
+// allows 15 bytes (longer names are cut at a character boundary);
+// SetThreadDescription on Windows (resolved in kernel32 at run time; names
+// are silently not set where it is missing). Names must be valid UTF-8:
 // otherwise std::range_error propagates, as from Utf8ToUtf16.
 #include <string>
 

@@ -12,18 +12,20 @@
 #include "pm/runtime/ids.h"
 #include "pm/runtime/log.h"
 #include "pm/runtime/syscall.h"
+#include "pm/shm/segment_log.h"
 
 namespace pm {
 namespace {
 
-// The texts keep the Windows class name: log readers match on them.
-constexpr const char* kCreateFailed = "SharedCpuMemoryWin::Create : Could not create '%s' (%d).";
-constexpr const char* kOpenFailed = "SharedCpuMemoryWin::Create : Could not open '%s' (%d).";
-constexpr const char* kMapFailed = "SharedCpuMemoryWin::MapFile cannot map view of file (%d).\n";
+using segment_log::kCreateFailed;
+using segment_log::kMapFailed;
+using segment_log::kOpenFailed;
 
 constexpr std::uint64_t kMaxSize = static_cast<std::uint64_t>(std::numeric_limits<off_t>::max());
 
 }  // namespace
+
+std::shared_ptr<SharedCpuMemory> NewCpuSegment() { return SharedCpuMemoryPosix::New(); }
 
 SharedCpuMemoryPosix::~SharedCpuMemoryPosix() {
   Unmap();

@@ -55,7 +55,7 @@ class SharedCpuMemoryPosix final : public SharedCpuMemory {
   bool OwnsName() const { return ownsName_; }
 
   // The suffix of names made up when Create gets none.
-  static constexpr const char* kPrivateNameSuffix = ".net.quillfront.pm";
+  static constexpr const char* kPrivateNameSuffix = kPrivateSegmentSuffix;
 
  private:
   bool MapFile();

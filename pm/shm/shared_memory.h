@@ -93,4 +93,12 @@ class SharedCpuMemory : public SharedMemory {
   std::atomic<std::uint32_t> lockCount{0};  // Lock calls without their Unlock
 };
 
+// A new, unmapped CPU segment of this platform's kind: SharedCpuMemoryPosix
+// (POSIX named shared memory) or SharedCpuMemoryWin (a named file mapping in
+// the paging file), made shared in one allocation with its counts.
+std::shared_ptr<SharedCpuMemory> NewCpuSegment();
+
+// The suffix of the names Create makes up when it gets none.
+inline constexpr const char* kPrivateSegmentSuffix = ".net.quillfront.pm";
+
 }  // namespace pm

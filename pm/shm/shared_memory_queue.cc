@@ -9,7 +9,6 @@
 #include "pm/ipc/dispatcher.h"
 #include "pm/ipc/server.h"
 #include "pm/runtime/log.h"
-#include "pm/shm/shared_cpu_memory_posix.h"
 #include "pm/shm/shared_gpu_memory.h"
 
 namespace pm {
@@ -148,7 +147,7 @@ void SharedMemoryQueueProducer::SeedNextId(std::uint32_t id) {
 std::shared_ptr<SharedMemory> SharedMemoryQueueProducer::AllocateCpuBuffer(std::uint64_t bytes) {
   if (bytes == 0 || bytes > kMaxSegmentBytes) return nullptr;
   const std::uint64_t size = (bytes + kSegmentAlignment - 1) / kSegmentAlignment * kSegmentAlignment;
-  auto segment = std::make_shared<SharedCpuMemoryPosix>();
+  std::shared_ptr<SharedCpuMemory> segment = NewCpuSegment();
   {
     std::lock_guard<std::mutex> guard(lock_);
     segment->id = NextBufferId();

@@ -33,6 +33,7 @@
 #include "pm/ipc/connection.h"
 #include "pm/runtime/ids.h"
 #include "pm/runtime/proc_stat.h"
+#include "pm/runtime/system.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "support/wait.h"
 

@@ -1,16 +1,10 @@
 #pragma once
 // The host's end of a message-frame connection, for tests: a listening
 // socket on 127.0.0.1 and an accepted peer that writes raw bytes and frames
-// and reads frames with a time limit. Plain POSIX calls, independent of the
-// code under test. Header-only; shared by the dispatcher and runner tests.
-#include <arpa/inet.h>
-#include <netinet/in.h>
-#include <netinet/tcp.h>
-#include <poll.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
-#include <cerrno>
+// and reads frames with a time limit. The system's socket calls one by one
+// (pm/ip/socket_system.h, so that it runs on Windows too), independent of the
+// connection code under test. Header-only; shared by the dispatcher and
+// runner tests.
 #include <chrono>
 #include <cstdint>
 #include <optional>
@@ -19,35 +13,46 @@
 
 #include <nlohmann/json.hpp>
 
+#include "pm/ip/socket_system.h"
 #include "pm/runtime/little_endian.h"
 
 namespace pmtest {
 
+namespace hostsys = pm::ip::sys;
+
+// Calls f() again while it fails with an interruption.
+template <class F>
+auto RetryInterrupted(F&& f) -> decltype(f()) {
+  for (;;) {
+    auto r = f();
+    if (!(r < 0 && pm::ip::LastSocketError::Read().Interrupted())) return r;
+  }
+}
+
 class HostPeer {
  public:
   HostPeer() = default;
-  explicit HostPeer(int fd) : fd_(fd) {}
-  HostPeer(HostPeer&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
+  explicit HostPeer(pm::ip::SocketHandle fd) : fd_(fd) {}
+  HostPeer(HostPeer&& other) noexcept : fd_(std::exchange(other.fd_, pm::ip::kNoSocket)) {}
   HostPeer& operator=(HostPeer&& other) noexcept {
     if (this != &other) {
       Close();
-      fd_ = std::exchange(other.fd_, -1);
+      fd_ = std::exchange(other.fd_, pm::ip::kNoSocket);
     }
     return *this;
   }
   ~HostPeer() { Close(); }
 
-  bool Valid() const { return fd_ >= 0; }
+  bool Valid() const { return fd_ != pm::ip::kNoSocket; }
   void Close() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
+    if (Valid()) hostsys::CloseHandle(fd_);
+    fd_ = pm::ip::kNoSocket;
   }
 
   bool WriteRaw(const std::string& bytes) {
     std::size_t at = 0;
     while (at < bytes.size()) {
-      const ssize_t n = ::send(fd_, bytes.data() + at, bytes.size() - at, MSG_NOSIGNAL);
-      if (n < 0 && errno == EINTR) continue;
+      const std::int64_t n = RetryInterrupted([&] { return hostsys::Send(fd_, bytes.data() + at, bytes.size() - at); });
       if (n <= 0) return false;
       at += static_cast<std::size_t>(n);
     }
@@ -100,45 +105,34 @@ class HostPeer {
   }
 
  private:
-  // What recv returns once the socket is readable (0 at the end of the stream,
-  // negative on an error); nullopt when it is not readable by the deadline.
-  std::optional<ssize_t> ReceiveBy(std::chrono::steady_clock::time_point deadline, char* p, std::size_t n) {
-    for (;;) {
-      using std::chrono::steady_clock;
-      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
-      if (left.count() < 0) return std::nullopt;
-      pollfd pfd{fd_, POLLIN, 0};
-      const int ready = ::poll(&pfd, 1, static_cast<int>(left.count()) + 1);
-      if (ready < 0 && errno == EINTR) continue;
-      if (ready <= 0) return std::nullopt;
-      const ssize_t got = ::recv(fd_, p, n, 0);
-      if (got < 0 && errno == EINTR) continue;
-      return got;
+  // What Receive returns once the socket is readable (0 at the end of the
+  // stream, negative on an error); nullopt when it is not readable by the
+  // deadline.
+  std::optional<std::int64_t> ReceiveBy(std::chrono::steady_clock::time_point deadline, char* p, std::size_t n) {
+    using std::chrono::steady_clock;
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - steady_clock::now());
+    if (left.count() < 0) return std::nullopt;
+    hostsys::PollEntry entry{fd_, false, false};
+    if (RetryInterrupted([&] { return hostsys::Poll(&entry, 1, static_cast<int>(left.count()) + 1); }) <= 0) {
+      return std::nullopt;
     }
+    return RetryInterrupted([&] { return hostsys::Receive(fd_, p, n, hostsys::ReceiveMode::kNormal); });
   }
 
-  int fd_ = -1;
+  pm::ip::SocketHandle fd_ = pm::ip::kNoSocket;
 };
 
 class HostListener {
  public:
   HostListener() {
-    fd_ = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    address.sin_port = 0;
-    if (fd_ < 0 || ::bind(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-        ::listen(fd_, 16) != 0) {
-      return;
-    }
-    socklen_t length = sizeof address;
-    if (::getsockname(fd_, reinterpret_cast<sockaddr*>(&address), &length) == 0) {
-      port_ = ntohs(address.sin_port);
+    fd_ = hostsys::StartOnce() ? hostsys::OpenTcp(false) : pm::ip::kNoSocket;
+    if (fd_ != pm::ip::kNoSocket && hostsys::BindLoopback(fd_, 0) && hostsys::Listen(fd_, 16)) {
+      const int port = hostsys::LocalPort(fd_);
+      port_ = port > 0 ? port : 0;
     }
   }
   ~HostListener() {
-    if (fd_ >= 0) ::close(fd_);
+    if (fd_ != pm::ip::kNoSocket) hostsys::CloseHandle(fd_);
   }
   HostListener(const HostListener&) = delete;
   HostListener& operator=(const HostListener&) = delete;
@@ -146,22 +140,17 @@ class HostListener {
   int Port() const { return port_; }
   // The next connection within the limit; an invalid peer when none came.
   HostPeer Accept(std::chrono::milliseconds limit = std::chrono::seconds(10)) {
-    pollfd pfd{fd_, POLLIN, 0};
-    int ready = 0;
-    do {
-      ready = ::poll(&pfd, 1, static_cast<int>(limit.count()));
-    } while (ready < 0 && errno == EINTR);
-    if (ready <= 0) return HostPeer();
-    const int fd = ::accept4(fd_, nullptr, nullptr, SOCK_CLOEXEC);
-    if (fd >= 0) {
-      const int one = 1;
-      ::setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &one, sizeof one);
+    hostsys::PollEntry entry{fd_, false, false};
+    if (RetryInterrupted([&] { return hostsys::Poll(&entry, 1, static_cast<int>(limit.count())); }) <= 0) {
+      return HostPeer();
     }
+    const pm::ip::SocketHandle fd = hostsys::Accept(fd_, nullptr);
+    if (fd != pm::ip::kNoSocket) hostsys::SetNoDelay(fd);
     return HostPeer(fd);
   }
 
  private:
-  int fd_ = -1;
+  pm::ip::SocketHandle fd_ = pm::ip::kNoSocket;
   int port_ = 0;
 };
 

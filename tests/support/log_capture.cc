@@ -1,8 +1,6 @@
 #include "support/log_capture.h"
 
-#include <unistd.h>
-
-#include <cstring>
+#include "pm/runtime/system.h"
 
 namespace pmtest {
 namespace {
@@ -16,7 +14,7 @@ void Forward(pm::LogType, const char* line) {
     g_active->Add(line);
     return;
   }
-  [[maybe_unused]] ssize_t n = ::write(STDERR_FILENO, line, std::strlen(line));
+  pm::WriteToStderr(line);
 }
 
 using SinkFunction = void (*)(pm::LogType, const char*);

@@ -5,7 +5,9 @@
 // above (tests/pm/ipc).
 #include "pm/ip/socket.h"
 
+#include <arpa/inet.h>
 #include <fcntl.h>
+#include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <signal.h>
 #include <sys/socket.h>

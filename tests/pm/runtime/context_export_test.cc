@@ -3,13 +3,14 @@
 #include <gtest/gtest.h>
 
 #include "pm/runtime/context.h"
+#include "pm/runtime/export.h"
 
 namespace {
 pm::Context g_exported;
 int g_calls = 0;
 }  // namespace
 
-extern "C" __attribute__((visibility("default"))) pm::Context* QFProcessManagementGlobals() {
+extern "C" PM_EXPORT pm::Context* QFProcessManagementGlobals() {
   ++g_calls;
   return &g_exported;
 }

@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 
 #include "pm/runtime/context.h"
+#include "pm/runtime/load_function.h"
+#include "support/platform.h"
 
 namespace {
 
@@ -27,6 +29,12 @@ TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
   auto none = pm::FindSingleton("registry-empty", [] { return nullptr; });
   EXPECT_EQ(none, nullptr);
   EXPECT_EQ(pm::GetContext()->registry.count("registry-empty"), 1u);
+}
+
+TEST(LoadFunction, FindsALibraryFunctionAndReportsMissingOnes) {
+  EXPECT_NE(pm::LoadFunction(pmtest::kSystemLibrary, pmtest::kSystemFunction), nullptr);
+  EXPECT_EQ(pm::LoadFunction(pmtest::kSystemLibrary, "no_such_function_here"), nullptr);
+  EXPECT_EQ(pm::LoadFunction(pmtest::kMissingLibrary, pmtest::kSystemFunction), nullptr);
 }
 
 }  // namespace

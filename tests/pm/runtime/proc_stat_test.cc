@@ -11,6 +11,7 @@
 #include <string>
 
 #include "pm/runtime/proc_stat.h"
+#include "pm/runtime/system.h"
 
 namespace {
 
@@ -22,6 +23,7 @@ TEST(ProcStat, ReadsALiveProcessAZombieChildAndNothingOfOneGone) {
   EXPECT_EQ(self.command, command);
   EXPECT_EQ(self.state, 'R');
   EXPECT_EQ(self.parent, ::getppid());
+  EXPECT_TRUE(pm::ProcessAlive(::getpid()));
   // Busy until a clock tick of CPU time was used (10 ms).
   const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
   while (pm::ProcessCpuSeconds(::getpid()) == 0 && std::chrono::steady_clock::now() < limit) {
@@ -35,11 +37,13 @@ TEST(ProcStat, ReadsALiveProcessAZombieChildAndNothingOfOneGone) {
   while (pm::ReadProcStat(child, &ended) && ended.state != 'Z') ::usleep(1000);
   EXPECT_EQ(ended.state, 'Z');
   EXPECT_EQ(ended.parent, ::getpid());
+  EXPECT_FALSE(pm::ProcessAlive(child));
   EXPECT_EQ(pm::ChildrenNamed(::getpid(), command), std::vector<pid_t>{child});
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
   EXPECT_FALSE(pm::ReadProcStat(child, &ended));
   EXPECT_EQ(pm::ProcessCpuSeconds(child), 0);
+  EXPECT_FALSE(pm::ProcessAlive(child));
   EXPECT_TRUE(pm::ChildrenNamed(::getpid(), command).empty());
 }
 

@@ -1,40 +1,35 @@
 // The segment pool of a source and its record channel to the host: ids,
 // sizes, reuse, holds, records with their check bytes, the host connection,
-// GPU segments, and what is left in /dev/shm.
+// GPU segments, and what the system still holds of the segments.
 #include <gtest/gtest.h>
-
-#include <sys/stat.h>
 
 #include <cstring>
 
 #include "pm/runtime/context.h"
+#include "pm/runtime/system.h"
 #include "pm/shm/shared_gpu_memory.h"
 #include "pm/shm/shared_memory_queue.h"
 #include "fake_gpu.h"
 #include "support/host_link.h"
 #include "support/log_capture.h"
+#include "support/segment_probe.h"
 #include "support/wait.h"
 
 namespace {
 
 using pm::SharedMemoryQueueProducer;
 
+using pmtest::SegmentBytes;
+
 std::pair<unsigned, unsigned> Sums(const std::uint8_t* bytes, std::size_t length) {
   const pm::FletcherSums sums = pm::Fletcher16(bytes, length);
   return {sums.sum1, sums.sum2};
 }
 
-// The size of /dev/shm/name; 0 when there is no such entry.
-std::uint64_t ShmFileSize(const std::string& name) {
-  struct stat st {};
-  if (::stat(("/dev/shm/" + name).c_str(), &st) != 0) return 0;
-  return static_cast<std::uint64_t>(st.st_size);
-}
-
 struct StartedQueue {
   pmtest::HostLink link;
   std::shared_ptr<SharedMemoryQueueProducer> queue = std::make_shared<SharedMemoryQueueProducer>();
-  std::string base = "pmtestq" + std::to_string(::getpid()) + "_";
+  std::string base = "pmtestq" + std::to_string(pm::CurrentProcessId()) + "_";
   nlohmann::json startRequest;
   std::atomic<bool> hostConnected{false};
 
@@ -74,19 +69,19 @@ TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
 }
 
 // Segments are named after the memory base and their id, sized in whole
-// pages, and all gone from /dev/shm with the queue.
+// pages, and all gone from the system with the queue.
 TEST(QueueSizes, AreRoundedUpTo4096AndNothingIsLeftAfterTheQueueGoes) {
   std::string one, more;
   {
     StartedQueue q;
     one = q.base + std::to_string(q.queue->AllocateCpuBuffer(1)->id);
     more = q.base + std::to_string(q.queue->AllocateCpuBuffer(4097)->id);
-    EXPECT_EQ(ShmFileSize(one), 4096u);
-    EXPECT_EQ(ShmFileSize(more), 8192u);
+    EXPECT_EQ(SegmentBytes(one), 4096u);
+    EXPECT_EQ(SegmentBytes(more), 8192u);
     EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
   }
-  EXPECT_EQ(ShmFileSize(one), 0u);
-  EXPECT_EQ(ShmFileSize(more), 0u);
+  EXPECT_EQ(SegmentBytes(one), 0u);
+  EXPECT_EQ(SegmentBytes(more), 0u);
 }
 
 TEST(QueueReuse, PicksTheSmallestFreeSegmentThatFitsAndNeverAHeldOne) {
