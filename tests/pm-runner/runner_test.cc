@@ -17,7 +17,6 @@ namespace {
 
 using namespace std::chrono_literals;
 using pmtest::Args;
-using pmtest::Echoes;
 using pmtest::HostListener;
 using pmtest::HostPeer;
 using pmtest::RunnerProcess;
@@ -45,7 +44,7 @@ TEST(Runner, OutlivesAClosedConnectionAndEndsWithTheTask) {
   ASSERT_TRUE(a.Valid() && b.Valid());
   ASSERT_TRUE(a.WriteRaw(HostPeer::Prefix(0xFFFFFFF0u)));
   EXPECT_TRUE(a.SeesEndOfStream());
-  EXPECT_TRUE(Echoes(b, 1));
+  EXPECT_EQ(pmtest::Ask(b, "test::echo", 1, {{"value", 1}})["value"], 1);
   EXPECT_FALSE(runner.Wait(200ms).has_value());
   EXPECT_NE(runner.Stderr().find("exceeds 524288, closing the connection"), std::string::npos);
 

@@ -27,9 +27,6 @@ namespace pmtest {
 
 using namespace std::chrono_literals;
 
-// Generous: the sanitizer builds start processes slowly on a busy machine.
-inline constexpr auto kExitLimit = 20s;
-
 // A fresh name under the test's temporary folder.
 inline std::string TempName(const std::string& stem, const std::string& suffix) {
   static std::atomic<int> counter{0};
@@ -61,8 +58,9 @@ class RunnerProcess {
   bool Started() const { return started_; }
   void Signal(int signal) { child_.Signal(signal); }
   // The exit status, 128 + the signal's number when a signal ended it,
-  // nullopt while it still runs after `limit`.
-  std::optional<int> Wait(std::chrono::milliseconds limit = kExitLimit) { return child_.Wait(limit); }
+  // nullopt while it still runs after `limit` (generous: the sanitizer builds
+  // start processes slowly on a busy machine).
+  std::optional<int> Wait(std::chrono::milliseconds limit = 20s) { return child_.Wait(limit); }
   std::string Stderr() const {
     std::ifstream in(stderrPath_);
     std::stringstream text;
@@ -106,12 +104,6 @@ inline nlohmann::json Ask(HostPeer& host, const std::string& command, std::uint6
     if (!frame.is_object()) return nlohmann::json(nlohmann::json::value_t::discarded);
     if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
   }
-}
-
-// The echo task answers test::echo with the value it was given.
-inline bool Echoes(HostPeer& host, std::uint64_t id) {
-  const nlohmann::json reply = Ask(host, "test::echo", id, {{"value", id}});
-  return reply.is_object() && reply.value("value", nlohmann::json()) == id && reply["pm::unique_id"] == id;
 }
 
 // A listener, the runner on `module` connected to it in a private registry
