@@ -2,8 +2,7 @@
 // The runner (PM_RUNNER_PATH, from the build) as a child process, started by
 // pm-host's process starter: its stderr goes to a file of its own, its
 // environment may add entries (NDI_LOOPBACK_DIR for a private registry
-// folder), and it is killed and reaped when the object goes. With it the
-// host-side request helpers the runner tests share.
+// folder), and it is killed and reaped when the object goes.
 #include <unistd.h>
 
 #include <atomic>
@@ -85,25 +84,6 @@ inline int Occurrences(const std::string& text, const std::string& what) {
   int n = 0;
   for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
   return n;
-}
-
-inline nlohmann::json Request(const std::string& command, std::uint64_t id, nlohmann::json body = nlohmann::json::object()) {
-  body["pm::command"] = command;
-  body["pm::unique_id"] = id;
-  body["pm::request"] = true;
-  return body;
-}
-
-// Sends a request and returns its reply (discarded when none comes), passing
-// over the task's own requests and notifications met on the way.
-inline nlohmann::json Ask(HostPeer& host, const std::string& command, std::uint64_t id,
-                          nlohmann::json body = nlohmann::json::object()) {
-  EXPECT_TRUE(host.WriteJson(Request(command, id, std::move(body))));
-  for (;;) {
-    const nlohmann::json frame = host.ReadJson(10s);
-    if (!frame.is_object()) return nlohmann::json(nlohmann::json::value_t::discarded);
-    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
-  }
 }
 
 // A listener, the runner on `module` connected to it in a private registry
