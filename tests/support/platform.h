@@ -4,7 +4,6 @@
 namespace pmtest {
 
 #if defined(_WIN32)
-inline constexpr bool kWindows = true;
 // A library every process has, and a function in it.
 inline constexpr const char* kSystemLibrary = "kernel32.dll";
 inline constexpr const char* kSystemFunction = "lstrlenA";
@@ -12,7 +11,6 @@ inline constexpr const char* kMissingLibrary = "no-such-library.dll";
 // SetThreadDescription keeps whole names.
 inline constexpr bool kThreadNamesCutTo15Bytes = false;
 #else
-inline constexpr bool kWindows = false;
 inline constexpr const char* kSystemLibrary = "libc.so.6";
 inline constexpr const char* kSystemFunction = "strlen";
 inline constexpr const char* kMissingLibrary = "libno-such-library.so";
