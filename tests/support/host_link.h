@@ -17,14 +17,25 @@ namespace pmtest {
 
 class HostLink {
  public:
-  HostLink();
-  ~HostLink();
+  HostLink() {
+    HostListener listener;
+    dispatcher_ = std::make_shared<pm::RpcDispatcher>(pm::ipc::Connection::Open(listener.Port()));
+    host_ = listener.Accept();
+    dispatcher_->Start();
+  }
+  ~HostLink() { dispatcher_->Stop(); }
 
   // The dispatcher the code under test sends on (started).
   const std::shared_ptr<pm::RpcDispatcher>& Dispatcher() const { return dispatcher_; }
   // Reads messages until one has "pm::command" == command; nullopt when none
   // comes within `timeoutMs`.
-  std::optional<nlohmann::json> ReadCommand(const std::string& command, std::int64_t timeoutMs = 5000);
+  std::optional<nlohmann::json> ReadCommand(const std::string& command, std::int64_t timeoutMs = 5000) {
+    for (;;) {
+      const nlohmann::json message = host_.ReadJson(std::chrono::milliseconds(timeoutMs));
+      if (message.is_discarded()) return std::nullopt;
+      if (message.value("pm::command", "") == command) return message;
+    }
+  }
 
  private:
   HostPeer host_;
@@ -32,14 +43,22 @@ class HostLink {
 };
 
 // The host's end of a shared-memory queue: connects to the queue's port, reads
-// 64-byte records (token + 60 record bytes) and returns tokens.
+// 64-byte records (token + 60 record bytes, written by the task as one block)
+// and returns tokens.
 class QueueReader {
  public:
-  explicit QueueReader(int port);
+  explicit QueueReader(int port) : connection_(pm::ipc::Connection::Open(port)) {}
   bool Connected() const { return connection_ != nullptr; }
   // Reads one record; false on timeout or a closed connection.
-  bool ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs = 5000);
-  bool ReturnToken(std::uint32_t token);
+  bool ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs = 5000) {
+    return connection_ && connection_->ReadFromSocket(token, 4, timeoutMs) &&
+           connection_->ReadFromSocket(record, 60, timeoutMs);
+  }
+  bool ReturnToken(std::uint32_t token) {
+    pm::BufferList list;
+    list.emplace_back(&token, 4u);
+    return connection_ && connection_->Send(std::move(list));
+  }
 
  private:
   std::shared_ptr<pm::ipc::Connection> connection_;

@@ -1,16 +1,17 @@
 #pragma once
 // The host's end of a message-frame connection, for tests: a listening
 // socket on 127.0.0.1 and an accepted peer that writes raw bytes and frames
-// and reads frames with a time limit. The system's socket calls one by one
-// (pm/ip/socket_system.h, so that it runs on Windows too), independent of the
-// connection code under test. Header-only; shared by the dispatcher and
-// runner tests.
+// and reads frames with a time limit, and the host's requests over it. The
+// system's socket calls one by one (pm/ip/socket_system.h, so that it runs on
+// Windows too), independent of the connection code under test. Header-only;
+// shared by the dispatcher, task and runner tests.
 #include <chrono>
 #include <cstdint>
 #include <optional>
 #include <string>
 #include <utility>
 
+#include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include "pm/ip/socket_system.h"
@@ -153,5 +154,24 @@ class HostListener {
   pm::ip::SocketHandle fd_ = pm::ip::kNoSocket;
   int port_ = 0;
 };
+
+inline nlohmann::json Request(const std::string& command, std::uint64_t id, nlohmann::json body = nlohmann::json::object()) {
+  body["pm::command"] = command;
+  body["pm::unique_id"] = id;
+  body["pm::request"] = true;
+  return body;
+}
+
+// Sends a request and returns its reply (discarded when none comes), passing
+// over the task's own requests and notifications met on the way.
+inline nlohmann::json Ask(HostPeer& host, const std::string& command, std::uint64_t id,
+                          nlohmann::json body = nlohmann::json::object()) {
+  EXPECT_TRUE(host.WriteJson(Request(command, id, std::move(body))));
+  for (;;) {
+    const nlohmann::json frame = host.ReadJson(std::chrono::seconds(10));
+    if (!frame.is_object()) return nlohmann::json(nlohmann::json::value_t::discarded);
+    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
+  }
+}
 
 }  // namespace pmtest

@@ -2,8 +2,7 @@
 // The runner (PM_RUNNER_PATH, from the build) as a child process, started by
 // pm-host's process starter: its stderr goes to a file of its own, its
 // environment may add entries (NDI_LOOPBACK_DIR for a private registry
-// folder), and it is killed and reaped when the object goes. With it the
-// host-side request helpers the runner tests share.
+// folder), and it is killed and reaped when the object goes.
 #include <unistd.h>
 
 #include <atomic>
@@ -26,9 +25,6 @@
 namespace pmtest {
 
 using namespace std::chrono_literals;
-
-// Generous: the sanitizer builds start processes slowly on a busy machine.
-inline constexpr auto kExitLimit = 20s;
 
 // A fresh name under the test's temporary folder.
 inline std::string TempName(const std::string& stem, const std::string& suffix) {
@@ -61,8 +57,9 @@ class RunnerProcess {
   bool Started() const { return started_; }
   void Signal(int signal) { child_.Signal(signal); }
   // The exit status, 128 + the signal's number when a signal ended it,
-  // nullopt while it still runs after `limit`.
-  std::optional<int> Wait(std::chrono::milliseconds limit = kExitLimit) { return child_.Wait(limit); }
+  // nullopt while it still runs after `limit` (generous: the sanitizer builds
+  // start processes slowly on a busy machine).
+  std::optional<int> Wait(std::chrono::milliseconds limit = 20s) { return child_.Wait(limit); }
   std::string Stderr() const {
     std::ifstream in(stderrPath_);
     std::stringstream text;
@@ -87,31 +84,6 @@ inline int Occurrences(const std::string& text, const std::string& what) {
   int n = 0;
   for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
   return n;
-}
-
-inline nlohmann::json Request(const std::string& command, std::uint64_t id, nlohmann::json body = nlohmann::json::object()) {
-  body["pm::command"] = command;
-  body["pm::unique_id"] = id;
-  body["pm::request"] = true;
-  return body;
-}
-
-// Sends a request and returns its reply (discarded when none comes), passing
-// over the task's own requests and notifications met on the way.
-inline nlohmann::json Ask(HostPeer& host, const std::string& command, std::uint64_t id,
-                          nlohmann::json body = nlohmann::json::object()) {
-  EXPECT_TRUE(host.WriteJson(Request(command, id, std::move(body))));
-  for (;;) {
-    const nlohmann::json frame = host.ReadJson(10s);
-    if (!frame.is_object()) return nlohmann::json(nlohmann::json::value_t::discarded);
-    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
-  }
-}
-
-// The echo task answers test::echo with the value it was given.
-inline bool Echoes(HostPeer& host, std::uint64_t id) {
-  const nlohmann::json reply = Ask(host, "test::echo", id, {{"value", id}});
-  return reply.is_object() && reply.value("value", nlohmann::json()) == id && reply["pm::unique_id"] == id;
 }
 
 // A listener, the runner on `module` connected to it in a private registry

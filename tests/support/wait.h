@@ -11,8 +11,14 @@ namespace pmtest {
 
 // Calls `done` every few milliseconds until it returns true or `timeout`
 // passes; returns its last result.
-bool WaitFor(const std::function<bool()>& done,
-             std::chrono::milliseconds timeout = std::chrono::seconds(10));
+inline bool WaitFor(const std::function<bool()>& done, std::chrono::milliseconds timeout = std::chrono::seconds(10)) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  return done();
+}
 
 // Runs `blocking` (a call that blocks) on another thread, gives it time to
 // block, calls `wake` and returns what `blocking` returned. A wake that comes

@@ -12,7 +12,6 @@
 #include <functional>
 #include <future>
 #include <memory>
-#include <ostream>
 #include <string>
 #include <vector>
 
@@ -60,54 +59,48 @@ TEST(WindowsSocket, GatherSendArrivesWholeAndInOrder) {
 }
 
 // A thread blocked on a socket, and what another thread does to wake it.
-struct WakeCase {
-  const char* name;
-  std::function<bool(Connected&)> block;  // runs on its own thread; true when it ended as a wake should
-  std::function<void(Connected&)> wake;
-};
-void PrintTo(const WakeCase& c, std::ostream* os) { *os << c.name; }
-
-class WindowsSocketWake : public testing::TestWithParam<WakeCase> {};
-
-TEST_P(WindowsSocketWake, ReturnsPromptly) {
-  Connected c;
-  ASSERT_TRUE(c.ok);
-  auto blocked = std::async(std::launch::async, [&] { return GetParam().block(c); });
-  // Give it the chance to block; the case holds whether or not it has.
-  EXPECT_EQ(blocked.wait_for(200ms), std::future_status::timeout);
-  GetParam().wake(c);
-  ASSERT_EQ(blocked.wait_for(kWakeLimit), std::future_status::ready) << "still blocked";
-  EXPECT_TRUE(blocked.get());
+TEST(WindowsSocket, ABlockedThreadIsWokenPromptly) {
+  struct WakeCase {
+    const char* name;
+    std::function<bool(Connected&)> block;  // runs on its own thread; true when it ended as a wake should
+    std::function<void(Connected&)> wake;
+  };
+  const WakeCase cases[] = {
+      {"ReceiveByShutdown",
+       [](Connected& c) {
+         char buffer[16];
+         return c.server.ReceiveExact(buffer, sizeof buffer) <= 0;
+       },
+       [](Connected& c) { c.server.Shutdown(); }},
+      {"WaitReadableByShutdown",
+       [](Connected& c) {
+         return pm::ip::Socket::WaitReadable({&c.server}, 60'000) == std::vector<pm::ip::Socket*>{&c.server};
+       },
+       [](Connected& c) { c.server.Shutdown(); }},
+      {"WaitReadableByData",
+       [](Connected& c) {
+         return pm::ip::Socket::WaitReadable({&c.client, &c.server}, 60'000) ==
+                std::vector<pm::ip::Socket*>{&c.server};
+       },
+       [](Connected& c) { c.client.Send("!", 1); }},
+      {"AcceptByClose",
+       [](Connected& c) {
+         pm::ip::Socket next;
+         return !c.listener.Accept(next, 60'000);
+       },
+       [](Connected& c) { c.listener.Close(); }}};
+  for (const WakeCase& wakeCase : cases) {
+    SCOPED_TRACE(wakeCase.name);
+    Connected c;
+    ASSERT_TRUE(c.ok);
+    auto blocked = std::async(std::launch::async, [&] { return wakeCase.block(c); });
+    // Give it the chance to block; the case holds whether or not it has.
+    EXPECT_EQ(blocked.wait_for(200ms), std::future_status::timeout);
+    wakeCase.wake(c);
+    ASSERT_EQ(blocked.wait_for(kWakeLimit), std::future_status::ready) << "still blocked";
+    EXPECT_TRUE(blocked.get());
+  }
 }
-
-INSTANTIATE_TEST_SUITE_P(
-    Blocked, WindowsSocketWake,
-    testing::Values(
-        WakeCase{"ReceiveByShutdown",
-                 [](Connected& c) {
-                   char buffer[16];
-                   return c.server.ReceiveExact(buffer, sizeof buffer) <= 0;
-                 },
-                 [](Connected& c) { c.server.Shutdown(); }},
-        WakeCase{"WaitReadableByShutdown",
-                 [](Connected& c) {
-                   return pm::ip::Socket::WaitReadable({&c.server}, 60'000) ==
-                          std::vector<pm::ip::Socket*>{&c.server};
-                 },
-                 [](Connected& c) { c.server.Shutdown(); }},
-        WakeCase{"WaitReadableByData",
-                 [](Connected& c) {
-                   return pm::ip::Socket::WaitReadable({&c.client, &c.server}, 60'000) ==
-                          std::vector<pm::ip::Socket*>{&c.server};
-                 },
-                 [](Connected& c) { c.client.Send("!", 1); }},
-        WakeCase{"AcceptByClose",
-                 [](Connected& c) {
-                   pm::ip::Socket next;
-                   return !c.listener.Accept(next, 60'000);
-                 },
-                 [](Connected& c) { c.listener.Close(); }}),
-    [](const testing::TestParamInfo<WakeCase>& info) { return std::string(info.param.name); });
 
 TEST(WindowsSocket, WaitAfterOwnShutdownSeesItAtOnce) {
   Connected c;
@@ -126,8 +119,6 @@ TEST(WindowsSegment, NamedMappingIsSharedAndGoesWithItsLastHandle) {
   const std::string name = UniqueName("shared");
   auto writer = pm::NewCpuSegment();
   ASSERT_TRUE(writer->Create(name, 8192));
-  EXPECT_EQ(writer->Size(), 8192u);
-  EXPECT_EQ(writer->GetName(), name);
   std::memcpy(writer->Data() + 8000, "frame", 5);
 
   auto reader = pm::NewCpuSegment();
@@ -148,37 +139,21 @@ TEST(WindowsSegment, NamedMappingIsSharedAndGoesWithItsLastHandle) {
   EXPECT_FALSE(pm::NewCpuSegment()->Open(name, 8192)) << "nothing is left once every handle closed";
 }
 
-TEST(WindowsSegment, UnnamedSegmentsGetDistinctNames) {
-  auto a = pm::NewCpuSegment();
-  auto b = pm::NewCpuSegment();
-  ASSERT_TRUE(a->Create(std::nullopt, 4096));
-  ASSERT_TRUE(b->Create(std::nullopt, 4096));
-  EXPECT_FALSE(a->GetName().empty());
-  EXPECT_NE(a->GetName(), b->GetName());
+// A size of zero, a backslash (the namespace separator) and a missing name
+// fail and map nothing. (Names made up for unnamed segments come from the
+// fresh-id generator both systems share: tests/pm/runtime.)
+TEST(WindowsSegment, BadRequestsFailAndMapNothing) {
+  const std::function<bool(pm::SharedCpuMemory&)> attempts[] = {
+      [](pm::SharedCpuMemory& s) { return s.Create(UniqueName("zero"), 0); },
+      [](pm::SharedCpuMemory& s) { return s.Create(UniqueName("a\\b"), 4096); },
+      [](pm::SharedCpuMemory& s) { return s.Open(UniqueName("missing"), 4096); }};
+  for (const auto& attempt : attempts) {
+    SCOPED_TRACE(&attempt - attempts);
+    auto segment = pm::NewCpuSegment();
+    EXPECT_FALSE(attempt(*segment));
+    EXPECT_EQ(segment->Data(), nullptr);
+  }
 }
-
-struct BadSegment {
-  const char* name;
-  std::function<bool(pm::SharedCpuMemory&)> attempt;
-};
-void PrintTo(const BadSegment& c, std::ostream* os) { *os << c.name; }
-
-class WindowsSegmentRefuses : public testing::TestWithParam<BadSegment> {};
-
-TEST_P(WindowsSegmentRefuses, FailsAndMapsNothing) {
-  auto segment = pm::NewCpuSegment();
-  EXPECT_FALSE(GetParam().attempt(*segment));
-  EXPECT_EQ(segment->Data(), nullptr);
-}
-
-INSTANTIATE_TEST_SUITE_P(
-    Inputs, WindowsSegmentRefuses,
-    testing::Values(BadSegment{"SizeZero", [](pm::SharedCpuMemory& s) { return s.Create(UniqueName("zero"), 0); }},
-                    BadSegment{"Backslash",
-                               [](pm::SharedCpuMemory& s) { return s.Create(UniqueName("a\\b"), 4096); }},
-                    BadSegment{"OpenMissing",
-                               [](pm::SharedCpuMemory& s) { return s.Open(UniqueName("missing"), 4096); }}),
-    [](const testing::TestParamInfo<BadSegment>& info) { return std::string(info.param.name); });
 
 // A process that ended is no longer alive although it can still be opened
 // (here: its handle is still held); a process uses CPU time as it runs.

@@ -1,6 +1,8 @@
 // Loopback sockets and the acceptor against the real kernel: ports, error
 // classification, timeouts, waking a blocked accept, descriptor lifetime, and
-// that a vanished peer never raises SIGPIPE. Waking a blocked reader or
+// that a vanished peer never raises SIGPIPE. (An accepted end that did not
+// block would fail every timed read of the connection tests; Nagle's delay
+// is the benchmarks'.) Waking a blocked reader or
 // sender, readiness and sending lists are tested through the connections
 // above (tests/pm/ipc).
 #include "pm/ip/socket.h"
@@ -8,7 +10,6 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
-#include <netinet/tcp.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/time.h>
@@ -42,7 +43,7 @@ struct Pair {
   }
 };
 
-TEST(SocketErrors, ClassifyByTheirNumbersAndPrintBoth) {
+TEST(SocketErrors, ClassifyByTheirNumbers) {
   struct Row {
     int err, wsa;
     bool gone, timedOut, interrupted, alreadyConnected;
@@ -53,16 +54,14 @@ TEST(SocketErrors, ClassifyByTheirNumbersAndPrintBoth) {
       {ENOTSOCK, ENOTSOCK, true, false, false, false},   {EBADF, EBADF, true, false, false, false},
       {ECONNRESET, ECONNRESET, true, false, false, false}, {EPIPE, EPIPE, true, false, false, false},
       {ECONNABORTED, ECONNABORTED, false, true, false, false}, {ETIMEDOUT, ETIMEDOUT, false, true, false, false},
-      {EAGAIN, EAGAIN, false, true, false, false},       {EWOULDBLOCK, EWOULDBLOCK, false, true, false, false},
+      {EAGAIN, EAGAIN, false, true, false, false},
       {EINTR, 0, false, false, true, false},             {0, EINTR, false, false, true, false},
       {EISCONN, EISCONN, false, false, false, true},     {ECONNREFUSED, ECONNREFUSED, false, false, false, false},
       {0, 10054, false, false, false, false},            {-3, 111, false, false, false, false},
   };
   for (const Row& row : rows) {
     const LastSocketError error{row.err, row.wsa};
-    const std::string text = pm::ip::ErrorText(error);
-    SCOPED_TRACE(text);
-    EXPECT_EQ(text, "[errno=" + std::to_string(row.err) + ",wsa=" + std::to_string(row.wsa) + "]");
+    SCOPED_TRACE(pm::ip::ErrorText(error));  // (its form: in the acceptor's line, tests/pm/ipc)
     EXPECT_EQ(error.Gone(), row.gone);
     EXPECT_EQ(error.TimedOut(), row.timedOut);
     EXPECT_EQ(error.Interrupted(), row.interrupted);
@@ -80,8 +79,7 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   Socket second;
   ASSERT_TRUE(second.Init(a.port()));
   EXPECT_FALSE(second.Bind());
-  EXPECT_TRUE(log.Contains("ipc::Socket : Bind failed : err : " + std::to_string(EADDRINUSE) +
-                           ", was : " + std::to_string(EADDRINUSE)));
+  EXPECT_EQ(log.Count("Bind failed"), 1);
 
   const int closedPort = b.port();
   b.acceptor.Close();
@@ -90,19 +88,7 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   ASSERT_TRUE(client.Init(closedPort));
   EXPECT_FALSE(client.Connect());
   EXPECT_EQ(errno, ECONNREFUSED);  // the caller classifies this after the log line
-  EXPECT_TRUE(log.Contains("Socket::Connect Failed : [errno=111,wsa=111]"));
-}
-
-TEST(SocketAccept, ConnectedEndsAreBlockingWithoutNagleOnANonBlockingListener) {
-  Pair pair;
-  for (Socket* s : {&pair.client, &pair.server}) {
-    int on = 0;
-    socklen_t length = sizeof(on);
-    ASSERT_EQ(::getsockopt(s->GetHandle(), IPPROTO_TCP, TCP_NODELAY, &on, &length), 0);
-    EXPECT_NE(on, 0);
-    EXPECT_EQ(::fcntl(s->GetHandle(), F_GETFL) & O_NONBLOCK, 0);
-  }
-  EXPECT_EQ(::fcntl(pair.listening.acceptor.GetHandle(), F_GETFL) & O_NONBLOCK, O_NONBLOCK);
+  EXPECT_EQ(log.Count("Connect Failed"), 1);
 }
 
 // Nobody connecting fails after the timeout. Close wakes an accept waiting on

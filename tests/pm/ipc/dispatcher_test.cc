@@ -58,15 +58,6 @@ class DispatcherTest : public ::testing::Test {
     std::lock_guard<std::mutex> guard(repliesMutex_);
     return replies_;
   }
-  // A request as the host sends it; the reply it gets.
-  Json Ask(const std::string& command, std::uint64_t id, Json body = Json::object()) {
-    body["pm::command"] = command;
-    body["pm::unique_id"] = id;
-    body["pm::request"] = true;
-    EXPECT_TRUE(host_.WriteJson(body));
-    return host_.ReadJson();
-  }
-
   pmtest::LogCapture log_;  // first: outlives the dispatcher's threads
   std::shared_ptr<pmtest::ManualClock> clock_ = std::make_shared<pmtest::ManualClock>();
   pmtest::HostListener listener_;
@@ -78,23 +69,6 @@ class DispatcherTest : public ::testing::Test {
 };
 
 // --- Requests from the task ---------------------------------------------
-
-// The envelope goes over whatever the caller put in its place, and the
-// caller's payload keeps the envelope that went out; a request with no time
-// at all is still sent.
-TEST_F(DispatcherTest, SuccessiveRequestsCarryIdsOneApartAndOverwriteTheEnvelope) {
-  Json first = {{"pm::unique_id", "forged"}, {"pm::command", 5}, {"pm::request", false}, {"arg", 1}};
-  Json second = Json::object();
-  EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", first, 10000));
-  EXPECT_TRUE(dispatcher_->RpcRequest("pm::tsrc::update_gui", second, 0));
-  EXPECT_EQ(dispatcher_->EarliestDeadlineNs(), clock_->NowNs());  // a zero timeout is due at once
-  const std::uint64_t id = first["pm::unique_id"].get<std::uint64_t>();
-  EXPECT_EQ(first, (Json{{"pm::unique_id", id}, {"pm::command", "pm::tsrc::update_gui"}, {"pm::request", true},
-                         {"arg", 1}}));
-  EXPECT_EQ(host_.ReadJson(), first);
-  EXPECT_EQ(host_.ReadJson()["pm::unique_id"], id + 1);
-  EXPECT_EQ(dispatcher_->PendingCount(), 2u);
-}
 
 TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) {
   StartReceiving();
@@ -127,15 +101,19 @@ TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) 
   EXPECT_EQ(dispatcher_->PendingCount(), 0u);
 }
 
-// A reply completes its request once; the same reply again, one to an id
-// never sent, and one without a usable id are logged and skipped.
-TEST_F(DispatcherTest, ReplyCompletesItsPendingRequestOnceAndRunsTheCallback) {
+// The envelope goes over whatever the caller put in its place, and the
+// caller's payload keeps the envelope that went out; ids go up by one. A
+// reply completes its request once; the same reply again, one to an id never
+// sent, and one without a usable id are logged and skipped.
+TEST_F(DispatcherTest, RequestsCarryTheirEnvelopeAndAReplyCompletesThemOnce) {
   StartReceiving();
-  Json payload = {{"q", 1}}, other;
+  Json payload = {{"pm::unique_id", "forged"}, {"pm::command", 5}, {"pm::request", false}, {"q", 1}}, other;
   dispatcher_->RpcRequest("x::start_queue", payload, 100, Collect());
   dispatcher_->RpcRequest("x::other", other, 100);
   const Json sent = host_.ReadJson();
-  host_.ReadJson();
+  EXPECT_EQ(sent, payload);
+  EXPECT_EQ(sent, pmtest::Request("x::start_queue", sent["pm::unique_id"].get<std::uint64_t>(), {{"q", 1}}));
+  EXPECT_EQ(host_.ReadJson()["pm::unique_id"], sent["pm::unique_id"].get<std::uint64_t>() + 1);
   host_.WriteJson({{"pm::response", true}, {"pm::unique_id", sent["pm::unique_id"]}, {"port", 7}});
   ASSERT_TRUE(pmtest::WaitFor([&] { return Replies().size() == 1; }));
   EXPECT_EQ(Replies()[0]["port"], 7);
@@ -170,14 +148,14 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
   dispatcher_->RegisterHandler("scalar", [](const Json&, Json& response) { response = 5; });
   StartReceiving();
 
-  const Json reply = Ask("echo", 41, {{"value", "héllo"}});
+  const Json reply = pmtest::Ask(host_, "echo", 41, {{"value", "héllo"}});
   EXPECT_EQ(reply, (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
   const std::pair<const char*, const char*> failures[] = {  // command, error (null: any text)
       {"pm::tsrc::nope", "unknown command"}, {"boom", "no such source"}, {"strict", nullptr}, {"scalar", nullptr}};
   std::uint64_t id = 100;
   for (const auto& [command, text] : failures) {
     SCOPED_TRACE(command);
-    const Json error = Ask(command, ++id);
+    const Json error = pmtest::Ask(host_, command, ++id);
     ASSERT_TRUE(error["pm::error"].is_string());
     // The envelope and the error, nothing the handler left.
     EXPECT_EQ(error, (Json{{"pm::unique_id", id}, {"pm::command", command}, {"pm::response", true},
@@ -187,7 +165,7 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
   EXPECT_TRUE(host_.WriteJson({{"pm::unique_id", 5}}));
   EXPECT_EQ(host_.ReadJson()["pm::error"], "unknown command");
 
-  EXPECT_EQ(Ask("echo", 6, {{"value", 3}})["value"], 3);
+  EXPECT_EQ(pmtest::Ask(host_, "echo", 6, {{"value", 3}})["value"], 3);
   EXPECT_TRUE(log_.Contains("no such source"));
   EXPECT_FALSE(dispatcher_->Ended());
 }
@@ -204,7 +182,8 @@ TEST_F(DispatcherTest, TextThatIsNotAJsonObjectIsSkippedAndTheConnectionStays) {
                                std::string(50000, '[') + std::string(50000, ']') + "}"));
 
   // The first reply the host sees is the one to its valid request.
-  const Json reply = Ask("echo", 7, {{"value", "after"}});
+  ASSERT_TRUE(host_.WriteJson(pmtest::Request("echo", 7, {{"value", "after"}})));
+  const Json reply = host_.ReadJson();
   EXPECT_EQ(reply["value"], "after");
   EXPECT_EQ(reply["pm::unique_id"], 7);
   EXPECT_EQ(log_.Count("is not JSON, skipped"), 4);          // bad text, also the empty one
@@ -275,26 +254,5 @@ TEST_P(DispatcherEnding, EndsReceivingOnce) {
 INSTANTIATE_TEST_SUITE_P(Ways, DispatcherEnding,
                          ::testing::Values(Ending::kStop, Ending::kStopFromAHandler, Ending::kHostLeaves,
                                            Ending::kHostLeavesInsideAFrame, Ending::kOversizeLength));
-
-// Without a connection, Start reports the end at once (also after an early
-// Stop), requests are refused, and their expiry still runs.
-TEST(DispatcherWithoutConnection, ReportsTheEndAtOnceAndStillExpiresRequests) {
-  for (const bool stopFirst : {true, false}) {
-    SCOPED_TRACE(stopFirst ? "stopped before start" : "started");
-    auto clock = std::make_shared<pmtest::ManualClock>();
-    auto dispatcher = std::make_shared<pm::RpcDispatcher>(nullptr, clock);
-    if (stopFirst) dispatcher->Stop();
-    int ended = 0;
-    dispatcher->Start([&] { ++ended; });
-    EXPECT_EQ(ended, 1);
-    EXPECT_TRUE(dispatcher->Ended());
-    std::atomic<int> expired{0};
-    Json payload;
-    EXPECT_FALSE(dispatcher->RpcRequest("c", payload, 5, [&](const Json&) { expired.fetch_add(1); }));
-    clock->Advance(5 * kMs);
-    EXPECT_TRUE(stopFirst || pmtest::WaitFor([&] { return expired.load() == 1; }));
-    dispatcher->Stop();
-  }
-}
 
 }  // namespace

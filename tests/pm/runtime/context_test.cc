@@ -1,10 +1,9 @@
 // The context's singleton registry. (The test log capture takes the context
-// before main, so a first call racing here could not be seen.)
+// before main, so a first call racing here could not be seen. LoadFunction's
+// one user, the Windows thread names, is tested under Wine in ids_text_test.)
 #include <gtest/gtest.h>
 
 #include "pm/runtime/context.h"
-#include "pm/runtime/load_function.h"
-#include "support/platform.h"
 
 namespace {
 
@@ -29,12 +28,6 @@ TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
   auto none = pm::FindSingleton("registry-empty", [] { return nullptr; });
   EXPECT_EQ(none, nullptr);
   EXPECT_EQ(pm::GetContext()->registry.count("registry-empty"), 1u);
-}
-
-TEST(LoadFunction, FindsALibraryFunctionAndReportsMissingOnes) {
-  EXPECT_NE(pm::LoadFunction(pmtest::kSystemLibrary, pmtest::kSystemFunction), nullptr);
-  EXPECT_EQ(pm::LoadFunction(pmtest::kSystemLibrary, "no_such_function_here"), nullptr);
-  EXPECT_EQ(pm::LoadFunction(pmtest::kMissingLibrary, pmtest::kSystemFunction), nullptr);
 }
 
 }  // namespace

@@ -19,17 +19,14 @@ using Lines = std::vector<std::string>;
 // null format writes nothing.
 TEST(Log, JoinsTagAndTextWithExactlyOneNewline) {
   pmtest::LogCapture capture;
-  Log(LogType::Normal, "#ndisource: ", "%s", "x");
-  Log(LogType::Normal, "#ndisource: ", "already %d\n", 1);
+  Log(LogType::Normal, "t: ", "%s", "x");
+  Log(LogType::Normal, "t: ", "already %d\n", 1);
   Log(LogType::Normal, nullptr, "%s", "");
   Log(LogType::Normal, "", nullptr);
-  LogText("#ndisource: ", "waiting for source to be found");
-  LogText("#ndisource: ", "failed to create NDI receiver\n");
+  LogText("t: ", "text\n");
   LogText("", nullptr);
   LogText(nullptr, "plain");
-  EXPECT_EQ(capture.Lines(), (Lines{"#ndisource: x\n", "#ndisource: already 1\n", "\n",
-                                    "#ndisource: waiting for source to be found\n",
-                                    "#ndisource: failed to create NDI receiver\n", "\n", "plain\n"}));
+  EXPECT_EQ(capture.Lines(), (Lines{"t: x\n", "t: already 1\n", "\n", "t: text\n", "\n", "plain\n"}));
 }
 
 TEST(Log, LongLinesAreDeliveredWholeByBothEntryPointsAndLeaveNothingBehind) {

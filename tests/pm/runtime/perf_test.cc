@@ -35,24 +35,18 @@ TEST(PerformanceLog, FiftyFirstSlowRunStopsImmediateLogging) {
   pmtest::LogCapture capture;
   PerformanceLog log("busy", 1);
   for (int i = 0; i < 60; ++i) log.Record(10 * kMs + i);
-  const auto lines = capture.Lines();
-  ASSERT_EQ(lines.size(), 51u);
-  EXPECT_EQ(lines[49], "busy 10 ms\n");
-  EXPECT_EQ(lines[50],
-            "busy Immediate performance logging stopped: too many entries (50).  Summary will still be "
-            "accurate\n");
+  ASSERT_EQ(capture.Lines().size(), 51u);
+  EXPECT_EQ(capture.Count("Immediate performance logging stopped"), 1);
 }
 
 TEST(PerformanceScope, StoppingTwiceRecordsOnce) {
   PerformanceLog log("scope", 1000000);
   {
     pm::PerformanceScope scope(log);
-    EXPECT_GE(scope.Stop(), 0);
+    scope.Stop();
     EXPECT_EQ(scope.Stop(), 0);
   }
   EXPECT_EQ(log.Count(), 1);
-  { pm::PerformanceScope scope(log); }
-  EXPECT_EQ(log.Count(), 2);
 }
 
 }  // namespace

@@ -9,9 +9,7 @@
 
 namespace {
 
-pm::VideoFormat Format(std::uint32_t code, int width, int height) {
-  return pmtest::VideoFormatOf(code, width, height);
-}
+constexpr auto Format = pmtest::VideoFormatOf;
 
 TEST(FrameFormats, StridesAndSizesOfEveryCode) {
   struct Row {
@@ -59,12 +57,9 @@ TEST(FrameFormats, LayoutPlanesPutsNV12ChromaAfterTheLumaRowsAndNeedsABase) {
   std::uint8_t base[1];
   const pm::VideoPlanes nv12 = pm::LayoutPlanes(Format(pm::kCodeNV12, 16, 9), base, 0);
   ASSERT_EQ(nv12.planeCount, 2);
-  EXPECT_EQ(nv12.plane[0].data, base);
-  EXPECT_EQ(nv12.plane[0].rows, 9);
-  EXPECT_EQ(nv12.plane[0].stride, 16);  // 0 became the default stride
-  EXPECT_EQ(nv12.plane[1].data, base + 9 * 16);
-  EXPECT_EQ(nv12.plane[1].rows, 4);
-  EXPECT_EQ(nv12.plane[1].stride, 16);
+  // Stride 0 became the default one.
+  EXPECT_TRUE(nv12.plane[0].data == base && nv12.plane[0].rows == 9 && nv12.plane[0].stride == 16);
+  EXPECT_TRUE(nv12.plane[1].data == base + 9 * 16 && nv12.plane[1].rows == 4 && nv12.plane[1].stride == 16);
 
   const pm::VideoPlanes rgba = pm::LayoutPlanes(Format(pm::kCodeRgba, 16, 9), base, 100);
   ASSERT_EQ(rgba.planeCount, 1);
