@@ -13,6 +13,7 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -79,15 +80,8 @@ class Sender {
 
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
-// Receiving `source` from the folder's registry; what arrives goes to `sink`
-// as well when one is given (it must outlive the run).
-pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source, RampSink* sink = nullptr);
-// Receives until `done` holds (looked at every few milliseconds from the
-// start) or `limit` passes, instead of for a fixed time that a loaded machine
-// may not give the chain to get going. `o.seconds` and `o.interrupted` are
-// taken over.
-pmhost::ReceiveResult ReceiveUntil(pmhost::ReceiveOptions o, const std::function<bool()>& done,
-                                   std::chrono::milliseconds limit = std::chrono::seconds(30));
+// Receiving `source` from the folder's registry.
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source);
 
 // A sender that died with nothing connected, its port taken at once by
 // another sender, and itself started again elsewhere; a source started for it
@@ -107,7 +101,7 @@ void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder)
 // resident memory, with its private (anonymous) part apart: the resident
 // shared memory is the pool the host is handed pictures in, which grows with
 // the host's reading pace, not with what the process keeps for itself.
-// nullopt when the process cannot be read.
+// nullopt when the process cannot be read. pid 0 is this process.
 struct ProcessUsage {
   int descriptors = 0;
   int threads = 0;
@@ -115,15 +109,14 @@ struct ProcessUsage {
   long privateKiB = 0;
 };
 std::optional<ProcessUsage> UsageOf(pid_t pid);
-// Of this process.
-std::optional<ProcessUsage> OwnUsage();
 // A process's level: descriptors and threads at their lowest, memory at its
 // highest, over a few looks (a descriptor the runtime opens for a moment, say
 // to list the registry, is not part of it).
 std::optional<ProcessUsage> LevelOf(pid_t pid);
 // Threads end and descriptors close a moment after the reply that stopped
-// them: waits for the level, then expects it exactly (no growth, and nothing
-// closed that should still be open).
+// them (in this process: after the objects that held them go): waits for the
+// level, then expects it exactly (no growth, and nothing closed that should
+// still be open).
 void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what);
 
 // What the task reported to the host, by source id. Record runs on the
@@ -234,25 +227,19 @@ struct Chain {
   std::string id;
 };
 
-// This process's level before a case. A thread is started and joined first:
-// ThreadSanitizer starts a background thread of its own with the first one,
-// and that thread stays.
-std::optional<ProcessUsage> OwnLevel();
-// This process's descriptors (connections, mappings, children's pipes) and
-// threads (readers, child watchers) come back to `before`; they close a
-// moment after the objects that held them go.
-void ExpectOwnUsageBackTo(const ProcessUsage& before);
-
 // For cases that run programs: whatever the case did, this process holds
 // what it held before it.
 class OwnLevelKept : public ::testing::Test {
  protected:
+  // A thread is started and joined first: ThreadSanitizer starts a
+  // background thread of its own with the first one, and that thread stays.
   void SetUp() override {
-    own_ = OwnLevel();
+    std::thread([] {}).join();
+    own_ = UsageOf(0);
     ASSERT_TRUE(own_);
   }
   void TearDown() override {
-    if (own_) ExpectOwnUsageBackTo(*own_);
+    if (own_) ExpectBackAtLevel(0, *own_, "the test process");
   }
 
  private:
