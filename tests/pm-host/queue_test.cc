@@ -161,18 +161,4 @@ TEST(SegmentCleanup, RemovesOnlyTheBaseFollowedByDigits) {
   EXPECT_EQ(pmhost::RemoveSegments("a/b"), 0);
 }
 
-TEST(SegmentMapping, UnmapsOnDestructionAndMovesOwnership) {
-  Segment s("/" + Base() + "m", 4096, 0x5A);
-  pmhost::SegmentMapping m = pmhost::SegmentMapping::Open("/" + Base() + "m", 4096);
-  ASSERT_TRUE(m);
-  const void* address = m.Data();
-  pmhost::SegmentMapping moved = std::move(m);
-  EXPECT_FALSE(m);  // NOLINT: moved-from is empty by contract
-  EXPECT_EQ(moved.Data(), address);
-  moved = pmhost::SegmentMapping();
-  // The page is gone from this process: mincore reports ENOMEM for it.
-  unsigned char vec = 0;
-  EXPECT_NE(::mincore(const_cast<void*>(address), 4096, &vec), 0);
-}
-
 }  // namespace
