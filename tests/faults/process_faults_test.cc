@@ -287,14 +287,18 @@ TEST_F(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevS
   EXPECT_EQ(SegmentsOf({base}), 0) << folder.ReadRunnerLog();
 }
 
-TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBusyWaiting) {
+TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreReceivedFromTheirFirstReceivingReport) {
   // Four sources in one runner, each sender killed and restarted five times
   // together: 20 kills and returns. A source notices a returned sender on
   // its 5-second poll of the idle state, so 20 rounds one after another
   // would take over 100 s; four at a time keep the same count in a quarter
-  // of that.
+  // of that. Each round starts the senders again at its own delay after
+  // their sources reported them gone, and each time every source reports
+  // it connecting and receiving once, with pictures coming with that
+  // "receiving" (not a second connecting/receiving cycle later). Delays
+  // are the input; everything else waits for its condition.
   constexpr int kSenders = 4;
-  constexpr int kRounds = 5;
+  const std::chrono::milliseconds delays[] = {200ms, 500ms, 1000ms, 2000ms, 6000ms};
   // 1080p at 30 fps: a 4 MB picture is on the socket a good part of each
   // frame period, and every kill lands at a random point of one.
   const std::vector<std::string> args = {"--width", "1920", "--height", "1080", "--fps", "30", "--no-audio"};
@@ -330,8 +334,8 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
 
   double goneCpu = 0, goneWall = 0;
   long highestPrivate = level->privateKiB;
-  for (int round = 0; round < kRounds; ++round) {
-    SCOPED_TRACE("round " + std::to_string(round));
+  for (const auto delay : delays) {
+    SCOPED_TRACE("started again " + std::to_string(delay.count()) + " ms after state 3");
     for (int i = 0; i < kSenders; ++i) marks[i] = c.reports.States(ids[i]).size();
     for (auto& sender : senders) {
       std::this_thread::sleep_for(std::chrono::microseconds(offsetUs(random)));
@@ -345,11 +349,10 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
       return true;
     }, kPatience)) << "a source did not notice its sender's end";
 
-    // Every sender gone, every source idle: the runner must sleep. (Time
-    // must pass to measure it.)
+    // Every sender gone, every source idle: the runner must sleep.
     const double cpuBefore = pm::ProcessCpuSeconds(c.Runner());
     const auto start = Clock::now();
-    std::this_thread::sleep_for(800ms);
+    std::this_thread::sleep_for(delay);
     const double cpu = pm::ProcessCpuSeconds(c.Runner()) - cpuBefore;
     const double wall = SecondsSince(start);
     if (const auto gone = pmtest::UsageOf(c.Runner())) highestPrivate = std::max(highestPrivate, gone->privateKiB);
@@ -357,13 +360,18 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
     goneWall += wall;
 
     for (int i = 0; i < kSenders; ++i) {
-      marks[i] = c.reports.States(ids[i]).size();
       videos[i] = c.sink.Videos(ids[i]);
       senders[i] = std::make_unique<Sender>();
       ASSERT_TRUE(senders[i]->Start(c.folder, names[i], args));
     }
+    // A picture may overtake the report it came with.
     ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience))
         << "not every source came back\n" << c.Log();
+    for (int i = 0; i < kSenders; ++i) {
+      const std::vector<int> all = c.reports.States(ids[i]);
+      EXPECT_EQ(std::vector<int>(all.begin() + static_cast<long>(marks[i]), all.end()), (std::vector<int>{3, 1, 2}))
+          << ids[i] << ": states since the kill, when pictures came again";
+    }
     const std::optional<ProcessUsage> now = pmtest::UsageOf(c.Runner());
     ASSERT_TRUE(now);
     highestPrivate = std::max(highestPrivate, now->privateKiB);
@@ -396,42 +404,6 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndRestarted20TimesComeBackWithoutBus
   EXPECT_EQ(c.host.Stop(), 0);
   EXPECT_EQ(SegmentsOf(bases), 0);
   senders.clear();
-}
-
-// A sender killed and started again under its name, at several delays after
-// its source reported it gone: each time the source reports it connecting
-// and receiving once, and pictures come with "receiving" (not a second
-// connecting/receiving cycle later). Delays are the input; everything else
-// waits for its condition.
-TEST_F(ProcessFaults, ASenderStartedAgainSoonAfterItWentIsReceivedFromItsFirstReceivingReport) {
-  const std::vector<std::chrono::milliseconds> delays = {200ms, 500ms, 1000ms, 2000ms, 6000ms};
-  const std::vector<std::string> args = {"--width", "64", "--height", "16", "--fps", "30"};
-  Chain c(/*ramp=*/false);
-  ASSERT_NO_FATAL_FAILURE(c.Start("Return", args));
-  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > 0 && c.reports.ReportedSince(c.id, 0, 2); }, kPatience))
-      << c.Log();
-  for (const auto delay : delays) {
-    SCOPED_TRACE("started again " + std::to_string(delay.count()) + " ms after state 3");
-    const std::size_t mark = c.reports.States(c.id).size();
-    c.sender->Process().Signal(SIGKILL);
-    ASSERT_TRUE(c.sender->Process().Wait(kPatience).has_value());
-    ASSERT_TRUE(pmtest::WaitFor([&] { return c.reports.ReportedSince(c.id, mark, 3); }, kPatience)) << c.Log();
-    std::this_thread::sleep_for(delay);
-    const int videos = c.sink.Videos(c.id);
-    c.sender = std::make_unique<Sender>();
-    ASSERT_TRUE(c.sender->Start(c.folder, "Return", args));
-    // The source looks for its sender every 5 s while idle. A picture may
-    // overtake the report it came with.
-    ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > videos && c.reports.ReportedSince(c.id, mark, 2); },
-                                kPatience))
-        << c.Log();
-    const std::vector<int> all = c.reports.States(c.id);
-    EXPECT_EQ(std::vector<int>(all.begin() + static_cast<long>(mark), all.end()), (std::vector<int>{3, 1, 2}))
-        << "states since the kill, when pictures came again";
-  }
-  ASSERT_TRUE(c.Session().StopSource(c.id));
-  c.EndDiscoveryAndExpectOrderlyExit();
 }
 
 TEST_F(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemoryOrSegmentBehind) {
