@@ -20,7 +20,6 @@
 #include <atomic>
 #include <chrono>
 #include <functional>
-#include <cstdio>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -150,7 +149,7 @@ TEST_F(ProcessFaults, AHostThatNeverReturnsTokensStopsTheSourceAt240VideoSegment
   c.StopAndExpectBackAt(base, *level);
 }
 
-TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwedAreReleased) {
+TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheSourceRunsOnWithoutGrowingItsPool) {
   Chain c(/*ramp=*/false);
   ASSERT_NO_FATAL_FAILURE(c.Start("Drop", Small("60")));
   std::optional<ProcessUsage> level;
@@ -163,7 +162,6 @@ TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwe
   const std::string base = c.QueueBase();
   ASSERT_FALSE(base.empty());
   ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Holding() && SegmentsOf({base}) >= 6; }, kPatience)) << c.Log();
-  const int heldSegments = SegmentsOf({base});
 
   // The host closes its end while the reader thread still holds the
   // picture (Stop joins that thread, so it runs beside the test).
@@ -175,15 +173,8 @@ TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwe
   c.sink.Open();
   closer.join();
   ASSERT_TRUE(dropped) << c.Log();
-  const std::string log = c.Log();
-  std::size_t owed = 0, released = 0;
-  const std::size_t line = log.find("pm::ipc:queue::Producer : Reader gone");
-  ASSERT_EQ(std::sscanf(log.c_str() + line, "pm::ipc:queue::Producer : Reader gone, %zu owed tokens given up, %zu released.",
-                        &owed, &released),
-            2)
-      << log.substr(line, 120);
-  EXPECT_GE(owed, static_cast<std::size_t>(heldSegments)) << "every held segment's token was owed";
-  EXPECT_EQ(released, owed) << "no other reader owes them";
+  // (That the tokens it owed are given up is the producer's case,
+  // tests/pm/ipc.)
 
   // Without a reader every record is released as it is sent: the pool does
   // not grow and never runs dry. (Time must pass here: 30 pictures at 60 fps.)
@@ -193,7 +184,7 @@ TEST_F(ProcessFaults, AHostThatClosesItsQueueMidStreamIsDroppedAndTheTokensItOwe
   EXPECT_EQ(c.Log().find("video well ran dry"), std::string::npos);
 
   // The runner still answers, and the source's loop still runs: the tally
-  // reaches the c.sender->
+  // reaches the sender.
   EXPECT_TRUE(c.Session().ShotEvent(c.id, "TALLY_PREVIEW_ON").has_value());
   EXPECT_TRUE(c.sender->WaitFor("tally", [](const json& e) { return e.value("preview", false); }));
   EXPECT_EQ(c.reports.States(c.id).back(), 2);
