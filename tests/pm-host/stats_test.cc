@@ -49,4 +49,17 @@ TEST(ReceiveStats, LatencyIsMeasuredAboveTheQuickestPictureAfterTheFirstSecond) 
   EXPECT_EQ(s.frames, 200u);
 }
 
+TEST(ReceiveStats, AWarmUpBurstDoesNotCountButLaterQueueingDoes) {
+  pmhost::ReceiveStats stats;
+  for (int i = 0; i < 300; ++i) {
+    // The first 10 pictures arrive together 200 ms late; from picture 200 on
+    // every picture is 10 ms late.
+    const std::int64_t extra = i < 10 ? 200'000'000 : (i >= 200 ? 10'000'000 : 0);
+    stats.Video(i * kTicksPerFrame, 0, 64, 16, 128, i * kNsPerFrame + extra, i * kNsPerFrame + extra);
+  }
+  const pmhost::StatsSnapshot s = stats.Snapshot(300 * kNsPerFrame);
+  EXPECT_NEAR(s.p50Ms, 0.0, 0.01);
+  EXPECT_NEAR(s.p99Ms, 10.0, 0.01);
+}
+
 }  // namespace
