@@ -7,22 +7,27 @@
 
 #include <algorithm>
 #include <chrono>
+#include <condition_variable>
+#include <cstdint>
 #include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <thread>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
+#include "pm-host/checks.h"
 #include "pm-host/host.h"
 #include "pm-host/process.h"
+#include "pm-host/queue_reader.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/json.h"
-#include "ramp_sink.h"
 #include "support/wait.h"
 
 namespace pmtest {
@@ -77,17 +82,137 @@ class Sender {
   pmhost::ChildProcess process_;
 };
 
+// What the host is handed, checked on the queues' reader threads as it
+// arrives: ramp pictures and sound intact (when the senders send the ramp
+// pattern), picture numbers rising and sound without gaps for each source,
+// the picture sizes and channel counts seen.
+//
+// It is also a gate: while shut, a reader thread waits inside OnVideo with
+// the picture it brought, so neither that token nor any record queued behind
+// it goes back to the task. Open it before the host stops (stopping joins
+// those threads).
+//
+// Lock: lock_ guards every field below it; nothing is called under it.
+class RampSink : public pmhost::FrameSink {
+ public:
+  struct Size {
+    int width = 0;
+    int height = 0;
+    bool operator==(const Size&) const = default;
+  };
+
+  explicit RampSink(bool ramp = true) : ramp_(ramp) {}
+
+  void OnVideo(const std::string& id, const pmhost::VideoFrame& frame) override {
+    std::int64_t n = -1;
+    const std::string check = ramp_ ? pmhost::CheckRampPicture(frame, &n) : std::string();
+    std::unique_lock<std::mutex> hold(lock_);
+    Stream& s = streams_[id];
+    if (!check.empty()) Problem("picture " + std::to_string(n) + ": " + check);
+    if (ramp_ && s.pictures > 0 && n <= s.lastFrame) {
+      Problem("frame " + std::to_string(n) + " after " + std::to_string(s.lastFrame));
+    }
+    ++s.pictures;
+    s.lastFrame = n;
+    const Size size{frame.width, frame.height};
+    if (sizes_.empty() || !(sizes_.back().first == size)) sizes_.push_back({size, 0});
+    ++sizes_.back().second;
+    ++holding_;
+    changed_.notify_all();
+    changed_.wait(hold, [this] { return open_; });
+    --holding_;
+  }
+
+  void OnAudio(const std::string& id, const pmhost::AudioFrame& frame) override {
+    if (!ramp_) return;
+    std::int64_t first = -1;
+    const std::string check = pmhost::CheckRampSound(frame, &first);
+    std::lock_guard<std::mutex> guard(lock_);
+    Stream& s = streams_[id];
+    ++s.sounds;
+    if (!check.empty()) Problem("sound: " + check);
+    if (s.nextSample >= 0 && first != s.nextSample % 1024) {
+      Problem("sound continues at " + std::to_string(first) + " instead of " + std::to_string(s.nextSample % 1024));
+    }
+    s.nextSample = first + frame.samples;
+    channels_.push_back(frame.channels);
+  }
+
+  void OnBadRecord(const std::string&, const std::string& reason) override {
+    std::lock_guard<std::mutex> guard(lock_);
+    Problem("bad record: " + reason);
+  }
+
+  void Shut() {
+    std::lock_guard<std::mutex> guard(lock_);
+    open_ = false;
+  }
+  void Open() {
+    {
+      std::lock_guard<std::mutex> guard(lock_);
+      open_ = true;
+    }
+    changed_.notify_all();
+  }
+  // A reader thread is waiting in the shut gate.
+  bool Holding() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return holding_ > 0 && !open_;
+  }
+  // Pictures of one source, or of all.
+  int Videos(const std::string& id) const { return Count(id, &Stream::pictures); }
+  int Pictures() const { return Count({}, &Stream::pictures); }
+  int Sounds() const { return Count({}, &Stream::sounds); }
+  // Every fault seen, in order (empty when everything arrived intact).
+  std::vector<std::string> Problems() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return problems_;
+  }
+  // The runs of equal picture sizes, in order, with their picture counts.
+  std::vector<std::pair<Size, int>> SizeRuns() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return sizes_;
+  }
+  std::vector<int> Channels() const {
+    std::lock_guard<std::mutex> guard(lock_);
+    return channels_;
+  }
+
+ private:
+  struct Stream {
+    int pictures = 0;
+    int sounds = 0;
+    std::int64_t lastFrame = -1;
+    std::int64_t nextSample = -1;
+  };
+
+  int Count(const std::string& id, int Stream::*field) const {
+    std::lock_guard<std::mutex> guard(lock_);
+    int n = 0;
+    for (const auto& [key, stream] : streams_) n += id.empty() || key == id ? stream.*field : 0;
+    return n;
+  }
+  void Problem(std::string text) {  // lock_ held
+    if (problems_.size() < 20) problems_.push_back(std::move(text));
+  }
+
+  const bool ramp_;
+  mutable std::mutex lock_;  // guards everything below
+  std::condition_variable changed_;
+  bool open_ = true;
+  int holding_ = 0;
+  std::map<std::string, Stream> streams_;
+  std::vector<std::pair<Size, int>> sizes_;
+  std::vector<int> channels_;
+  std::vector<std::string> problems_;
+};
+
+inline void PrintTo(const RampSink::Size& s, std::ostream* os) { *os << s.width << "x" << s.height; }
+
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
-// Receiving `source` from the folder's registry; what arrives goes to `sink`
-// as well when one is given (it must outlive the run).
-pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source, RampSink* sink = nullptr);
-// Receives until `done` holds (looked at every few milliseconds from the
-// start) or `limit` passes, instead of for a fixed time that a loaded machine
-// may not give the chain to get going. `o.seconds` and `o.interrupted` are
-// taken over.
-pmhost::ReceiveResult ReceiveUntil(pmhost::ReceiveOptions o, const std::function<bool()>& done,
-                                   std::chrono::milliseconds limit = std::chrono::seconds(30));
+// Receiving `source` from the folder's registry.
+pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source);
 
 // A sender that died with nothing connected, its port taken at once by
 // another sender, and itself started again elsewhere; a source started for it
@@ -107,7 +232,7 @@ void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder)
 // resident memory, with its private (anonymous) part apart: the resident
 // shared memory is the pool the host is handed pictures in, which grows with
 // the host's reading pace, not with what the process keeps for itself.
-// nullopt when the process cannot be read.
+// nullopt when the process cannot be read. pid 0 is this process.
 struct ProcessUsage {
   int descriptors = 0;
   int threads = 0;
@@ -115,15 +240,14 @@ struct ProcessUsage {
   long privateKiB = 0;
 };
 std::optional<ProcessUsage> UsageOf(pid_t pid);
-// Of this process.
-std::optional<ProcessUsage> OwnUsage();
 // A process's level: descriptors and threads at their lowest, memory at its
 // highest, over a few looks (a descriptor the runtime opens for a moment, say
 // to list the registry, is not part of it).
 std::optional<ProcessUsage> LevelOf(pid_t pid);
 // Threads end and descriptors close a moment after the reply that stopped
-// them: waits for the level, then expects it exactly (no growth, and nothing
-// closed that should still be open).
+// them (in this process: after the objects that held them go): waits for the
+// level, then expects it exactly (no growth, and nothing closed that should
+// still be open).
 void ExpectBackAtLevel(pid_t pid, const ProcessUsage& level, const std::string& what);
 
 // What the task reported to the host, by source id. Record runs on the
@@ -234,25 +358,19 @@ struct Chain {
   std::string id;
 };
 
-// This process's level before a case. A thread is started and joined first:
-// ThreadSanitizer starts a background thread of its own with the first one,
-// and that thread stays.
-std::optional<ProcessUsage> OwnLevel();
-// This process's descriptors (connections, mappings, children's pipes) and
-// threads (readers, child watchers) come back to `before`; they close a
-// moment after the objects that held them go.
-void ExpectOwnUsageBackTo(const ProcessUsage& before);
-
 // For cases that run programs: whatever the case did, this process holds
 // what it held before it.
 class OwnLevelKept : public ::testing::Test {
  protected:
+  // A thread is started and joined first: ThreadSanitizer starts a
+  // background thread of its own with the first one, and that thread stays.
   void SetUp() override {
-    own_ = OwnLevel();
+    std::thread([] {}).join();
+    own_ = UsageOf(0);
     ASSERT_TRUE(own_);
   }
   void TearDown() override {
-    if (own_) ExpectOwnUsageBackTo(*own_);
+    if (own_) ExpectBackAtLevel(0, *own_, "the test process");
   }
 
  private:

@@ -55,17 +55,10 @@ Wire Audio(std::uint32_t token, std::uint64_t size, std::uint32_t code, std::int
 }
 
 struct CountingSink : pmhost::FrameSink {
-  void OnVideo(const std::string&, const pmhost::VideoFrame& f) override {
-    ++frames;
-    lastBytes = f.bytes;
-  }
-  void OnAudio(const std::string&, const pmhost::AudioFrame& f) override {
-    ++frames;
-    lastBytes = f.bytes;
-  }
+  void OnVideo(const std::string&, const pmhost::VideoFrame&) override { ++frames; }
+  void OnAudio(const std::string&, const pmhost::AudioFrame&) override { ++frames; }
   void OnBadRecord(const std::string&, const std::string&) override { ++bad; }
   int frames = 0, bad = 0;
-  std::uint64_t lastBytes = 0;
 };
 
 // The reader's step (Handle) against segment 4 of 4096 bytes, made here.
@@ -140,15 +133,9 @@ TEST_F(RecordRefusals, EveryRefusedRecordIsSkippedWithItsReasonAndItsTokenReturn
   const std::uint8_t three[3] = {1, 2, 3};
   EXPECT_FALSE(reader.Handle(three, 3, &token));
   EXPECT_FALSE(reader.Handle(nullptr, 0, &token));
-  // And sound records of the segment, pictures and sound, are handed on
-  // whole (a stride of 0 stands for the default one).
-  const std::pair<Wire, std::uint64_t> whole[] = {{Video(4, 4096, 0, pm::kCode2vuy, 32, 16), 32u * 2 * 16},
-                                                  {Audio(4, 4096, pm::kCodeFl32, 480, 48000, 2), 480u * 2 * 4}};
-  for (const auto& [wire, bytes] : whole) {
-    EXPECT_TRUE(reader.Handle(wire.data(), wire.size(), &token));
-    EXPECT_EQ(sink.lastBytes, bytes);
-  }
-  EXPECT_EQ(sink.frames, 2);
+  // (Records that fit are handed on whole through the whole chain: the fault
+  // suite's ramp checks.)
+  EXPECT_EQ(sink.frames, 0);
 }
 
 }  // namespace
