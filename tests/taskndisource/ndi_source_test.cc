@@ -110,7 +110,8 @@ TEST_F(NdiSource, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
 }
 
 // A bad frame is dropped with one line before a buffer is asked for; a buffer
-// refused or of another format loses only that frame.
+// of another format loses only that frame. (A refused buffer is the fault
+// suite's stalled host, whose pictures run the pool dry.)
 TEST_F(NdiSource, BadVideoFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
   // A good 16x4 UYVY frame at stride 32, spoilt one way.
   const auto spoilt = [](const std::function<void(ndi_video_frame_v2&)>& spoil) {
@@ -141,10 +142,6 @@ TEST_F(NdiSource, BadVideoFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
   // The largest describable frame is taken.
   ASSERT_TRUE(Video(VideoCapture(kNdiFourCCNV12, 32767, 1, 32767)));
   EXPECT_EQ(int{callbacks->Seen().videoRequests.back().width}, 32767);
-  callbacks->SetDry(true, false);
-  EXPECT_FALSE(Video(AnyVideo()));
-  EXPECT_TRUE(logs.Contains("#ndisource: video well ran dry\n"));
-  callbacks->SetDry(false, false);
   EXPECT_TRUE(Video(AnyVideo()));
   pm::VideoFormat bigger;
   bigger.code = pm::kCode2vuy;
@@ -527,19 +524,6 @@ TEST_F(NdiSource, PanelAndConfigurationTranslateBothWays) {
   EXPECT_EQ(Json::parse(source->ConfigurationToGui(R"({"bandwidth":5})"))["bandwidth"]["value"], 0);
 }
 
-// Unknown texts select the highest; a text that does not read keeps the value.
-TEST_F(NdiSource, ConfigurationSetsTheReceiveBandwidth) {
-  const std::pair<const char*, std::uint32_t> cases[] = {
-      {R"({"bandwidth":"ndi_bandwidth_audio_only"})", 10u},
-      {"not json", 10u},
-      {R"({"bandwidth":"ndi_bandwidth_lowest "})", 100u},
-  };
-  for (const auto& [text, bandwidth] : cases) {
-    source->SetConfiguration(text);
-    EXPECT_EQ(source->Bandwidth(), bandwidth) << text;
-  }
-}
-
 // ============================================================= Receiver loop
 
 // (With an id too short to carry a name: the empty name is looked for.)
@@ -767,23 +751,30 @@ TEST_F(NdiSource, LoopStuckPastTheStopDeadlineEndsTheProcess) {
 }
 
 // Reconnect and configuration restart a started source (with the new
-// bandwidth) and only store on a stopped one.
+// bandwidth) and only store on a stopped one. A bandwidth text of no known
+// name selects the highest; a text that does not read keeps the value.
 TEST_F(NdiSource, StartedSourceRestartsOnReconnectAndConfiguration) {
   ndi.SetSources({Entry{kName, kUrl}});
   source->ExecuteCustomActionCommand("taskndisource::reconnect");
   source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_audio_only"})");
+  source->SetConfiguration("not json");
   EXPECT_FALSE(source->Started());
   EXPECT_EQ(ndi.Seen().findersCreated, 0);
   source->Start();
-  Until([&] { return ndi.Seen().receivers.size() == 1; });
-  EXPECT_EQ(ndi.Seen().receivers[0].bandwidth, 10);
-  source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest"})");
-  Until([&] { return ndi.Seen().receivers.size() == 2; });
-  EXPECT_EQ(ndi.Seen().receivers[1].bandwidth, 0);
-  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
-  source->ExecuteCustomActionCommand("taskndisource::reconnect");
-  Until([&] { return ndi.Seen().receivers.size() == 3; });
-  EXPECT_EQ(ndi.Seen().receivers[2].bandwidth, 0);
+  const std::function<void()> changes[] = {
+      [&] { source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest "})"); },
+      [&] { source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest"})"); },
+      [&] { source->ExecuteCustomActionCommand("taskndisource::reconnect"); },
+  };
+  for (std::size_t i = 0; i < std::size(changes); ++i) {
+    Until([&] { return ndi.Seen().receivers.size() == i + 1; });
+    changes[i]();
+  }
+  Until([&] { return ndi.Seen().receivers.size() == 4; });
+  std::vector<std::int32_t> bandwidths;
+  for (const auto& receiver : ndi.Seen().receivers) bandwidths.push_back(receiver.bandwidth);
+  EXPECT_EQ(bandwidths, (std::vector<std::int32_t>{10, 100, 0, 0}));
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 3);
 }
 
 TEST_F(NdiSource, ConcurrentReconnectsNeverRunTwoLoops) {
