@@ -171,9 +171,9 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
 
 // BGRX copies 4 bytes a pixel, BGR0 widens 3 to 4; both set the fourth byte
 // to 0xFF and write nothing past the row, top-down and bottom-up (the first
-// picture row last in memory). 7 pixels: one 4-pixel vector step and a tail.
+// picture row last in memory), at widths around the kernels' 4-pixel step.
 TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
-  const int w = 7, h = 5;
+  const int h = 5;
   const struct {
     std::uint32_t code;
     int inBytes;   // per pixel
@@ -181,23 +181,25 @@ TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
     int dstExtra;  // destination bytes after a row
   } packed[] = {{pm::kCodeBGRX, 4, 4, 0}, {pm::kCodeBGR0, 3, 0, 8}};
   for (const auto& k : packed) {
-    for (bool bottomUp : {false, true}) {
-      SCOPED_TRACE(testing::Message() << k.code << (bottomUp ? " bottom-up" : " top-down"));
-      const int stride = k.inBytes * w + k.padding;
-      Bytes pixels(static_cast<std::size_t>(stride) * h, 1, 9);
-      pm::VideoPlanes src;
-      src.planeCount = 1;
-      src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
-                              : pm::Plane{pixels.data.get(), h, stride};
-      MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
-      buffer.ConvertFrame(k.code, src);
-      for (int r = 0; r < h; ++r) {
-        const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-        for (int p = 0; p < w; ++p) {
-          for (int b = 0; b < 3; ++b) ASSERT_EQ(buffer.Row(0, r)[4 * p + b], in[k.inBytes * p + b]) << r << " " << p;
-          ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+    for (int w : {1, 4, 7, 8, 19}) {
+      for (bool bottomUp : {false, true}) {
+        SCOPED_TRACE(testing::Message() << k.code << " width " << w << (bottomUp ? " bottom-up" : " top-down"));
+        const int stride = k.inBytes * w + k.padding;
+        Bytes pixels(static_cast<std::size_t>(stride) * h, 1, 9);
+        pm::VideoPlanes src;
+        src.planeCount = 1;
+        src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
+                                : pm::Plane{pixels.data.get(), h, stride};
+        MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
+        buffer.ConvertFrame(k.code, src);
+        for (int r = 0; r < h; ++r) {
+          const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
+          for (int p = 0; p < w; ++p) {
+            for (int b = 0; b < 3; ++b) ASSERT_EQ(buffer.Row(0, r)[4 * p + b], in[k.inBytes * p + b]) << r << " " << p;
+            ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
+          }
+          for (int c = 4 * w; c < 4 * w + k.dstExtra; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
         }
-        for (int c = 4 * w; c < 4 * w + k.dstExtra; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
       }
     }
   }
@@ -289,9 +291,10 @@ TEST(VideoBuffer, RefusedCopiesAndConversionsWriteNothingPastAPlaneAndUnmap) {
 
 using Interleave = void (*)(const std::uint8_t*, const std::uint8_t*, std::uint8_t*, std::int32_t);
 
-// The vector and scalar kernels against the byte rule, at counts around every
-// step boundary and at unaligned addresses; each buffer holds exactly what
-// the kernel may touch past its offset.
+// The vector and scalar interleave kernels against the byte rule, at counts
+// around every step boundary and at unaligned addresses; each buffer holds
+// exactly what the kernel may touch past its offset. (The packed kernels run
+// under ConvertFrame above, at widths around their step.)
 TEST(PixelKernels, EveryInterleavePathFollowsTheByteRule) {
   if (!pm::pixel::HaveSse2()) GTEST_LOG_(INFO) << "no SSE2 kernel in this build; scalar only";
   const Interleave kernels[] = {pm::pixel::InterleaveUVScalar, pm::pixel::InterleaveUVSse2, pm::pixel::InterleaveUV};
@@ -308,22 +311,6 @@ TEST(PixelKernels, EveryInterleavePathFollowsTheByteRule) {
         }
         for (int i = 0; i < offset; ++i) ASSERT_EQ(out[i], static_cast<std::uint8_t>(i * 31 + 200));
       }
-    }
-  }
-}
-
-TEST(PixelKernels, OpaqueCopyAndWideningSetOnlyTheFourthByte) {
-  for (int pixels = 0; pixels <= 19; ++pixels) {
-    Bytes in4(4 * pixels, 31, 3);
-    Bytes out4(4 * pixels, 31, 9);
-    pm::pixel::CopyOpaque4(in4.data.get(), out4.data.get(), pixels);
-    for (int i = 0; i < 4 * pixels; ++i) ASSERT_EQ(out4[i], i % 4 == 3 ? 0xFF : in4[i]) << pixels;
-    Bytes in3(3 * pixels, 31, 5);
-    Bytes out3(4 * pixels, 31, 9);
-    pm::pixel::Widen3To4(in3.data.get(), out3.data.get(), pixels);
-    for (int p = 0; p < pixels; ++p) {
-      for (int k = 0; k < 3; ++k) ASSERT_EQ(out3[4 * p + k], in3[3 * p + k]);
-      ASSERT_EQ(out3[4 * p + 3], 0xFF);
     }
   }
 }
