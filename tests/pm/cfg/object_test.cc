@@ -141,17 +141,6 @@ TEST(Members, ReadAnyJsonLeniently) {
   EXPECT_EQ(m.v.ToJson(), Json::array({"", "1"}));
 }
 
-TEST(Members, EnumKeepsValuesTheEnumerationDoesNotName) {
-  struct E : pm::cfg::Object {
-    E() : Object(nullptr, "", "e", false) {}
-    pm::cfg::MemberEnumT<pm::cfg::VisualIndication> ind{this, "ind"};
-  } e;
-  e.FromJson(Json::parse(R"({"ind":"101"})"));
-  EXPECT_EQ(e.ind.Get(), pm::cfg::VisualIndication::Error);
-  e.FromJson(Json::parse(R"({"ind":12345})"));
-  EXPECT_EQ(Write(e), (Json{{"ind", 12345}}));
-}
-
 // Text nested deeper than the JSON limit is refused before a value is built
 // (reading it would be safe, copying or printing it would not): the members
 // keep their values and one line is logged.

@@ -81,7 +81,6 @@ TEST(Notifications, CarryExactlyTheirKeysAndTypes) {
       {[&] { f.callbacks->SetFixedLatencySeconds(2); }, "set_fixed_latency_seconds", with({{"fixedLatencySeconds", 2.0}})},
       {[&] { f.callbacks->UpdateConfiguration("{\"bandwidth\":\"x\"}"); }, "update_configuration",
        with({{"config", {{"bandwidth", "x"}}}})},
-      {[&] { f.callbacks->UpdateConfiguration(""); }, "update_configuration", with({{"config", nullptr}})},
       {[&] { f.callbacks->UpdateGui("{\"a\":1}", {}); }, "update_gui",
        with({{"gui", {{"a", 1}}}, {"widgets", json::array()}})},
       {[&] { f.callbacks->UpdateGui("not json", {"w1", "w2"}); }, "update_gui",
