@@ -1,5 +1,6 @@
-// Loading the runtime table by name: every entry from a complete library, the
-// first missing symbol named on failure.
+// Loading the runtime table by name: every entry from a complete library. (A
+// library that is missing or lacks a symbol is the task factory's case, in
+// tests/e2e, on the same stand-in libraries.)
 
 #include <gtest/gtest.h>
 
@@ -23,16 +24,6 @@ TEST(LoadNdiApi, CompleteLibraryFillsEveryEntry) {
   std::memcpy(entries, &api, sizeof api);
   for (std::size_t i = 0; i < sizeof(NdiApi) / sizeof(void*); ++i) EXPECT_NE(entries[i], nullptr) << i;
   EXPECT_STREQ(api.version(), "stub 1.0");
-}
-
-TEST(LoadNdiApi, MissingSymbolIsNamedAndTheTableLeftEmpty) {
-  NdiApi api;
-  std::string missing;
-  EXPECT_FALSE(LoadNdiApi(STUB_RUNTIME_PARTIAL_PATH, &api, &missing));
-  EXPECT_EQ(missing, "NDIlib_find_create_v2");
-  EXPECT_EQ(api.version, nullptr);
-  // (A missing library is named in the factory's line; without places to write, nothing is.)
-  EXPECT_FALSE(LoadNdiApi("libno-such-ndi-runtime.so", nullptr, nullptr));
 }
 
 }  // namespace

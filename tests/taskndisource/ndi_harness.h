@@ -32,6 +32,7 @@
 #include <type_traits>
 #include <vector>
 
+#include "pm/shm/formats.h"
 #include "pm/task/source.h"
 #include "support/manual_clock.h"
 #include "taskndisource/loop_environment.h"
@@ -239,7 +240,7 @@ class ScriptedNdi {
 class FakeVideoBuffer : public pm::VideoBuffer {
  public:
   explicit FakeVideoBuffer(const pm::VideoFormat& format)
-      : format_(format), memory(static_cast<std::size_t>(RowBytes()) * static_cast<std::size_t>(Rows())) {}
+      : format_(format), memory(static_cast<std::size_t>(pm::FrameSize(format, 0))) {}
   // The intake only copies whole frames.
   pm::VideoPlanes Planes() override { return {}; }
   std::pair<std::uint8_t*, std::int32_t> MapData() override { return {nullptr, 0}; }
@@ -254,11 +255,7 @@ class FakeVideoBuffer : public pm::VideoBuffer {
                   source + static_cast<std::ptrdiff_t>(r) * sourceStride, static_cast<std::size_t>(RowBytes()));
     }
   }
-  std::int32_t RowBytes() const {
-    if (format_.code == pm::kCodeRgba) return format_.width * 4;
-    if (format_.code == pm::kCode2vuy || format_.code == pm::kCodeYuvs) return format_.width * 2;
-    return format_.code == pm::kCodeNV12 ? format_.width : 0;
-  }
+  std::int32_t RowBytes() const { return pm::DefaultStride(format_); }
   std::int32_t Rows() const { return format_.code == pm::kCodeNV12 ? format_.height + format_.height / 2 : format_.height; }
 
   pm::VideoFormat format_;
@@ -381,13 +378,12 @@ class FakeCallbacks : public pm::Source::Callbacks {
   std::int64_t audioBytes_ = -1;
 };
 
-// Discovery announcements in order ("+id name", "-id") and the infos given.
+// Discovery announcements in order ("+id name", "-id").
 class FakeDiscoveryCallbacks : public pm::SourceDiscovery::Callbacks {
  public:
   void SourceAvailable(const pm::SourceInfo& info) override {
     std::lock_guard<std::mutex> guard(mutex_);
     calls_.push_back("+" + info.uniqueId + " " + info.name);
-    infos_.push_back(info);
   }
   void SourceUnavailable(const std::string& uniqueId) override {
     std::lock_guard<std::mutex> guard(mutex_);
@@ -397,15 +393,9 @@ class FakeDiscoveryCallbacks : public pm::SourceDiscovery::Callbacks {
     std::lock_guard<std::mutex> guard(mutex_);
     return calls_;
   }
-  std::vector<pm::SourceInfo> Infos() {
-    std::lock_guard<std::mutex> guard(mutex_);
-    return infos_;
-  }
-
  private:
-  std::mutex mutex_;  // guards calls_ and infos_
+  std::mutex mutex_;  // guards calls_
   std::vector<std::string> calls_;
-  std::vector<pm::SourceInfo> infos_;
 };
 
 // --- The table ---------------------------------------------------------------

@@ -1,6 +1,7 @@
 // The host's side of a source and of discovery: every notification's exact
-// JSON, the buffer queue's announcement, buffer requests and their limits,
-// holds of sent and unsent buffers.
+// JSON, the buffer queue's announcement, buffer requests and their limits.
+// (Holding a sent segment until its token returns is the queue's own test;
+// the video record's contents reach the host in the whole-chain tests.)
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -80,7 +81,6 @@ TEST(Notifications, CarryExactlyTheirKeysAndTypes) {
       {[&] { f.callbacks->SetFixedLatencySeconds(2); }, "set_fixed_latency_seconds", with({{"fixedLatencySeconds", 2.0}})},
       {[&] { f.callbacks->UpdateConfiguration("{\"bandwidth\":\"x\"}"); }, "update_configuration",
        with({{"config", {{"bandwidth", "x"}}}})},
-      {[&] { f.callbacks->UpdateConfiguration(""); }, "update_configuration", with({{"config", nullptr}})},
       {[&] { f.callbacks->UpdateGui("{\"a\":1}", {}); }, "update_gui",
        with({{"gui", {{"a", 1}}}, {"widgets", json::array()}})},
       {[&] { f.callbacks->UpdateGui("not json", {"w1", "w2"}); }, "update_gui",
@@ -152,41 +152,6 @@ TEST_F(QueueTest, VideoRequests_StopCreatingSegmentsAtTheLimit) {
   EXPECT_EQ(callbacks->RequestVideoBuffer(format, 0), nullptr);
   a.reset();  // unsent: its segment is free again at once
   EXPECT_NE(callbacks->RequestVideoBuffer(format, 0), nullptr);
-}
-
-TEST_F(QueueTest, VideoSends_HoldTheSegmentUntilTheHostReturnsTheToken) {
-  callbacks->SetMaxVideoBuffers(1);
-  pm::VideoFormat format = Video(pm::kCode2vuy, 64, 64);
-  format.scan = 'P';
-  auto buffer = callbacks->RequestVideoBuffer(format, 0);
-  ASSERT_TRUE(buffer);
-  std::vector<std::uint8_t> picture(64 * 2 * 64, 0x5A);
-  buffer->CopyFrame(picture.data(), 128);
-  // A record sent before the host's connection arrived would be released at once.
-  ASSERT_TRUE(pmtest::WaitFor([&] { return callbacks->Producer()->HostConnected(); }));
-  callbacks->SendVideoBuffer(123456789, buffer);
-  buffer.reset();
-  std::uint32_t token = 0;
-  std::uint8_t record[60];
-  ASSERT_TRUE(reader->ReadRecord(&token, record));
-  std::int64_t time = 0;
-  std::memcpy(&time, record + 24, 8);
-  EXPECT_EQ(time, 123456789);
-  EXPECT_EQ(std::memcmp(record + 32, &format, sizeof format), 0);
-  EXPECT_EQ(callbacks->RequestVideoBuffer(format, 0), nullptr);  // still held, limit reached
-  reader->ReturnToken(token);
-  EXPECT_TRUE(pmtest::WaitFor([&] { return callbacks->RequestVideoBuffer(format, 0) != nullptr; }));
-}
-
-TEST_F(QueueTest, VideoSends_WhileMappedLogTheOutstandingMappingAndStillSend) {
-  pm::VideoFormat format = Video(pm::kCodeRgba, 16, 16);
-  auto buffer = callbacks->RequestVideoBuffer(format, 0);
-  ASSERT_TRUE(buffer);
-  buffer->MapData();
-  pmtest::LogCapture capture;
-  callbacks->SendVideoBuffer(0, buffer);
-  EXPECT_EQ(capture.Count("Source has outstanding mapping while sending buffer"), 1);
-  buffer->UnmapData();
 }
 
 class ForeignVideoBuffer : public pm::VideoBuffer {

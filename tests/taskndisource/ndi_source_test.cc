@@ -1,0 +1,809 @@
+// The NDI source on a scripted runtime and a clock the test advances (no test
+// waits for real seconds): video and audio intake frame by frame (formats
+// requested, bytes copied, timestamps and their shared base, the produces
+// mask, every kind of bad frame), metadata read from the sender, shot events,
+// tally and PTZ commands sent to it, the settings panel and status texts, and
+// the receiver loop's states, timing and reports.
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstring>
+#include <functional>
+#include <limits>
+#include <thread>
+
+#include "ndi_harness.h"
+#include "support/log_capture.h"
+#include "support/wait.h"
+#include "taskndisource/ndi_config.h"
+#include "taskndisource/ndi_source.h"
+
+namespace {
+
+using nditest::AnyVideo;
+using nditest::AudioCapture;
+using nditest::Entry;
+using nditest::VideoCapture;
+using TaskNDISource::MediaInfo;
+using TaskNDISource::NDISource;
+using TaskNDISource::ReceiverState;
+using Json = nlohmann::json;
+using Lines = std::vector<std::string>;
+
+constexpr char kName[] = "STUDIO (Cam 1)";
+constexpr char kId[] = "NDICaptureDevice~STUDIO (Cam 1)";
+constexpr char kUrl[] = "127.0.0.1:5961";
+void* const kReceiver = reinterpret_cast<void*>(0x10);
+
+class NdiSource : public ::testing::Test {
+ protected:
+  ~NdiSource() override {
+    if (source) source->Stop();
+  }
+  // Makes the source anew (the previous one stops as it goes).
+  void Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5), std::function<void()> onExit = nullptr,
+            const char* id = kId) {
+    source = std::make_shared<NDISource>(callbacks, id, ndi.Api(), env.Make(stopTimeout, std::move(onExit)));
+  }
+  bool Video(const std::shared_ptr<nditest::Capture>& c, MediaInfo* info = nullptr) {
+    return source->ProcessVideoFrame(c->video, info);
+  }
+  bool Audio(const std::shared_ptr<nditest::Capture>& c, MediaInfo* info = nullptr) {
+    return source->ProcessAudioFrame(c->audio, info);
+  }
+  void Metadata(const std::string& text) { source->ProcessMetadataFrame(nditest::MetadataCapture(text)->metadata); }
+  // Wait (real time) until `done` holds.
+  static void Until(const std::function<bool()>& done) { ASSERT_TRUE(pmtest::WaitFor(done)); }
+  void UntilState(ReceiverState state) { Until([&] { return source->State() == state; }); }
+  void UntilStates(std::vector<std::int32_t> states) { Until([&] { return callbacks->Seen().states == states; }); }
+  // Starts the loop on the listed sender and waits until a frame was delivered.
+  void StartReceiving() {
+    ndi.SetSources({Entry{kName, kUrl}});
+    ndi.Push(AnyVideo());
+    source->Start();
+    UntilState(ReceiverState::Receiving);
+  }
+
+  pmtest::LogCapture logs;
+  nditest::ScriptedNdi ndi;
+  std::shared_ptr<nditest::FakeCallbacks> callbacks = std::make_shared<nditest::FakeCallbacks>();
+  nditest::TestEnvironment env;
+  std::shared_ptr<NDISource> source = std::make_shared<NDISource>(callbacks, kId, ndi.Api(), env.Make());
+};
+
+// ===================================================================== Intake
+
+// Each accepted FourCC is asked for as its host code, with the scan of the
+// frame, and copied row by row (NV12's chroma rows too) from the frame's
+// stride: padding past a row never ends up in the buffer. (VideoFormat is
+// packed: its fields are read by value, never bound to a reference.)
+TEST_F(NdiSource, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
+  struct Case {
+    std::uint32_t fourcc, code;
+    int stride;
+    bool progressive;
+    int rows, rowBytes;
+  } cases[] = {
+      {kNdiFourCCUYVY, 0x32767579u /* '2vuy' */, 40, true, 4, 32},
+      {kNdiFourCCUYVA, pm::kCode2vuy, 32, false, 4, 32},
+      {kNdiFourCCNV12, pm::kCodeNV12, 24, true, 6, 16},
+      {kNdiFourCCBGRA, pm::kCodeRgba, 72, false, 4, 64},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.fourcc);
+    auto frame = VideoCapture(c.fourcc, 16, 4, c.stride, 0, c.progressive);
+    MediaInfo info;
+    ASSERT_TRUE(Video(frame, &info));
+    const pm::VideoFormat r = callbacks->Seen().videoRequests.back();
+    EXPECT_EQ((std::vector<std::uint32_t>{r.code, std::uint32_t(r.width), std::uint32_t(r.height), std::uint32_t(r.scan)}),
+              (std::vector<std::uint32_t>{c.code, 16, 4, std::uint32_t(c.progressive ? 'P' : 'U')}));
+    const auto sent = callbacks->Seen().videoSent.back();
+    EXPECT_EQ(sent->copiedStride, c.stride);
+    for (int row = 0; row < c.rows; ++row) {
+      ASSERT_EQ(0, std::memcmp(sent->memory.data() + row * c.rowBytes, frame->bytes.data() + row * c.stride,
+                               static_cast<std::size_t>(c.rowBytes)))
+          << row;
+    }
+    EXPECT_EQ(info, (MediaInfo{16, 4, 30000, 1001, 0, 0}));
+  }
+}
+
+// A bad frame is dropped with one line before a buffer is asked for; a buffer
+// of another format loses only that frame. (A refused buffer is the fault
+// suite's stalled host, whose pictures run the pool dry.)
+TEST_F(NdiSource, BadVideoFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
+  // A good 16x4 UYVY frame at stride 32, spoilt one way.
+  const auto spoilt = [](const std::function<void(ndi_video_frame_v2&)>& spoil) {
+    auto capture = AnyVideo();
+    spoil(capture->video);
+    return capture;
+  };
+  const std::shared_ptr<nditest::Capture> cases[] = {
+      spoilt([](auto& v) { v.data = nullptr; }),
+      spoilt([](auto& v) { v.line_stride_in_bytes = 0; }),
+      spoilt([](auto& v) { v.line_stride_in_bytes = -32; }),
+      VideoCapture(kNdiFourCCUYVY, 16, 4, 31),  // rows of 32
+      VideoCapture(kNdiFourCCNV12, 16, 4, 15),  // rows of 16
+      VideoCapture(kNdiFourCCBGRA, 16, 4, 63),  // rows of 64
+      spoilt([](auto& v) { v.xres = 0; }),
+      spoilt([](auto& v) { v.yres = -4; }),
+      spoilt([](auto& v) { v.xres = 32768; }),  // past the host's 16 bits
+      spoilt([](auto& v) { v.yres = 40000; }),
+      VideoCapture(kNdiFourCCI420, 16, 4, 16),
+      VideoCapture(0x12345678, 16, 4, 32),
+  };
+  for (std::size_t i = 0; i < std::size(cases); ++i) {
+    logs.Clear();
+    EXPECT_FALSE(Video(cases[i])) << i;
+    EXPECT_EQ(logs.Lines().size(), 1u) << i;
+  }
+  EXPECT_TRUE(callbacks->Seen().calls.empty());
+  // The largest describable frame is taken.
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCNV12, 32767, 1, 32767)));
+  EXPECT_EQ(int{callbacks->Seen().videoRequests.back().width}, 32767);
+  EXPECT_TRUE(Video(AnyVideo()));
+  pm::VideoFormat bigger;
+  bigger.code = pm::kCode2vuy;
+  bigger.width = 1920;
+  bigger.height = 1080;
+  callbacks->OverrideVideoFormat(bigger);
+  EXPECT_FALSE(Video(AnyVideo()));
+  EXPECT_EQ(callbacks->Seen().videoSent.size(), 2u);  // the largest and the good one
+}
+
+TEST_F(NdiSource, StereoAudioIsInterleavedIntoTheHostBuffer) {
+  MediaInfo info;
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 1600), &info));
+  const auto [format, count] = callbacks->Seen().audioRequests.at(0);
+  EXPECT_EQ((std::vector<std::uint32_t>{format.code, format.sampleRate, format.channels, std::uint32_t(count)}),
+            (std::vector<std::uint32_t>{0x666C3332u /* 'fl32' */, 48000, 2, 1600}));
+  const auto samples = callbacks->Seen().audioSent.at(0)->Samples();
+  ASSERT_EQ(samples.size(), 3200u);
+  EXPECT_EQ(samples[0], 0.0f);     // channel 0, sample 0
+  EXPECT_EQ(samples[1], 1000.0f);  // channel 1, sample 0
+  EXPECT_EQ(samples[2], 1.0f);     // channel 0, sample 1
+  EXPECT_EQ(samples[3199], 2599.0f);
+  EXPECT_EQ(info, (MediaInfo{0, 0, 0, 0, 48000, 2}));
+}
+
+TEST_F(NdiSource, BadAudioFramesAndBuffersAreDroppedWithTheirLine) {
+  auto nullData = AudioCapture(48000, 2, 16);
+  nullData->audio.data = nullptr;
+  const std::shared_ptr<nditest::Capture> cases[] = {
+      AudioCapture(0, 2, 16),  AudioCapture(-48000, 2, 16), AudioCapture(48000, 2, 0),
+      AudioCapture(48000, 2, -5), AudioCapture(48000, 0, 16),  nullData,
+  };
+  for (std::size_t i = 0; i < std::size(cases); ++i) {
+    logs.Clear();
+    EXPECT_FALSE(Audio(cases[i])) << i;
+    EXPECT_EQ(logs.Lines().size(), 1u) << i;
+  }
+  EXPECT_TRUE(callbacks->Seen().audioRequests.empty());
+  // A buffer too small for the frame is not written past; none loses the frame.
+  callbacks->OverrideAudioBytes(2 * 16 * 4 - 1);
+  EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
+  EXPECT_TRUE(logs.Contains("#ndisource: audio buffer too small for the NDI audio frame\n"));
+  EXPECT_TRUE(callbacks->Seen().audioSent.empty());
+  callbacks->SetDry(false, true);
+  EXPECT_FALSE(Audio(AudioCapture(48000, 2, 16)));
+  EXPECT_TRUE(logs.Contains("#ndisource: audio well ran dry\n"));
+}
+
+// The record's channel byte is read as signed where sizes are computed, so
+// sound of 128 channels and more is refused before a buffer is asked for. It
+// is told once when it starts, not with every frame (anew when the count
+// changes or after sound that was taken), and the panel's audio line says
+// why there is no sound.
+TEST_F(NdiSource, SoundOfTooManyChannelsIsToldOnceAndNamedOnThePanel) {
+  struct Case {
+    int channels;
+    Lines lines;  // for five frames
+    std::string status;
+  };
+  const auto line = [](int channels) {
+    return "#ndisource: too many channels in NDI audio frame (" + std::to_string(channels) +
+           "): at most 127 are carried, its sound is dropped\n";
+  };
+  const Case cases[] = {
+      {127, {}, "127 Channels @ 48 kHz"},
+      {128, {line(128)}, "128 Channels not supported"},
+      {255, {line(255)}, "255 Channels not supported"},
+      {256, {line(256)}, "256 Channels not supported"},
+      {2, {}, "Stereo @ 48 kHz"},
+      {256, {line(256)}, "256 Channels not supported"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.channels);
+    logs.Clear();
+    const std::size_t requested = callbacks->Seen().audioRequests.size();
+    MediaInfo info;
+    for (int frame = 0; frame < 5; ++frame) EXPECT_EQ(Audio(AudioCapture(48000, c.channels, 4), &info), c.lines.empty());
+    EXPECT_EQ(callbacks->Seen().audioRequests.size() - requested, c.lines.empty() ? 5u : 0u);
+    EXPECT_EQ(logs.Lines(), c.lines);
+    EXPECT_EQ(TaskNDISource::AudioStatusText(info), c.status);
+  }
+}
+
+// Times count from the oldest sender timestamp across audio and video (1 s =
+// 10,000,000 x 100 ns = 705,600,000 ticks); an older frame takes the base and
+// resets the host's clock with the next frame delivered, even when it is
+// dropped itself; timestamps far apart saturate. The first frame of each kind
+// reports production once, until a Start clears it.
+TEST_F(NdiSource, TimestampsCountFromTheOldestFrameAndProductionIsToldOnce) {
+  constexpr std::int64_t kMin = std::numeric_limits<std::int64_t>::min(), kMax = std::numeric_limits<std::int64_t>::max();
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 50'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 60'000'000)));
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 55'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 0)));  // no timestamp: time 0, base kept
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 40'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, 40'000'001)));
+  EXPECT_FALSE(Video(VideoCapture(kNdiFourCCI420, 16, 4, 16, 10'000'000)));  // takes the base, no reset yet
+  ASSERT_TRUE(Audio(AudioCapture(48000, 1, 16, 20'000'000)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, kMin + 1)));
+  ASSERT_TRUE(Video(VideoCapture(kNdiFourCCUYVY, 16, 4, 32, kMax)));
+  EXPECT_EQ(callbacks->Seen().calls, (Lines{
+                                         "video request", "reset", "production 1", "video 0",
+                                         "video request", "video 705600000",
+                                         "audio request", "production 3", "audio 352800000",
+                                         "video request", "video 0",
+                                         "audio request", "reset", "audio 0",
+                                         "video request", "video 70",
+                                         "audio request", "reset", "audio 705600000",
+                                         "video request", "reset", "video 0",
+                                         "video request", "video " + std::to_string(kMax),
+                                     }));
+  source->Start();
+  source->Stop();
+  ASSERT_TRUE(Audio(AudioCapture(48000, 2, 16, 5)));
+  EXPECT_EQ(callbacks->Count("production 2"), 1);
+}
+
+// ================================================================== Metadata
+
+// Events go out in order, printed indented and escaped with the terminating
+// zero counted; a refused send stops the pass and keeps the event first.
+TEST_F(NdiSource, ShotEventsAreSentInOrderAndAnUnsentOneStaysFirst) {
+  std::deque<TaskNDISource::ShotEvent> queue{TaskNDISource::ShotEvent{"X", 1, 0}, TaskNDISource::ShotEvent{"a\"b<&>", 0, 1}};
+  ndi.SetMetadataResult(false);
+  source->SendShotEvents(kReceiver, queue);
+  ASSERT_EQ(queue.size(), 2u);
+  EXPECT_EQ(ndi.Seen().metadataLengths.size(), 1u);
+  ndi.SetMetadataResult(true);
+  source->SendShotEvents(kReceiver, queue);
+  EXPECT_TRUE(queue.empty());
+  const auto sent = ndi.Seen().metadataSent;
+  EXPECT_EQ(sent, (Lines{"<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n",
+                         "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n"
+                         "</skyrelay_ext>\n"}));
+  EXPECT_EQ(ndi.Seen().metadataLengths[1], static_cast<int>(sent[0].size()) + 1);
+}
+
+// Each command reaches its call with its parameters read leniently (defaults
+// for missing ones, clamped to the call's type); any other shape does nothing.
+TEST_F(NdiSource, PtzCommandsReachTheirCallsAndOtherShapesDoNothing) {
+  const std::pair<Json, const char*> cases[] = {
+      {{{"command", "RecallPreset"}, {"preset", 3}, {"speed", 0.5}}, "recall_preset(3,0.5)"},
+      {{{"command", "StorePreset"}, {"preset", 7}}, "store_preset(7)"},
+      {{{"command", "PanTilt"}, {"pan", -0.25}, {"tilt", 0.75}}, "pan_tilt(-0.25,0.75)"},
+      {{{"command", "PanTiltSpeed"}, {"pan", 1}, {"tilt", -1}}, "pan_tilt_speed(1,-1)"},
+      {{{"command", "Zoom"}, {"zoom", 0.5}}, "zoom(0.5)"},
+      {{{"command", "AutoFocus"}}, "auto_focus()"},
+      {{{"command", "Focus"}, {"val", 0.25}}, "focus(0.25)"},
+      {{{"command", "FocusSpeed"}, {"speed", -0.5}}, "focus_speed(-0.5)"},
+      {{{"command", "AutoExposure"}}, "exposure_auto()"},
+      {{{"command", "ExposureManual"}, {"level", 0.125}}, "exposure_manual(0.125)"},
+      {{{"command", "BalanceMode"}, {"mode", "auto"}}, "white_balance_auto()"},
+      {{{"command", "BalanceMode"}, {"mode", "indoor"}}, "white_balance_indoor()"},
+      {{{"command", "BalanceMode"}, {"mode", "outdoor"}}, "white_balance_outdoor()"},
+      {{{"command", "BalanceMode"}, {"mode", "oneshot"}}, "white_balance_oneshot()"},
+      {{{"command", "BalanceMode"}, {"mode", "manual"}, {"red", 0.5}, {"blue", 0.25}}, "white_balance_manual(0.5,0.25)"},
+      // Lenient parameters.
+      {{{"command", "RecallPreset"}}, "recall_preset(0,1)"},
+      {{{"command", "RecallPreset"}, {"preset", "3"}}, "recall_preset(3,1)"},
+      {{{"command", "StorePreset"}, {"preset", 2.9}}, "store_preset(2)"},
+      {{{"command", "Zoom"}, {"zoom", {1, 2}}}, "zoom(0)"},
+      {{{"command", "Zoom"}, {"zoom", 1e300}}, "zoom(3.40282e+38)"},
+      {{{"command", "StorePreset"}, {"preset", 99999999999}}, "store_preset(2147483647)"},
+      // Other shapes.
+      {nullptr, nullptr},
+      {nlohmann::json::array({"command", "Zoom"}), nullptr},
+      {{{"command", "zoom"}}, nullptr},
+      {{{"command", "BalanceMode"}}, nullptr},
+      {{{"command", "BalanceMode"}, {"mode", "Auto"}}, nullptr},
+  };
+  std::deque<Json> queue;
+  Lines expected;
+  for (const auto& [command, call] : cases) {
+    queue.push_back(command);
+    if (call != nullptr) expected.push_back(call);
+  }
+  source->RunPtzCommands(kReceiver, queue);
+  EXPECT_TRUE(queue.empty());
+  EXPECT_EQ(ndi.Seen().ptzCalls, expected);
+}
+
+// Frames on a fresh source each: what reaches the host, what is logged and
+// the model name kept. A frame is its text and zero, or exactly `length`
+// bytes of its text (a read past them is the sanitizer's to catch).
+TEST_F(NdiSource, MetadataFramesAreReadAsTheirXmlSaysWithinTheirLength) {
+  constexpr int kWithZero = -1000;
+  const std::string parseFailed = "#ndisource: failed to parse metadata frame\n";
+  const std::string badBuildOut = "#ndisource: invalid buildOutDuration in NDI metadata frame\n";
+  const std::string badLength = "#ndisource: invalid length in NDI metadata frame\n";
+  const std::string modelLine = "#ndisource: NDI source model name: ";
+  const std::string buildOne = "<metadata><buildOutDuration>1</buildOutDuration></metadata>";
+  const std::string withZero = std::string("<ndi_product model_name=\"A\"/>") + '\0' + "garbage that is not XML";
+  std::string deep;
+  for (int i = 0; i < 10000; ++i) deep += "<a>";
+  struct Frame {
+    std::string text;
+    int length = kWithZero;
+    bool noData = false;
+  };
+  struct Case {
+    std::vector<Frame> frames;
+    Lines calls, log;
+    std::string model;
+  } cases[] = {
+      {{{"<metadata><buildOutDuration>0.5</buildOutDuration></metadata>"}}, {"buildout 352800000"}, {}, ""},
+      {{{"<skyrelay_ext>\n  <other/>\n  <buildOutDuration> 2 </buildOutDuration></skyrelay_ext>"}},
+       {"buildout 1411200000"}, {}, ""},
+      {{{"<other><buildOutDuration>0.5</buildOutDuration></other>"}}, {}, {}, ""},
+      {{{"<metadata><buildOutDuration>soon</buildOutDuration></metadata>"}}, {}, {}, ""},
+      {{{"<metadata><nested><buildOutDuration>1</buildOutDuration></nested></metadata>"}}, {}, {}, ""},
+      {{{"<metadata><buildOutDuration>1e300</buildOutDuration></metadata>"}}, {}, {badBuildOut}, ""},
+      {{{"<metadata><buildOutDuration>nan</buildOutDuration></metadata>"}}, {}, {badBuildOut}, ""},
+      {{{""}}, {}, {parseFailed}, ""},
+      {{{"<metadata><buildOutDuration>0.5</metadata>"}}, {}, {parseFailed}, ""},
+      {{{"<!-- only a comment -->"}}, {}, {"#ndisource: metadata frame has no root element\n"}, ""},
+      {{{deep}}, {}, {parseFailed}, ""},
+      {{{"<a/>", 0}}, {}, {badLength}, ""},
+      {{{"<a/>", -5}}, {}, {badLength}, ""},
+      {{{"<a/>", 5, true}}, {}, {"#ndisource: null data in NDI metadata frame\n"}, ""},
+      {{{buildOne, static_cast<int>(buildOne.size())}}, {"buildout 705600000"}, {}, ""},  // no zero
+      {{{withZero, static_cast<int>(withZero.size())}}, {}, {modelLine + "A\n"}, "A"},   // a zero ends the text
+      // The model name is logged when it changes, and forgotten by a product without one.
+      {{{R"(<ndi_product model_name="PTZ Cam 2000"/>)"}, {R"(<ndi_product model_name="PTZ Cam 2000" serial="1"/>)"}},
+       {}, {modelLine + "PTZ Cam 2000\n"}, "PTZ Cam 2000"},
+      {{{R"(<ndi_product model_name="B"/>)"}, {"<ndi_product/>"}}, {}, {modelLine + "B\n", modelLine + "\n"}, ""},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.frames[0].text.substr(0, 80));
+    auto fresh = std::make_shared<nditest::FakeCallbacks>();
+    NDISource one(fresh, kId, ndi.Api(), env.Make());
+    logs.Clear();
+    for (const Frame& f : c.frames) {
+      if (f.length == kWithZero) {
+        one.ProcessMetadataFrame(nditest::MetadataCapture(f.text)->metadata);
+        continue;
+      }
+      std::unique_ptr<char[]> exact(new char[f.text.size()]);
+      std::memcpy(exact.get(), f.text.data(), f.text.size());
+      one.ProcessMetadataFrame(ndi_metadata_frame{f.length, 0, f.noData ? nullptr : exact.get()});
+    }
+    EXPECT_EQ(fresh->Seen().calls, c.calls);
+    EXPECT_EQ(logs.Lines(), c.log);
+    EXPECT_EQ(one.ModelName(), c.model);
+  }
+}
+
+// The suite goes with the model name; the vendor runtime reports PTZ support
+// before the product metadata, so a model name arriving (or changing) after
+// the support was reported is reported again.
+TEST_F(NdiSource, PtzSupportIsReportedWithTheModelNameAndAgainWhenTheNameArrives) {
+  ndi.SetPtzSupported(true);
+  source->ReportPtzSupport(kReceiver);
+  Metadata(R"(<ndi_product model_name="Model Y"/>)");
+  Metadata(R"(<ndi_product model_name="Model Y"/>)");
+  ndi.SetPtzSupported(false);
+  source->ReportPtzSupport(kReceiver);
+  Metadata(R"(<ndi_product model_name="Model Z"/>)");
+  ndi.SetPtzSupported(true);
+  source->ReportPtzSupport(kReceiver);
+  EXPECT_EQ(callbacks->Seen().calls, (Lines{"ptz NDI3/", "ptz NDI3/Model Y", "ptz /", "ptz NDI3/Model Z"}));
+}
+
+// Through the receiver loop: shot events (with stray blanks they are events,
+// not tally) and the tally reach the sender after a delivered frame, in
+// order; an event before Start is never sent.
+TEST_F(NdiSource, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
+  source->HandleShotEvent("Cut before start");
+  StartReceiving();
+  for (const char* event : {"TALLY_PREVIEW_ON", " TALLY_LIVE_ON", "TALLY_LIVE_ON ", "Cut"}) source->HandleShotEvent(event);
+  // The loop may take the events in more than one batch; each batch goes
+  // out after a delivered frame.
+  for (int i = 0; i < 3; ++i) ndi.Push(AnyVideo());
+  Until([&] { return ndi.Seen().metadataSent.size() >= 5; });
+  const auto sent = ndi.Seen().metadataSent;
+  const auto event = [](const std::string& name) {
+    return "<skyrelay_ext>\n    <event value=\"" + name + "\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
+  };
+  EXPECT_EQ(Lines(sent.begin() + 2, sent.end()), (Lines{event(" TALLY_LIVE_ON"), event("TALLY_LIVE_ON "), event("Cut")}));
+  Until([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; });
+  EXPECT_FALSE(ndi.Seen().tallies.back().on_program);
+}
+
+// A connection lost while receiving sends the loop to Idle (the media texts
+// emptied); PTZ commands then wait for a frame, and while stopped are dropped.
+TEST_F(NdiSource, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
+  source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.1}});
+  StartReceiving();
+  ndi.SetConnections(0);
+  UntilStates({1, 2, 3});
+  EXPECT_EQ(source->PublishedMediaInfo(), MediaInfo{});
+  source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.5}});
+  ASSERT_EQ(env.clock->AwaitWait(1), 5000);
+  EXPECT_TRUE(ndi.Seen().ptzCalls.empty());
+  ndi.SetConnections(1);
+  ndi.Push(AnyVideo());
+  env.clock->AdvanceMs(5000);
+  Until([&] { return !ndi.Seen().ptzCalls.empty(); });
+  source->Stop();
+  source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.9}});
+  EXPECT_EQ(ndi.Seen().ptzCalls, Lines{"zoom(0.5)"});
+}
+
+TEST_F(NdiSource, StatusChangeAndMetadataFramesAreHandledAndFreed) {
+  ndi.SetPtzSupported(true);
+  ndi.Push(nditest::MetadataCapture(R"(<ndi_product model_name="Cam"/>)"));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameStatusChange));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameError));
+  StartReceiving();  // the metadata frame counts as delivered
+  Until([&] { return callbacks->Count("ptz NDI3/Cam") == 1 && ndi.Seen().queued == 0; });
+  source->Stop();
+  EXPECT_EQ(ndi.Seen().frees[2], 1);
+  EXPECT_EQ(ndi.Seen().frees[0], 1);
+  EXPECT_TRUE(ndi.Seen().freesMatched);
+}
+
+// ============================================================ Panel and texts
+
+// Video: size and rate to two decimals (none without a rate); audio: channels
+// and rate to one decimal under 48 kHz; empty without a size or channels.
+TEST(StatusText, VideoAndAudioLines) {
+  const auto video = [](int w, int h, int n, int d) { return TaskNDISource::VideoStatusText(MediaInfo{w, h, n, d, 0, 0}); };
+  const auto audio = [](int rate, int channels) {
+    return TaskNDISource::AudioStatusText(MediaInfo{0, 0, 0, 0, rate, channels});
+  };
+  const std::pair<std::string, const char*> cases[] = {
+      {video(1920, 1080, 30000, 1001), "1920x1080 @ 29.97 fps"},
+      {video(1920, 1080, 25, 2), "1920x1080 @ 12.50 fps"},
+      {video(640, 480, 1, 16), "640x480 @ 0.06 fps"},
+      {video(1280, 720, 30, 0), "1280x720"},
+      {video(0, 0, 30, 1), ""},
+      {video(1280, -1, 30, 1), ""},
+      {video(16, 16, 2147483647, 1), "16x16 @ 2147483647 fps"},  // would overflow when scaled
+      {audio(48000, 2), "Stereo @ 48 kHz"},
+      {audio(44100, 1), "Mono @ 44.1 kHz"},
+      {audio(22050, 2), "Stereo @ 22.0 kHz"},
+      {audio(48000, 6), "6 Channels @ 48 kHz"},
+      {audio(0, 2), "Stereo"},
+      {audio(48000, 0), ""},
+  };
+  for (const auto& [text, expected] : cases) EXPECT_EQ(text, expected);
+}
+
+// The panel as the host gets it, byte for byte.
+TEST_F(NdiSource, StatusPanelIsExact) {
+  NDISource::Config config;
+  config.bandwidth = "ndi_bandwidth_audio_only";
+  EXPECT_EQ(source->BuildStatusGui(config, ReceiverState::Error),
+            R"({"audio":{"ghosted":false,"indication":0,"justification":108,"pm::order":4,)"
+            R"("title":"ndi_audio_status_label","type":"static_text","value":"","visible":true},)"
+            R"("bandwidth":{"ghosted":false,"pm::order":0,"title":"ndi_bandwidth_label","type":"popup",)"
+            R"("value":2,"valueSetID":"","values":["ndi_bandwidth_highest","ndi_bandwidth_lowest",)"
+            R"("ndi_bandwidth_audio_only"],"visible":true},)"
+            R"("reconnect":{"action":1668641652,"command":"taskndisource::reconnect","ghosted":false,)"
+            R"("pm::order":1,"title":"ndi_reconnect_button","type":"button","visible":true},)"
+            R"("status":{"ghosted":false,"indication":101,"justification":108,"pm::order":2,)"
+            R"("title":"p_status_label","type":"static_text","value":"taskvistafeed_status_error",)"
+            R"("visible":true},)"
+            R"("video":{"ghosted":false,"indication":0,"justification":108,"pm::order":3,)"
+            R"("title":"ndi_video_status_label","type":"static_text","value":"","visible":true}})");
+}
+
+// The pop-up's index becomes the bandwidth's name (leniently read, out of
+// range the first), and a configuration comes back through the panel as it
+// was; text that is not JSON gives nothing.
+TEST_F(NdiSource, PanelAndConfigurationTranslateBothWays) {
+  const std::pair<const char*, const char*> cases[] = {
+      {R"({"bandwidth":{"value":0}})", "ndi_bandwidth_highest"},
+      {R"({"bandwidth":{"value":1}})", "ndi_bandwidth_lowest"},
+      {R"({"bandwidth":{"value":2}})", "ndi_bandwidth_audio_only"},
+      {R"({"bandwidth":{"value":"1"}})", "ndi_bandwidth_lowest"},
+      {R"({"bandwidth":{"value":9}})", "ndi_bandwidth_highest"},
+  };
+  for (const auto& [gui, name] : cases) {
+    const Json config = Json{{"bandwidth", name}};
+    EXPECT_EQ(Json::parse(source->GuiToConfiguration(gui)), config) << gui;
+    EXPECT_EQ(Json::parse(source->GuiToConfiguration(source->ConfigurationToGui(config.dump()))), config) << name;
+  }
+  EXPECT_EQ(source->GuiToConfiguration("{not json"), "");
+  EXPECT_EQ(source->ConfigurationToGui("{not json"), "");
+  EXPECT_EQ(Json::parse(source->ConfigurationToGui(R"({"bandwidth":5})"))["bandwidth"]["value"], 0);
+}
+
+// ============================================================= Receiver loop
+
+// A sender not listed is looked for every 250 ms, with a line each time, and
+// the waits count toward the retry limit: found after it, its receiver is
+// made and the loop goes idle without a capture. (With an id too short to
+// carry a name: the empty name is looked for.)
+TEST_F(NdiSource, SenderNotFoundIsLookedForEvery250MsAndFoundLateSendsTheLoopToIdle) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.SetConnections(0);
+  Make(std::chrono::seconds(5), nullptr, "short");
+  source->Start();
+  for (int attempt = 1; attempt <= 130; ++attempt) {
+    ASSERT_EQ(env.clock->AwaitWait(attempt), 250) << attempt;
+    ASSERT_EQ(logs.Count("#ndisource: waiting for source to be found\n"), attempt);
+    if (attempt == 130) ndi.SetSources({Entry{"", kUrl}});
+    env.clock->AdvanceMs(250);
+  }
+  UntilStates({1, 3});
+  EXPECT_EQ(ndi.Seen().captures, 0);
+  EXPECT_EQ(ndi.Seen().findersCreated, 1);  // one finder for the whole loop
+}
+
+// A finder or receiver that cannot be made, or a sender listed without a
+// URL, is an error: told, on the panel, and kept (the sender coming back with
+// a URL does not end it) until a reconnect.
+TEST_F(NdiSource, ErrorsAreToldAndKeptUntilAReconnect) {
+  const std::pair<std::function<void()>, const char*> cases[] = {
+      {[&] { ndi.FailFinderCreate(true); }, "#ndisource: failed to create NDI finder\n"},
+      {[&] { ndi.FailReceiverCreate(true); }, "#ndisource: failed to create NDI receiver\n"},
+      {[&] { ndi.SetSources({Entry{kName, ""}}); }, "#ndisource: source has no url\n"},
+  };
+  for (const auto& [fault, line] : cases) {
+    SCOPED_TRACE(line);
+    ndi.SetSources({Entry{kName, kUrl}});
+    fault();
+    source->Stop();
+    env.clock = std::make_shared<pmtest::ManualClock>();  // each run's waits counted from 1
+    Make();
+    source->Start();
+    UntilState(ReceiverState::Error);
+    EXPECT_TRUE(logs.Contains(line));
+    const std::string gui = callbacks->Seen().guis.back();
+    EXPECT_NE(gui.find("\"indication\":101"), std::string::npos) << gui;
+    ndi.FailFinderCreate(false);
+    ndi.FailReceiverCreate(false);
+  }
+  ASSERT_EQ(env.clock->AwaitWait(1), 5000);
+  ndi.SetSources({Entry{kName, kUrl}});
+  env.clock->AdvanceMs(5000);
+  ASSERT_EQ(env.clock->AwaitWait(2), 5000);
+  EXPECT_EQ(source->State(), ReceiverState::Error);
+  EXPECT_TRUE(ndi.Seen().receivers.empty());
+  for (std::int32_t state : callbacks->Seen().states) EXPECT_NE(state, 4);
+  source->ExecuteCustomActionCommand("taskndisource::reconnect");
+  ndi.Push(AnyVideo());
+  UntilState(ReceiverState::Receiving);
+}
+
+// The first sender listed with the name is taken, with the task's receiver
+// settings, told the tally and both documents, then received; every frame
+// handed out is freed.
+TEST_F(NdiSource, ConnectedSenderAnnouncedWithTallyAndBothDocumentsThenReceives) {
+  ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{std::nullopt, "10.0.0.2:1"}, Entry{kName, kUrl},
+                  Entry{kName, "10.0.0.3:1"}});
+  ndi.Push(AnyVideo());
+  source->HandleShotEvent("TALLY_LIVE_ON");
+  source->Start();
+  UntilStates({1, 2});
+  const auto sent = ndi.Seen().metadataSent;
+  ASSERT_GE(sent.size(), 2u);
+  EXPECT_EQ(sent[0],
+            "<metadata>\n    <receiver_info name=\"Skyrelay\" vendor=\"Quillfront LLC\" protocol_version=\"1\"/>\n"
+            "</metadata>\n");
+  EXPECT_EQ(sent[1], "<metadata>\n    <media_settings width=\"1280\" height=\"720\" framerate=\"1\"/>\n</metadata>\n");
+  EXPECT_EQ(ndi.Seen().metadataLengths[0], static_cast<int>(sent[0].size()) + 1);
+  ASSERT_FALSE(ndi.Seen().tallies.empty());
+  EXPECT_TRUE(ndi.Seen().tallies[0].on_program);
+  EXPECT_FALSE(ndi.Seen().tallies[0].on_preview);
+  // One panel for Connecting, one for Receiving with the media format.
+  Until([&] { return callbacks->Seen().guis.size() >= 2; });
+  const std::string gui = callbacks->Seen().guis.at(1);
+  EXPECT_NE(gui.find("ndi_state_receiving"), std::string::npos) << gui;
+  EXPECT_NE(gui.find("16x4 @ 29.97 fps"), std::string::npos) << gui;
+  const auto created = ndi.Seen().receivers.at(0);
+  EXPECT_EQ(created.url, kUrl);
+  EXPECT_EQ(created.name, kName);
+  EXPECT_EQ(created.colorFormat, 1);
+  EXPECT_EQ(created.bandwidth, 100);
+  EXPECT_FALSE(created.allowFields);
+  source->Stop();
+  EXPECT_TRUE(ndi.Seen().freesMatched);
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
+}
+
+TEST_F(NdiSource, RefusedTallyOrMetadataCountsAsAnAttemptAndRetriesAfter250Ms) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.SetTallyResult(false);
+  source->Start();
+  ASSERT_EQ(env.clock->AwaitWait(1), 250);
+  ndi.SetTallyResult(true);
+  ndi.SetMetadataResult(false);
+  env.clock->AdvanceMs(250);
+  ASSERT_EQ(env.clock->AwaitWait(2), 250);
+  EXPECT_EQ(ndi.Seen().captures, 0);
+  ndi.SetMetadataResult(true);
+  ndi.Push(AnyVideo());
+  env.clock->AdvanceMs(250);
+  UntilState(ReceiverState::Receiving);
+}
+
+TEST_F(NdiSource, AfterRetryLimitGoesIdleReportsAtOnceThenPollsEvery5s) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.SetConnections(0);
+  source->Start();
+  ASSERT_EQ(env.clock->AwaitWait(1), 5000);
+  EXPECT_EQ(ndi.Seen().captures, 120);
+  EXPECT_EQ(source->State(), ReceiverState::Idle);
+  EXPECT_EQ(callbacks->Seen().states, (std::vector<std::int32_t>{1, 3}));
+  const int queries = ndi.Seen().connectionQueries;
+  for (int poll = 2; poll <= 4; ++poll) {
+    env.clock->AdvanceMs(5000);
+    ASSERT_EQ(env.clock->AwaitWait(poll), 5000);
+    EXPECT_EQ(ndi.Seen().connectionQueries, queries + poll - 1);
+  }
+  // The sender is back: reconnect from Idle on the same receiver, then receive.
+  ndi.SetConnections(1);
+  ndi.Push(AnyVideo());
+  env.clock->AdvanceMs(5000);
+  UntilStates({1, 3, 1, 2});
+  EXPECT_EQ(ndi.Seen().receivers.size(), 1u);
+}
+
+// The runtime keeps a dead sender's URL listed for a while, and a receiver
+// takes whichever sender listens at its URL: when the finder lists the sender
+// at another URL than its receiver was made for, the receiver is made again
+// for the listed one, while connecting as while receiving. The list is looked
+// at every 250 ms; a sender missing from it for a moment keeps its receiver.
+struct ListedCase {
+  const char* what;
+  bool receiving;             // else still connecting, with a receiver
+  std::vector<Entry> listed;  // the list from then on
+  const char* madeAgainFor;   // null: the receiver stays
+  std::vector<std::int32_t> states;
+};
+void PrintTo(const ListedCase& c, std::ostream* os) { *os << c.what; }
+
+class ListedUrl : public NdiSource, public ::testing::WithParamInterface<ListedCase> {};
+
+TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
+  const ListedCase& c = GetParam();
+  ndi.SetSources({Entry{kName, kUrl}});
+  if (c.receiving) ndi.Push(AnyVideo());
+  source->Start();
+  if (c.receiving) UntilStates({1, 2});
+  Until([&] { return ndi.Seen().captures >= 3; });
+  ndi.SetSources(c.listed);
+  const int lists = ndi.Seen().listCalls, captures = ndi.Seen().captures;
+  Until([&] { return ndi.Seen().captures >= captures + 20; });
+  EXPECT_EQ(ndi.Seen().listCalls, lists) << "not looked at before 250 ms have passed";
+  env.clock->AdvanceMs(250);
+  if (c.madeAgainFor != nullptr) {
+    Until([&] { return ndi.Seen().receivers.size() == 2; });
+    EXPECT_EQ(ndi.Seen().receivers[1].url, c.madeAgainFor);
+    EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
+    ndi.Push(AnyVideo());
+  } else {
+    Until([&] { return ndi.Seen().captures >= captures + 40; });
+    EXPECT_EQ(ndi.Seen().receivers.size(), 1u);
+  }
+  UntilStates(c.states);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    NdiSource, ListedUrl,
+    ::testing::Values(ListedCase{"moved_while_receiving", true, {Entry{kName, "10.0.0.9:2"}}, "10.0.0.9:2", {1, 2, 1, 2}},
+                      ListedCase{"moved_while_connecting", false, {Entry{kName, "10.0.0.9:2"}}, "10.0.0.9:2", {1, 2}},
+                      ListedCase{"missing_from_the_list", true, {}, nullptr, {1, 2}},
+                      ListedCase{"listed_without_url", true, {Entry{kName, ""}}, nullptr, {1, 2}},
+                      ListedCase{"still_first_at_its_url", true,
+                                 {Entry{kName, kUrl}, Entry{kName, "10.0.0.9:2"}}, nullptr, {1, 2}}),
+    [](const ::testing::TestParamInfo<ListedCase>& info) { return std::string(info.param.what); });
+
+TEST_F(NdiSource, StopOrReleaseEndsAWaitingLoopAtOnceAndReleasesEverything) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.SetConnections(0);
+  source->Start();
+  ASSERT_EQ(env.clock->AwaitWait(1), 5000);  // Idle, waiting for the next poll
+  source->Stop();
+  EXPECT_EQ(*env.exits, 0);
+  EXPECT_EQ(source->State(), ReceiverState::None);
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
+  // Stop and Stop again, or Stop without Start, only leave state 0.
+  source->Stop();
+  NDISource never(callbacks, kId, ndi.Api(), env.Make());
+  never.Stop();
+  EXPECT_EQ(never.State(), ReceiverState::None);
+  // A source released while its loop runs stops it.
+  source->Start();
+  Until([&] { return ndi.Seen().findersCreated == 2; });
+  source.reset();
+  EXPECT_EQ(ndi.Seen().findersDestroyed, 2);
+}
+
+TEST_F(NdiSource, LoopStuckPastTheStopDeadlineEndsTheProcess) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.BlockCapture(true);
+  Make(std::chrono::milliseconds(20), [this] { ndi.BlockCapture(false); });
+  source->Start();
+  Until([&] { return ndi.Seen().captures >= 1; });
+  source->Stop();
+  EXPECT_EQ(*env.exits, 1);
+  EXPECT_TRUE(logs.Contains("#ndisource: failed to exit receiver loop\n"));
+}
+
+// Reconnect and configuration restart a started source (with the new
+// bandwidth) and only store on a stopped one. A bandwidth text of no known
+// name selects the highest; a text that does not read keeps the value.
+TEST_F(NdiSource, StartedSourceRestartsOnReconnectAndConfiguration) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  source->ExecuteCustomActionCommand("taskndisource::reconnect");
+  source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_audio_only"})");
+  source->SetConfiguration("not json");
+  EXPECT_FALSE(source->Started());
+  EXPECT_EQ(ndi.Seen().findersCreated, 0);
+  source->Start();
+  const std::function<void()> changes[] = {
+      [&] { source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest "})"); },
+      [&] { source->SetConfiguration(R"({"bandwidth":"ndi_bandwidth_lowest"})"); },
+      [&] { source->ExecuteCustomActionCommand("taskndisource::reconnect"); },
+  };
+  for (std::size_t i = 0; i < std::size(changes); ++i) {
+    Until([&] { return ndi.Seen().receivers.size() == i + 1; });
+    changes[i]();
+  }
+  Until([&] { return ndi.Seen().receivers.size() == 4; });
+  std::vector<std::int32_t> bandwidths;
+  for (const auto& receiver : ndi.Seen().receivers) bandwidths.push_back(receiver.bandwidth);
+  EXPECT_EQ(bandwidths, (std::vector<std::int32_t>{10, 100, 0, 0}));
+  EXPECT_EQ(ndi.Seen().receiversDestroyed, 3);
+}
+
+TEST_F(NdiSource, ConcurrentReconnectsNeverRunTwoLoops) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  source->Start();
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 3; ++t) {
+    threads.emplace_back([this, t] {
+      for (int i = 0; i < 20; ++i) {
+        if (t == 0) {
+          source->ExecuteCustomActionCommand("taskndisource::reconnect");
+        } else if (t == 1) {
+          source->SetConfiguration(i % 2 ? R"({"bandwidth":"ndi_bandwidth_lowest"})" : "{}");
+        } else {
+          source->Start();  // a start over a running loop is refused
+        }
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  Until([&] { return ndi.Seen().findersCreated - ndi.Seen().findersDestroyed == 1; });
+  EXPECT_EQ(ndi.Seen().maxLiveFinders, 1);
+  source->Stop();
+  EXPECT_EQ(ndi.Seen().findersCreated, ndi.Seen().findersDestroyed);
+  EXPECT_EQ(*env.exits, 0);
+}
+
+// Without callbacks frames are dropped with their lines, and the loop still
+// runs and idles without spinning.
+TEST_F(NdiSource, LoopWithoutCallbacksDropsFramesAndIdlesWithoutSpinning) {
+  ndi.SetSources({Entry{kName, kUrl}});
+  ndi.SetConnections(0);
+  ndi.Push(AnyVideo());
+  ndi.Push(AudioCapture(48000, 2, 16));
+  source = std::make_shared<NDISource>(nullptr, kId, ndi.Api(), env.Make());
+  source->Start();
+  ASSERT_EQ(env.clock->AwaitWait(1), 5000);
+  EXPECT_EQ(source->State(), ReceiverState::Idle);
+  EXPECT_TRUE(logs.Contains("#ndisource: expected video data callback when processing NDI video frame\n"));
+  EXPECT_TRUE(logs.Contains("#ndisource: no callbacks\n"));
+}
+
+}  // namespace
