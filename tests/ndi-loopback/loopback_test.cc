@@ -17,7 +17,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <string>
@@ -35,7 +34,6 @@
 namespace {
 
 using namespace std::chrono_literals;
-using nlohmann::json;
 using pmtest::kPatience;
 using pmtest::Sender;
 using Clock = std::chrono::steady_clock;
@@ -44,11 +42,11 @@ std::string Ramp(const ndi_video_frame_v2& v, std::int64_t* n = nullptr) {
   return ndits::CheckRamp(v.FourCC, v.xres, v.yres, v.line_stride_in_bytes, v.data, n);
 }
 
-// One capture of any type, held until the receiver frees it.
+// One capture of a picture, metadata or a status change (sound stays
+// queued, at most 32 frames), held until the receiver frees it.
 struct Frame {
   std::int32_t type = kNdiFrameNone;
   ndi_video_frame_v2 v{};
-  ndi_audio_frame_v2 a{};
   ndi_metadata_frame m{};
 };
 
@@ -64,12 +62,11 @@ class Receiver {
   bool WaitConnected() const { return pmtest::WaitFor([&] { return Connections() == 1; }, kPatience); }
   Frame Capture(std::uint32_t timeout_ms) {
     Frame f;
-    f.type = NDIlib_recv_capture_v2(handle_, &f.v, &f.a, &f.m, timeout_ms);
+    f.type = NDIlib_recv_capture_v2(handle_, &f.v, nullptr, &f.m, timeout_ms);
     return f;
   }
   void Free(const Frame& f) {
     if (f.type == kNdiFrameVideo) NDIlib_recv_free_video_v2(handle_, &f.v);
-    if (f.type == kNdiFrameAudio) NDIlib_recv_free_audio_v2(handle_, &f.a);
     if (f.type == kNdiFrameMetadata) NDIlib_recv_free_metadata(handle_, &f.m);
   }
   // Captures until a frame of `type` comes (freeing the others) and returns
@@ -95,8 +92,6 @@ class Receiver {
   void* handle_ = nullptr;
 };
 
-std::string Url(Sender& s) { return s.Find("ready").value("url", ""); }
-
 bool Write(ndilb::SocketHandle fd, const void* bytes, std::size_t n) {
   ndilb::Piece piece{bytes, n};
   return ndilb::WriteAll(fd, &piece, 1);
@@ -119,53 +114,31 @@ bool ClosedByPeer(ndilb::SocketHandle fd, std::chrono::milliseconds timeout) {
 
 class Loopback : public ::testing::Test {
  protected:
-  void SetUp() override {
-    std::filesystem::create_directories(folder_.Registry());
-    ::setenv("NDI_LOOPBACK_DIR", folder_.Registry().c_str(), 1);
-  }
+  void SetUp() override { ::setenv("NDI_LOOPBACK_DIR", folder_.Registry().c_str(), 1); }
   void TearDown() override { ::unsetenv("NDI_LOOPBACK_DIR"); }
   pmtest::Folder folder_;
 };
 
 // --- discovery ------------------------------------------------------------
 
-// As with the vendor runtime, a sender that ended stays listed for about a
-// second; the finder's wait sees the change when it is listed no more, and
-// only then. Its full name is the host's in capitals, then its own.
-TEST_F(Loopback, ASenderThatEndedStaysListedForASecondAndTheFinderWakesWhenItGoes) {
-  Sender src;
-  ASSERT_TRUE(src.Start(folder_, "Went", {"--width", "16", "--height", "8", "--fps", "10"}));
-  EXPECT_THAT(src.Name(), ::testing::MatchesRegex("[^a-z]+ \\(Went\\)"));
-  void* finder = NDIlib_find_create_v2(nullptr);
-  std::uint32_t count = 0;
-  ASSERT_TRUE(pmtest::WaitFor([&] {
-    NDIlib_find_get_current_sources(finder, &count);
-    return count == 1;
-  }, kPatience));
-  const auto went = Clock::now();
-  src.Process().Signal(SIGTERM);
-  EXPECT_TRUE(NDIlib_find_wait_for_sources(finder, 5000)) << "the change is seen";
-  EXPECT_GE(Clock::now() - went, std::chrono::milliseconds(ndilb::kListedAfterGoneMs));
-  NDIlib_find_get_current_sources(finder, &count);
-  EXPECT_EQ(count, 0u);
-  EXPECT_FALSE(NDIlib_find_wait_for_sources(finder, 100)) << "no change, no wake-up";
-  NDIlib_find_destroy(finder);
-  EXPECT_EQ(src.Process().Wait(kPatience), std::optional<int>(0)) << "SIGTERM ends the sender cleanly";
-}
-
 // What a finder lists from the folder (each entry's own format is the
-// registry's case in wire_test): entries that are no entries are skipped; a
-// sender whose process died (here a zombie, which a parent that has not
-// looked yet leaves) is listed for a second from when it is found dead; a
-// name is listed once, with its entry made first while that is listed; an
-// entry gone long ago is removed by the reader that finds it.
-TEST_F(Loopback, TheListingKeepsTheDeadForASecondAndEachNameOnce) {
+// registry's case in wire_test), as the vendor runtime would: a sender that
+// ended stays listed for about a second, and so does one whose process died
+// (here a zombie, as a parent that has not looked yet leaves it), from when
+// it is found dead; a name is listed once, with its entry made first while
+// that is listed; a sender's full name is the host's in capitals, then its
+// own. Entries that are no entries are skipped; one gone long ago is removed
+// by the reader that finds it.
+TEST_F(Loopback, TheListingKeepsTheGoneForASecondAndEachNameOnce) {
+  Sender ended;
+  ASSERT_TRUE(ended.Start(folder_, "Ended", {"--width", "16", "--height", "8", "--fps", "10"}));
+  ended.Process().Signal(SIGTERM);
+  ASSERT_EQ(ended.Process().Wait(kPatience), std::optional<int>(0)) << "SIGTERM ends the sender cleanly";
   const pid_t dead = fork();
   if (dead == 0) _exit(0);
-  ASSERT_GT(dead, 0);
   siginfo_t info{};
   ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(dead), &info, WEXITED | WNOWAIT), 0);  // a zombie now
-  const std::string dir = folder_.Registry(), alive = std::to_string(getpid());
+  const std::string dir = ndilb::RegistryDir(), alive = std::to_string(getpid());
   const std::int64_t now = std::chrono::duration_cast<std::chrono::nanoseconds>(
                                std::chrono::system_clock::now().time_since_epoch()).count();
   auto write = [&](const std::string& file, const std::string& name, int port, const std::string& pid,
@@ -186,8 +159,10 @@ TEST_F(Loopback, TheListingKeepsTheDeadForASecondAndEachNameOnce) {
     for (const ndilb::RegistryEntry& e : ndilb::ListRegistry()) names.push_back(e.name + "@" + e.url);
     return names;
   };
-  EXPECT_EQ(listed(), (std::vector<std::string>{"ALIVE (x)@127.0.0.1:5", "BACK (x)@127.0.0.1:8", "DEAD (x)@127.0.0.1:4"}));
-  EXPECT_FALSE(std::filesystem::exists(dir + "/6-6.gone"));
+  EXPECT_THAT(listed(), ::testing::UnorderedElementsAre("ALIVE (x)@127.0.0.1:5", "BACK (x)@127.0.0.1:8",
+                                                        "DEAD (x)@127.0.0.1:4",
+                                                        ::testing::MatchesRegex("[^a-z]+ \\(Ended\\)@127\\.0\\.0\\.1:[0-9]+")));
+  EXPECT_FALSE(std::ifstream(dir + "/6-6.gone").good());
   EXPECT_TRUE(pmtest::WaitFor(
       [&] { return listed() == std::vector<std::string>{"ALIVE (x)@127.0.0.1:5", "BACK (x)@127.0.0.1:7"}; }, kPatience));
   ::waitpid(dead, nullptr, 0);
@@ -199,7 +174,7 @@ TEST_F(Loopback, ReceiverTakesTheSenderAtItsUrlElseTheOneListedForItsName) {
   Sender there, named;
   ASSERT_TRUE(there.Start(folder_, "There", {"--width", "32", "--height", "8", "--fps", "30"}));
   ASSERT_TRUE(named.Start(folder_, "Named", {"--width", "16", "--height", "8", "--fps", "30"}));
-  const std::string thereUrl = Url(there);
+  const std::string thereUrl = there.Find("ready").value("url", "");
   const std::pair<const char*, int> cases[] = {{thereUrl.c_str(), 32}, {"127.0.0.1:1", 16}, {nullptr, 16}};
   for (const auto& [url, width] : cases) {
     SCOPED_TRACE(url ? url : "no url");
@@ -216,37 +191,28 @@ TEST_F(Loopback, ReceiverTakesTheSenderAtItsUrlElseTheOneListedForItsName) {
 // byte with rows at the 16-pixel stride; converted otherwise; stamped with
 // the sender's clock.
 TEST_F(Loopback, PicturesArriveInTheFourCCAndStrideTheTaskIsGiven) {
-  const struct {
-    const char* format;
-    int width;
-    std::uint32_t delivered;
-    int stride;
-  } cases[] = {{"uyvy", 72, kNdiFourCCUYVY, 160}, {"uyva", 64, kNdiFourCCBGRA, 256}, {"nv12", 64, kNdiFourCCUYVY, 128},
-               {"yv12", 72, kNdiFourCCUYVY, 160}, {"rgbx", 64, kNdiFourCCUYVY, 128}};
-  for (const auto& c : cases) {
-    SCOPED_TRACE(std::string(c.format) + " " + std::to_string(c.width));
+  // Sender format and width; the FourCC and stride delivered.
+  const std::tuple<std::string, int, std::uint32_t, int> cases[] = {
+      {"uyvy", 72, kNdiFourCCUYVY, 160}, {"uyva", 64, kNdiFourCCBGRA, 256}, {"nv12", 64, kNdiFourCCUYVY, 128},
+      {"yv12", 72, kNdiFourCCUYVY, 160}, {"rgbx", 64, kNdiFourCCUYVY, 128}};
+  for (const auto& [format, width, delivered, stride] : cases) {
+    SCOPED_TRACE(format + " " + std::to_string(width));
     Sender src;
-    ASSERT_TRUE(src.Start(folder_, "Ramp " + std::string(c.format),
-                          {"--width", std::to_string(c.width), "--height", "36", "--fps", "100", "--format", c.format,
+    ASSERT_TRUE(src.Start(folder_, "Ramp " + format,
+                          {"--width", std::to_string(width), "--height", "36", "--fps", "100", "--format", format,
                            "--pattern", "ramp", "--no-audio", "--seconds", "10"}));
     Receiver rx(src.Name());
-    const bool as_sent = ndits::FourCCFromName(c.format) == c.delivered;
-    std::int64_t last = -1, last_stamp = 0;
+    const bool as_sent = ndits::FourCCFromName(format) == delivered;
     for (int i = 0; i < 5; ++i) {
       ASSERT_TRUE(rx.Next(kNdiFrameVideo, [&](const Frame& f) {
         const ndi_video_frame_v2& v = f.v;
         EXPECT_EQ(std::make_tuple(v.FourCC, v.line_stride_in_bytes, v.xres, v.yres, v.frame_rate_N),
-                  std::make_tuple(c.delivered, c.stride, c.width, 36, 100));
-        std::int64_t n = -1;
-        EXPECT_EQ(as_sent ? Ramp(v, &n) : "", "");
-        EXPECT_TRUE(!as_sent || n > last) << n << " after " << last;
-        last = n;
+                  std::make_tuple(delivered, stride, width, 36, 100));
+        EXPECT_EQ(as_sent ? Ramp(v) : "", "");
         // The sender's clock, in 100 ns units.
         const std::int64_t now = std::chrono::duration_cast<std::chrono::microseconds>(
                                      std::chrono::system_clock::now().time_since_epoch()).count() * 10;
-        EXPECT_GT(v.timestamp, last_stamp);
         EXPECT_LT(std::llabs(now - v.timestamp), 50'000'000) << "within 5 s of now";
-        last_stamp = v.timestamp;
       }));
     }
   }
@@ -289,12 +255,12 @@ TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact
   for (int n = 2; n < 22; ++n) send(n);
   // A metadata frame after the pictures: once it can be captured (pictures
   // stay queued while only metadata is asked for), every picture is queued.
-  std::string end = "<end/>";
-  ndi_metadata_frame marker{static_cast<int>(end.size() + 1), 0, end.data()};
+  char end[] = "<end/>";
+  ndi_metadata_frame marker{sizeof end, 0, end};
   NDIlib_send_send_metadata(sender, &marker);
   ndi_metadata_frame got{};
   ASSERT_EQ(NDIlib_recv_capture_v2(rx.get(), nullptr, nullptr, &got, 5000), kNdiFrameMetadata);
-  EXPECT_EQ(std::string(got.data), end);
+  EXPECT_STREQ(got.data, end);
   NDIlib_recv_free_metadata(rx.get(), &got);
   std::vector<std::int64_t> numbers;
   for (Frame f = rx.Capture(0); f.type == kNdiFrameVideo; rx.Free(f), f = rx.Capture(0)) {
@@ -318,8 +284,7 @@ TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact
 // --- metadata, tally, PTZ -------------------------------------------------
 
 // An in-process sender (as ndi-testsrc is) counts its receivers and combines
-// their tally (reported on every connection change, as the vendor runtime
-// does, then not until something changes).
+// their tally; a receiver that goes takes its tally with it.
 TEST_F(Loopback, AnInProcessSenderCountsItsReceiversAndCombinesTheirTally) {
   ndi_send_create settings{"Combined", nullptr, false, false};
   void* sender = NDIlib_send_create(&settings);
@@ -329,9 +294,6 @@ TEST_F(Loopback, AnInProcessSenderCountsItsReceiversAndCombinesTheirTally) {
   ASSERT_TRUE(live->WaitConnected() && look.WaitConnected());
   EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_send_get_no_connections(sender, 0) == 2; }, kPatience));
   ndi_tally t{};
-  EXPECT_TRUE(NDIlib_send_get_tally(sender, &t, 0));
-  EXPECT_FALSE(t.on_program || t.on_preview);
-  EXPECT_FALSE(NDIlib_send_get_tally(sender, &t, 0)) << "nothing changed since";
   const ndi_tally program{true, false}, preview{false, true};
   ASSERT_TRUE(NDIlib_recv_set_tally(live->get(), &program));
   ASSERT_TRUE(NDIlib_recv_set_tally(look.get(), &preview));
@@ -341,17 +303,15 @@ TEST_F(Loopback, AnInProcessSenderCountsItsReceiversAndCombinesTheirTally) {
   }, kPatience));
   live.reset();  // its program tally goes with it
   EXPECT_TRUE(NDIlib_send_get_tally(sender, &t, 2000));
-  EXPECT_FALSE(t.on_program);
-  EXPECT_TRUE(t.on_preview);
+  EXPECT_EQ(std::make_pair(t.on_program, t.on_preview), std::make_pair(false, true));
   EXPECT_EQ(NDIlib_send_get_no_connections(sender, 0), 1);
   NDIlib_send_destroy(sender);
   EXPECT_TRUE(pmtest::WaitFor([&] { return look.Connections() == 0; }, kPatience));
 }
 
 // As with the vendor runtime: a status change at once, before the
-// connection, and one more when a sender that takes PTZ connects (its
-// <ndi_capabilities ntk_ptz="true"/> is the runtime's, never captured); PTZ
-// commands go out either way, as the text the vendor runtime sends for the
+// connection, and one more when a sender that takes PTZ connects (it says so
+// in its <ndi_capabilities ntk_ptz="true"/>); PTZ commands go out either way, as the text the vendor runtime sends for the
 // same call (one call of each shape: zoom and pan/tilt come through the
 // whole chain).
 TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncementAndCallsReachItAsTheVendorsTexts) {
@@ -367,15 +327,14 @@ TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncementAndCallsReachItAsTheVend
     ASSERT_TRUE(src.Start(folder_, ptz ? "With PTZ" : "No PTZ",
                           {"--width", "16", "--height", "8", "--fps", "10", ptz ? "--ptz" : "--no-audio"}));
     Receiver rx(src.Name());
-    ndi_metadata_frame m{};
-    ASSERT_EQ(NDIlib_recv_capture_v2(rx.get(), nullptr, nullptr, &m, 0), kNdiFrameStatusChange);
+    ASSERT_EQ(rx.Capture(0).type, kNdiFrameStatusChange);
     EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.get()));
     ASSERT_TRUE(rx.WaitConnected());
     EXPECT_EQ(rx.Next(kNdiFrameStatusChange, {}, ptz ? kPatience : 300ms), ptz);
     EXPECT_EQ(NDIlib_recv_ptz_is_supported(rx.get()), ptz);
     for (const auto& [call, xml] : calls) {
       EXPECT_TRUE(call(rx.get())) << xml;
-      EXPECT_TRUE(src.WaitFor("ptz", [&](const json& e) { return e.value("xml", "") == xml; })) << xml;
+      EXPECT_TRUE(src.WaitFor("ptz", [&](const nlohmann::json& e) { return e.value("xml", "") == xml; })) << xml;
     }
   }
 }
@@ -387,26 +346,14 @@ TEST_F(Loopback, GarbageOnASendersPortDropsOnlyThatConnection) {
   ASSERT_TRUE(src.Start(folder_, "Guarded", {"--width", "16", "--height", "8", "--fps", "20", "--pattern", "ramp"}));
   Receiver rx(src.Name());
   ASSERT_TRUE(rx.WaitConnected());
-  const auto hello = ndilb::EncodeHello(100, false, false);
-  const auto huge = ndilb::EncodeMetadata(ndilb::MessageType::Metadata, 0, 0xFFFFFFF0u);
-  const struct {
-    const char* what;
-    std::string bytes;
-    std::chrono::milliseconds limit;
-  } cases[] = {
-      {"garbage", std::string(100, 'Z'), 2s},
-      {"a 4 GB text is refused, not awaited",
-       std::string(reinterpret_cast<const char*>(hello.bytes), hello.size) +
-           std::string(reinterpret_cast<const char*>(huge.bytes), huge.size),
-       2s},
-      {"a connection that never says hello is not kept", "", 4s},
-  };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.what);
-    const ndilb::SocketHandle fd = ndilb::ConnectTo(Url(src), 1000);
+  // Garbage, and a connection that never says hello (the decoder's refusals
+  // are wire_test's).
+  for (const std::string& bytes : {std::string(100, 'Z'), std::string()}) {
+    SCOPED_TRACE(bytes);
+    const ndilb::SocketHandle fd = ndilb::ConnectTo(src.Find("ready").value("url", ""), 1000);
     ASSERT_NE(fd, ndilb::kNoSocket);
-    EXPECT_TRUE(c.bytes.empty() || Write(fd, c.bytes.data(), c.bytes.size()));
-    EXPECT_TRUE(ClosedByPeer(fd, c.limit));
+    EXPECT_TRUE(bytes.empty() || Write(fd, bytes.data(), bytes.size()));
+    EXPECT_TRUE(ClosedByPeer(fd, 4s));
     ndilb::CloseSocket(fd);
   }
   // The real receiver kept its connection and its frames.
@@ -441,8 +388,7 @@ TEST_F(Loopback, AFakeSendersGarbageAndHalfPictureReachNothingAndTheReceiverTrie
   };
   ndilb::SocketHandle fd = accept();
   ASSERT_NE(fd, ndilb::kNoSocket);
-  const std::vector<std::uint8_t> garbage(64, 0xEE);
-  ASSERT_TRUE(Write(fd, garbage.data(), garbage.size()));
+  ASSERT_TRUE(Write(fd, std::string(64, 'Z').data(), 64));
   EXPECT_TRUE(ClosedByPeer(fd, 2s));
   ndilb::CloseSocket(fd);
   const ndi_tally program{true, false}, both{true, true};
