@@ -86,6 +86,8 @@ TEST(WireDecoder, RejectsBadHeadersAndTheOtherEndsMessagesBeforeAllocatingAndSta
       {"oversize text", spoilt([](auto& b) { b[8] = b[9] = b[10] = b[11] = 0xFF; })},
       {"oversize payload", spoilt([](auto& b) { b[23] = 0x7F; })},
       {"payload not matching the picture", spoilt([](auto& b) { b[16] += 1; })},
+      {"stride shorter than a row",
+       Message(ndilb::EncodeVideo({.xres = 8, .yres = 4, .fourcc = kNdiFourCCUYVY, .line_stride = 8}, 0, 8 * 4))},
       {"impossible picture", spoilt([](auto& b) { b[24 + 3] = 0x80; })},  // negative width
       {"sound payload not channels x samples", audio(2, 2 * 10 * 4 + 4)},
       {"too many channels", audio(ndilb::kMaxAudioChannels + 1, (ndilb::kMaxAudioChannels + 1) * 10 * 4)},
