@@ -1,6 +1,6 @@
 // The loopback runtime's pieces that need no socket: the wire decoder, the
-// registry entry format, and what becomes of a picture (its size, the FourCC
-// and stride delivered, conversions and the proxy picture).
+// registry entry format, and what becomes of a picture (the FourCC and the
+// proxy size delivered, conversions, halving).
 #include <gtest/gtest.h>
 
 #include <tuple>
