@@ -130,14 +130,14 @@ class Loopback : public ::testing::Test {
 // own. Entries that are no entries are skipped; one gone long ago is removed
 // by the reader that finds it.
 TEST_F(Loopback, TheListingKeepsTheGoneForASecondAndEachNameOnce) {
+  const pid_t dead = fork();  // while this process has one thread
+  if (dead == 0) _exit(0);
+  siginfo_t info{};
+  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(dead), &info, WEXITED | WNOWAIT), 0);  // a zombie now
   Sender ended;
   ASSERT_TRUE(ended.Start(folder_, "Ended", {"--width", "16", "--height", "8", "--fps", "10"}));
   ended.Process().Signal(SIGTERM);
   ASSERT_EQ(ended.Process().Wait(kPatience), std::optional<int>(0)) << "SIGTERM ends the sender cleanly";
-  const pid_t dead = fork();
-  if (dead == 0) _exit(0);
-  siginfo_t info{};
-  ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(dead), &info, WEXITED | WNOWAIT), 0);  // a zombie now
   const std::string dir = ndilb::RegistryDir(), alive = std::to_string(getpid());
   const std::int64_t now = std::chrono::duration_cast<std::chrono::nanoseconds>(
                                std::chrono::system_clock::now().time_since_epoch()).count();
