@@ -29,7 +29,7 @@ class DiscoveryTest : public ::testing::Test {
 
   pmtest::LogCapture logs;
   nditest::ScriptedNdi ndi;
-  std::shared_ptr<nditest::FakeDiscoveryCallbacks> callbacks = std::make_shared<nditest::FakeDiscoveryCallbacks>();
+  std::shared_ptr<nditest::FakeCallbacks> callbacks = std::make_shared<nditest::FakeCallbacks>();
   nditest::TestEnvironment env;
   std::shared_ptr<Discovery> discovery = std::make_shared<Discovery>(callbacks, ndi.Api(), env.Make());
   int waits = 1;
@@ -76,13 +76,13 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
   for (const Script& script : scripts) {
     SCOPED_TRACE(script.name);
     logs.Clear();
-    auto calls = std::make_shared<nditest::FakeDiscoveryCallbacks>();
+    auto calls = std::make_shared<nditest::FakeCallbacks>();
     Discovery fresh(calls, ndi.Api(), env.Make());
     for (const std::vector<Entry>& scan : script.scans) {
       ndi.SetSources(scan);
       ASSERT_TRUE(fresh.ScanOnce(reinterpret_cast<void*>(0x10)));
     }
-    EXPECT_EQ(calls->Calls(), script.calls);
+    EXPECT_EQ(calls->Seen().calls, script.calls);
   }
   // Of the last script: one line for each announcement.
   EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: A (x) (10.0.0.1:1)\n"), 2);
@@ -102,7 +102,7 @@ TEST_F(DiscoveryTest, StopEndsAWaitAndARestartKeepsTheTableAndIsNotCutShortByAnE
   waits = 3;           // the first loop's two waits, then this loop's first
   EXPECT_EQ(env.clock->AwaitWait(waits), 125);
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 1u);  // still there: not announced again
+  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);  // still there: not announced again
   EXPECT_EQ(ndi.Seen().findersCreated, 2);
   EXPECT_EQ(ndi.Seen().maxLiveFinders, 1);
 }
@@ -115,7 +115,7 @@ TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Start();
   NextScan();
-  EXPECT_EQ(callbacks->Calls().size(), 1u);
+  EXPECT_EQ(callbacks->Seen().calls.size(), 1u);
 }
 
 TEST_F(DiscoveryTest, WithoutCallbacksTheTableIsKeptAndNothingAnnounced) {

@@ -19,7 +19,6 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <deque>
@@ -28,8 +27,8 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <sstream>
 #include <string>
-#include <type_traits>
 #include <vector>
 
 #include "pm/shm/formats.h"
@@ -77,15 +76,9 @@ inline std::shared_ptr<Capture> VideoCapture(std::uint32_t fourcc, int width, in
   for (std::size_t i = 0; i < size; ++i) {
     capture->bytes[i] = static_cast<std::uint8_t>(i / static_cast<std::size_t>(stride) * 7 + i % static_cast<std::size_t>(stride));
   }
-  capture->video.xres = width;
-  capture->video.yres = height;
-  capture->video.FourCC = fourcc;
-  capture->video.frame_rate_N = 30000;
-  capture->video.frame_rate_D = 1001;
-  capture->video.frame_format_type = progressive ? kNdiFrameFormatProgressive : kNdiFrameFormatInterleaved;
-  capture->video.data = size > 0 ? capture->bytes.data() : nullptr;
-  capture->video.line_stride_in_bytes = stride;
-  capture->video.timestamp = timestamp;
+  capture->video = {width, height, fourcc, 30000, 1001, 0.0f,
+                    progressive ? kNdiFrameFormatProgressive : kNdiFrameFormatInterleaved, 0,
+                    size > 0 ? capture->bytes.data() : nullptr, stride, nullptr, timestamp};
   return capture;
 }
 // The frame every state test delivers.
@@ -101,12 +94,8 @@ inline std::shared_ptr<Capture> AudioCapture(int rate, int channels, int samples
     const float value = static_cast<float>(i / static_cast<std::size_t>(samples) * 1000 + i % static_cast<std::size_t>(samples));
     std::memcpy(capture->bytes.data() + i * 4, &value, 4);
   }
-  capture->audio.sample_rate = rate;
-  capture->audio.no_channels = channels;
-  capture->audio.no_samples = samples;
-  capture->audio.data = count > 0 ? reinterpret_cast<float*>(capture->bytes.data()) : nullptr;
-  capture->audio.channel_stride_in_bytes = samples * 4;
-  capture->audio.timestamp = timestamp;
+  capture->audio = {rate, channels, samples, 0, count > 0 ? reinterpret_cast<float*>(capture->bytes.data()) : nullptr,
+                    samples * 4, nullptr, timestamp};
   return capture;
 }
 
@@ -128,6 +117,7 @@ struct ReceiverCreated {
   std::int32_t colorFormat = 0;
   std::int32_t bandwidth = 0;
   bool allowFields = true;
+  bool operator==(const ReceiverCreated&) const = default;
 };
 
 struct Entry {
@@ -145,12 +135,10 @@ struct Observed {
   int receiversDestroyed = 0;
   int connectionQueries = 0;
   std::vector<ndi_tally> tallies;
-  std::vector<std::string> metadataSent;  // texts without the terminating zero
-  std::vector<int> metadataLengths;       // the lengths passed
+  // Every send tried, as its text without the zero its length must count.
+  std::vector<std::string> metadataSent;
   std::vector<std::string> ptzCalls;      // "zoom(0.5)", "recall_preset(3,1)", ...
-  int captures = 0;
-  int queued = 0;            // captures pushed and not yet handed out
-  int frees[3] = {0, 0, 0};  // video, audio, metadata
+  int captures = 0;          // calls, with or without a frame to hand out
   bool freesMatched = true;  // every frame handed out was freed, each once
 };
 
@@ -161,15 +149,13 @@ class ScriptedNdi {
     if (Installed().exchange(this) != nullptr) std::abort();  // two at once
   }
   ~ScriptedNdi() { Installed().store(nullptr); }
-  ScriptedNdi(const ScriptedNdi&) = delete;
-  ScriptedNdi& operator=(const ScriptedNdi&) = delete;
 
-  // The table; every entry is filled.
+  // The table: every entry a source or a discovery calls (the library calls
+  // are the task's).
   std::shared_ptr<const TaskNDISource::NdiApi> Api() const;
   Observed Seen() {
     std::lock_guard<std::mutex> guard(mutex_);
     Observed seen = seen_;
-    seen.queued = static_cast<int>(queue_.size());
     seen.freesMatched = seen_.freesMatched && handedOut_.empty();
     return seen;
   }
@@ -197,10 +183,12 @@ class ScriptedNdi {
   // test ended aborts).
   template <typename Act>
   static auto Locked(Act act) {
-    ScriptedNdi* current = Installed().load();
-    if (current == nullptr) std::abort();
-    std::lock_guard<std::mutex> guard(current->mutex_);
-    return act(*current);
+    std::lock_guard<std::mutex> guard(Current().mutex_);
+    return act(Current());
+  }
+  static ScriptedNdi& Current() {
+    if (Installed().load() == nullptr) std::abort();
+    return *Installed().load();
   }
   template <typename Fn>
   void Edit(Fn edit) {
@@ -209,15 +197,38 @@ class ScriptedNdi {
     changed_.notify_all();
   }
   void* NewHandle() { return &handleSpace_[++handles_ % 64]; }
-  static std::int32_t Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata);
-  static void Free(int kind, const void* data) {
-    Locked([&](ScriptedNdi& n) {
-      ++n.seen_.frees[kind];
-      if (n.handedOut_.erase(data) != 1) n.seen_.freesMatched = false;
+  static std::int32_t Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata) {
+    ScriptedNdi& n = Current();
+    std::unique_lock<std::mutex> lock(n.mutex_);
+    ++n.seen_.captures;
+    n.changed_.notify_all();
+    n.changed_.wait(lock, [&] { return !n.block_; });
+    if (n.queue_.empty()) n.changed_.wait_for(lock, std::chrono::milliseconds(1), [&] { return !n.queue_.empty(); });
+    if (n.queue_.empty()) return kNdiFrameNone;
+    std::shared_ptr<nditest::Capture> capture = n.queue_.front();
+    n.queue_.pop_front();
+    const void* data = nullptr;
+    if (capture->type == kNdiFrameVideo) data = (*video = capture->video).data;
+    if (capture->type == kNdiFrameAudio) data = (*audio = capture->audio).data;
+    if (capture->type == kNdiFrameMetadata) data = (*metadata = capture->metadata).data;
+    if (data != nullptr) n.handedOut_[data] = capture;
+    return capture->type;
+  }
+  static void Free(const void* data) {
+    Locked([&](ScriptedNdi& n) { n.seen_.freesMatched &= n.handedOut_.erase(data) == 1; });
+  }
+  // Records "name(a,b)" as a PTZ call.
+  template <typename... Args>
+  static bool Ptz(const char* name, Args... args) {
+    std::ostringstream call;
+    call << name << '(';
+    [[maybe_unused]] const char* separator = "";
+    ((call << separator << args, separator = ","), ...);
+    return Locked([&](ScriptedNdi& n) {
+      n.seen_.ptzCalls.push_back(call.str() + ")");
+      return true;
     });
   }
-  template <typename... Args>
-  static bool Ptz(const char* name, Args... args);
 
   std::mutex mutex_;  // guards everything below
   std::condition_variable changed_;
@@ -250,13 +261,11 @@ class FakeVideoBuffer : public pm::VideoBuffer {
   // each, as the host buffer does, so reading past a short frame shows.
   void CopyFrame(const std::uint8_t* source, std::int32_t sourceStride) override {
     copiedStride = sourceStride;
-    for (std::int32_t r = 0; r < Rows(); ++r) {
-      std::memcpy(memory.data() + static_cast<std::ptrdiff_t>(r) * RowBytes(),
-                  source + static_cast<std::ptrdiff_t>(r) * sourceStride, static_cast<std::size_t>(RowBytes()));
+    const std::ptrdiff_t row = pm::DefaultStride(format_);
+    for (std::ptrdiff_t r = 0; r < std::ptrdiff_t{format_.height} * (format_.code == pm::kCodeNV12 ? 3 : 2) / 2; ++r) {
+      std::memcpy(memory.data() + r * row, source + r * sourceStride, static_cast<std::size_t>(row));
     }
   }
-  std::int32_t RowBytes() const { return pm::DefaultStride(format_); }
-  std::int32_t Rows() const { return format_.code == pm::kCodeNV12 ? format_.height + format_.height / 2 : format_.height; }
 
   pm::VideoFormat format_;
   std::vector<std::uint8_t> memory;
@@ -271,11 +280,6 @@ class FakeAudioBuffer : public pm::AudioBuffer {
   std::int32_t SampleCount() const override { return samples_; }
   void Fill(std::function<void(void*, std::int64_t)> fill) override { fill(memory.data(), ByteSize()); }
   std::int64_t ByteSize() const override { return static_cast<std::int64_t>(memory.size()); }
-  std::vector<float> Samples() const {
-    std::vector<float> samples(memory.size() / sizeof(float));
-    std::memcpy(samples.data(), memory.data(), samples.size() * sizeof(float));
-    return samples;
-  }
 
   pm::AudioFormat format_;
   std::int32_t samples_;
@@ -287,13 +291,12 @@ struct Heard {
   std::vector<std::string> calls;
   std::vector<std::int32_t> states;
   std::vector<std::string> guis;
-  std::vector<pm::VideoFormat> videoRequests;
-  std::vector<std::pair<pm::AudioFormat, std::int32_t>> audioRequests;
   std::vector<std::shared_ptr<FakeVideoBuffer>> videoSent;
   std::vector<std::shared_ptr<FakeAudioBuffer>> audioSent;
 };
 
-class FakeCallbacks : public pm::Source::Callbacks {
+// Also a discovery's callbacks, noting "+id name" and "-id".
+class FakeCallbacks : public pm::Source::Callbacks, public pm::SourceDiscovery::Callbacks {
   // Notes `call` (unless empty) and runs `with`, under the lock.
   template <typename With = void (*)(Heard&)>
   auto Note(const std::string& call, With with = [](Heard&) {}) {
@@ -308,18 +311,12 @@ class FakeCallbacks : public pm::Source::Callbacks {
   void UpdateMaximumLatencySeconds(double) override {}
   void SetFixedLatencySeconds(double) override {}
   std::shared_ptr<pm::VideoBuffer> RequestVideoBuffer(const pm::VideoFormat& format, std::uint32_t) override {
-    return Note("video request", [&](Heard& h) -> std::shared_ptr<pm::VideoBuffer> {
-      h.videoRequests.push_back(format);
-      if (videoDry_) return nullptr;
-      return std::make_shared<FakeVideoBuffer>(videoOverride_.value_or(format));
-    });
+    return Note("video request", [&](Heard&) { return std::make_shared<FakeVideoBuffer>(videoOverride_.value_or(format)); });
   }
   std::shared_ptr<pm::AudioBuffer> RequestAudioBuffer(const pm::AudioFormat& format, std::int32_t count) override {
-    return Note("audio request", [&](Heard& h) -> std::shared_ptr<pm::AudioBuffer> {
-      h.audioRequests.emplace_back(format, count);
-      if (audioDry_) return nullptr;
-      const std::int64_t bytes = audioBytes_ >= 0 ? audioBytes_ : std::int64_t{format.channels} * count * 4;
-      return std::make_shared<FakeAudioBuffer>(format, count, bytes);
+    return Note("audio request", [&](Heard&) -> std::shared_ptr<pm::AudioBuffer> {
+      if (audioBytes_ && *audioBytes_ < 0) return nullptr;
+      return std::make_shared<FakeAudioBuffer>(format, count, audioBytes_.value_or(std::int64_t{format.channels} * count * 4));
     });
   }
   void UpdateConfiguration(const std::string&) override {}
@@ -347,14 +344,11 @@ class FakeCallbacks : public pm::Source::Callbacks {
     Note("state " + std::to_string(state), [&](Heard& h) { h.states.push_back(state); });
   }
   void TriggerShutdown() override {}
+  void SourceAvailable(const pm::SourceInfo& info) override { Note("+" + info.uniqueId + " " + info.name); }
+  void SourceUnavailable(const std::string& uniqueId) override { Note("-" + uniqueId); }
 
-  // Script: no buffers; the next buffers of this format / this byte size.
-  void SetDry(bool video, bool audio) {
-    Note("", [&](Heard&) {
-      videoDry_ = video;
-      audioDry_ = audio;
-    });
-  }
+  // Script: the next video buffers of this format; audio buffers of this byte
+  // size (none when negative).
   void OverrideVideoFormat(const pm::VideoFormat& format) {
     Note("", [&](Heard&) { videoOverride_ = format; });
   }
@@ -372,79 +366,14 @@ class FakeCallbacks : public pm::Source::Callbacks {
  private:
   std::mutex mutex_;  // guards everything below
   Heard heard_;
-  bool videoDry_ = false;
-  bool audioDry_ = false;
   std::optional<pm::VideoFormat> videoOverride_;
-  std::int64_t audioBytes_ = -1;
-};
-
-// Discovery announcements in order ("+id name", "-id").
-class FakeDiscoveryCallbacks : public pm::SourceDiscovery::Callbacks {
- public:
-  void SourceAvailable(const pm::SourceInfo& info) override {
-    std::lock_guard<std::mutex> guard(mutex_);
-    calls_.push_back("+" + info.uniqueId + " " + info.name);
-  }
-  void SourceUnavailable(const std::string& uniqueId) override {
-    std::lock_guard<std::mutex> guard(mutex_);
-    calls_.push_back("-" + uniqueId);
-  }
-  std::vector<std::string> Calls() {
-    std::lock_guard<std::mutex> guard(mutex_);
-    return calls_;
-  }
- private:
-  std::mutex mutex_;  // guards calls_
-  std::vector<std::string> calls_;
+  std::optional<std::int64_t> audioBytes_;
 };
 
 // --- The table ---------------------------------------------------------------
 
-inline std::int32_t ScriptedNdi::Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio,
-                                         ndi_metadata_frame* metadata) {
-  ScriptedNdi* current = Installed().load();
-  if (current == nullptr) std::abort();
-  ScriptedNdi& n = *current;
-  std::unique_lock<std::mutex> lock(n.mutex_);
-  ++n.seen_.captures;
-  n.changed_.notify_all();
-  n.changed_.wait(lock, [&] { return !n.block_; });
-  if (n.queue_.empty()) n.changed_.wait_for(lock, std::chrono::milliseconds(1), [&] { return !n.queue_.empty(); });
-  if (n.queue_.empty()) return kNdiFrameNone;
-  std::shared_ptr<nditest::Capture> capture = n.queue_.front();
-  n.queue_.pop_front();
-  const void* data = nullptr;
-  if (capture->type == kNdiFrameVideo) data = (*video = capture->video).data;
-  if (capture->type == kNdiFrameAudio) data = (*audio = capture->audio).data;
-  if (capture->type == kNdiFrameMetadata) data = (*metadata = capture->metadata).data;
-  if (data != nullptr) n.handedOut_[data] = capture;
-  return capture->type;
-}
-
-// Records "name(a,b)" as a PTZ call.
-template <typename... Args>
-bool ScriptedNdi::Ptz(const char* name, Args... args) {
-  std::string call = std::string(name) + "(";
-  [[maybe_unused]] const char* separator = "";
-  [[maybe_unused]] const auto text = [](auto value) {
-    if constexpr (std::is_integral_v<decltype(value)>) return std::to_string(value);
-    char out[32];
-    std::snprintf(out, sizeof out, "%g", static_cast<double>(value));
-    return std::string(out);
-  };
-  ((call += separator + text(args), separator = ","), ...);
-  return Locked([&](ScriptedNdi& n) {
-    n.seen_.ptzCalls.push_back(call + ")");
-    return true;
-  });
-}
-
 inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   auto api = std::make_shared<TaskNDISource::NdiApi>();
-  api->is_supported_CPU = [] { return true; };
-  api->initialize = [] { return true; };
-  api->version = [] { return "scripted"; };
-  api->destroy = [] {};
   api->find_create_v2 = [](const ndi_find_create* settings) {
     return Locked([&](ScriptedNdi& n) -> void* {
       if (n.failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
@@ -481,9 +410,9 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   };
   api->recv_capture_v2 = [](void*, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
                             std::uint32_t) { return Take(v, a, m); };
-  api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Free(0, v->data); };
-  api->recv_free_audio_v2 = [](void*, const ndi_audio_frame_v2* a) { Free(1, a->data); };
-  api->recv_free_metadata = [](void*, const ndi_metadata_frame* m) { Free(2, m->data); };
+  api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Free(v->data); };
+  api->recv_free_audio_v2 = [](void*, const ndi_audio_frame_v2* a) { Free(a->data); };
+  api->recv_free_metadata = [](void*, const ndi_metadata_frame* m) { Free(m->data); };
   api->recv_set_tally = [](void*, const ndi_tally* t) {
     return Locked([&](ScriptedNdi& n) {
       n.seen_.tallies.push_back(*t);
@@ -492,8 +421,8 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   };
   api->recv_send_metadata = [](void*, const ndi_metadata_frame* m) {
     return Locked([&](ScriptedNdi& n) {
-      n.seen_.metadataLengths.push_back(m->length);
-      if (n.metadataOk_) n.seen_.metadataSent.emplace_back(m->data, m->length > 0 ? std::size_t(m->length) - 1 : 0);
+      const bool counted = m->length > 0 && m->data[m->length - 1] == '\0';
+      n.seen_.metadataSent.push_back(counted ? std::string(m->data, std::size_t(m->length) - 1) : "(length wrong)");
       return n.metadataOk_;
     });
   };
