@@ -146,9 +146,9 @@ class ScriptedNdi {
  public:
   // Installs this object as the one the table's functions act on.
   ScriptedNdi() {
-    if (Installed().exchange(this) != nullptr) std::abort();  // two at once
+    if (installed_.exchange(this) != nullptr) std::abort();  // two at once
   }
-  ~ScriptedNdi() { Installed().store(nullptr); }
+  ~ScriptedNdi() { installed_.store(nullptr); }
 
   // The table: every entry a source or a discovery calls (the library calls
   // are the task's).
@@ -175,10 +175,7 @@ class ScriptedNdi {
   void BlockCapture(bool block) { Edit([&] { block_ = block; }); }
 
  private:
-  static std::atomic<ScriptedNdi*>& Installed() {
-    static std::atomic<ScriptedNdi*> installed{nullptr};
-    return installed;
-  }
+  static inline std::atomic<ScriptedNdi*> installed_{nullptr};
   // Runs `act` on the installed object under its lock (a table used after its
   // test ended aborts).
   template <typename Act>
@@ -187,8 +184,8 @@ class ScriptedNdi {
     return act(Current());
   }
   static ScriptedNdi& Current() {
-    if (Installed().load() == nullptr) std::abort();
-    return *Installed().load();
+    if (installed_.load() == nullptr) std::abort();
+    return *installed_.load();
   }
   template <typename Fn>
   void Edit(Fn edit) {
@@ -349,16 +346,10 @@ class FakeCallbacks : public pm::Source::Callbacks, public pm::SourceDiscovery::
 
   // Script: the next video buffers of this format; audio buffers of this byte
   // size (none when negative).
-  void OverrideVideoFormat(const pm::VideoFormat& format) {
-    Note("", [&](Heard&) { videoOverride_ = format; });
-  }
-  void OverrideAudioBytes(std::int64_t bytes) {
-    Note("", [&](Heard&) { audioBytes_ = bytes; });
-  }
+  void OverrideVideoFormat(const pm::VideoFormat& format) { Note("", [&](Heard&) { videoOverride_ = format; }); }
+  void OverrideAudioBytes(std::int64_t bytes) { Note("", [&](Heard&) { audioBytes_ = bytes; }); }
 
-  Heard Seen() {
-    return Note("", [&](Heard& h) { return h; });
-  }
+  Heard Seen() { return Note("", [](Heard& h) { return h; }); }
   int Count(const std::string& call) {
     return Note("", [&](Heard& h) { return static_cast<int>(std::count(h.calls.begin(), h.calls.end(), call)); });
   }

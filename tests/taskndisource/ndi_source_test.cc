@@ -36,6 +36,12 @@ constexpr char kId[] = "NDICaptureDevice~STUDIO (Cam 1)";
 constexpr char kUrl[] = "127.0.0.1:5961";
 void* const kReceiver = reinterpret_cast<void*>(0x10);
 
+// A shot event as the sender gets it.
+std::string EventText(const std::string& value, char preview, char live) {
+  return "<skyrelay_ext>\n    <event value=\"" + value + "\" preview=\"" + preview + "\" live=\"" + live +
+         "\"/>\n</skyrelay_ext>\n";
+}
+
 // The sender is listed unless a test says otherwise.
 class NdiSource : public ::testing::Test {
  protected:
@@ -261,10 +267,8 @@ TEST_F(NdiSource, ShotEventsAreSentInOrderAndAnUnsentOneStaysFirst) {
   ndi.SetMetadataResult(true);
   source->SendShotEvents(kReceiver, queue);
   EXPECT_TRUE(queue.empty());
-  const std::string x = "<skyrelay_ext>\n    <event value=\"X\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
-  EXPECT_EQ(ndi.Seen().metadataSent, (Lines{x, x,
-                         "<skyrelay_ext>\n    <event value=\"a&quot;b&lt;&amp;&gt;\" preview=\"0\" live=\"1\"/>\n"
-                         "</skyrelay_ext>\n"}));
+  EXPECT_EQ(ndi.Seen().metadataSent,
+            (Lines{EventText("X", '1', '0'), EventText("X", '1', '0'), EventText("a&quot;b&lt;&amp;&gt;", '0', '1')}));
 }
 
 // Each command reaches its call with its parameters read leniently (defaults
@@ -362,12 +366,10 @@ TEST_F(NdiSource, MetadataFramesAreReadAsTheirXmlSaysWithinTheirLength) {
     NDISource one(fresh, kId, ndi.Api(), env.Make());
     logs.Clear();
     for (const Frame& f : c.frames) {
-      if (f.length == kWithZero) {
-        one.ProcessMetadataFrame(nditest::MetadataCapture(f.text)->metadata);
-        continue;
-      }
       std::vector<char> exact(f.text.begin(), f.text.end());
-      one.ProcessMetadataFrame(ndi_metadata_frame{f.length, 0, f.noData ? nullptr : exact.data()});
+      if (f.length == kWithZero) exact.push_back('\0');
+      const int length = f.length == kWithZero ? static_cast<int>(exact.size()) : f.length;
+      one.ProcessMetadataFrame(ndi_metadata_frame{length, 0, f.noData ? nullptr : exact.data()});
     }
     EXPECT_EQ(fresh->Seen().calls, c.calls);
     EXPECT_EQ(logs.Lines(), c.log);
@@ -403,10 +405,8 @@ TEST_F(NdiSource, ShotEventsWithStrayBlanksAreEventsAndCarryTheTally) {
   for (int i = 0; i < 3; ++i) ndi.Push(AnyVideo());
   Until([&] { return ndi.Seen().metadataSent.size() >= 5; });
   const auto sent = ndi.Seen().metadataSent;
-  const auto event = [](const std::string& name) {
-    return "<skyrelay_ext>\n    <event value=\"" + name + "\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n";
-  };
-  EXPECT_EQ(Lines(sent.begin() + 2, sent.end()), (Lines{event(" TALLY_LIVE_ON"), event("TALLY_LIVE_ON "), event("Cut")}));
+  EXPECT_EQ(Lines(sent.begin() + 2, sent.end()),
+            (Lines{EventText(" TALLY_LIVE_ON", '1', '0'), EventText("TALLY_LIVE_ON ", '1', '0'), EventText("Cut", '1', '0')}));
   Until([&] { return !ndi.Seen().tallies.empty() && ndi.Seen().tallies.back().on_preview; });
   EXPECT_FALSE(ndi.Seen().tallies.back().on_program);
 }
@@ -637,7 +637,6 @@ struct ListedCase {
   const char* madeAgainFor;   // null: the receiver stays
   std::vector<std::int32_t> states;
 };
-void PrintTo(const ListedCase& c, std::ostream* os) { *os << c.what; }
 
 class ListedUrl : public NdiSource, public ::testing::WithParamInterface<ListedCase> {};
 

@@ -234,7 +234,6 @@ TEST(Popup, IndexValidationSelectionAndReading) {
   } cases[] = {
       {{"a", "b", "c"}, 3, kValidate, "", 0, "a"},
       {{"a", "b", "c"}, INT64_MIN, kValidate, "", 0, "a"},
-      {{"a", "b", "c"}, 2, kValidate, "", 2, "c"},
       {{"a", "b", "c"}, 3, kSelect, "b", 1, "b"},
       {{"a", "b", "c"}, 1, kSelect, "B", 1, "b"},
       {{"a", "b", "c"}, 3, kSelect, "x", 3, ""},
