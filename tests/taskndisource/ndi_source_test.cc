@@ -490,7 +490,6 @@ TEST_F(NdiSource, StatusPanelIsExact) {
 TEST_F(NdiSource, PanelAndConfigurationTranslateBothWays) {
   const std::pair<const char*, const char*> cases[] = {
       {R"({"bandwidth":{"value":0}})", "ndi_bandwidth_highest"},
-      {R"({"bandwidth":{"value":1}})", "ndi_bandwidth_lowest"},
       {R"({"bandwidth":{"value":2}})", "ndi_bandwidth_audio_only"},
       {R"({"bandwidth":{"value":"1"}})", "ndi_bandwidth_lowest"},
       {R"({"bandwidth":{"value":9}})", "ndi_bandwidth_highest"},
