@@ -24,11 +24,6 @@ namespace pmtest {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-const Programs& BuiltPrograms() {
-  static const Programs programs{PM_RUNNER_PATH, PM_MODULE_PATH, PM_TESTSRC_PATH, PM_HOST_PATH};
-  return programs;
-}
-
 Folder::Folder() {
   std::string pattern = ::testing::TempDir() + "pm-e2e-XXXXXX";
   if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
@@ -46,7 +41,7 @@ std::string Folder::ReadRunnerLog() const {
 
 bool Sender::Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
   pmhost::ChildOptions o;
-  o.path = BuiltPrograms().testsrc;
+  o.path = PM_TESTSRC_PATH;
   o.args = {"--name", name};
   // Two minutes unless the caller says how long.
   if (std::find(args.begin(), args.end(), "--seconds") == args.end() &&
@@ -80,8 +75,8 @@ bool Sender::WaitFor(const std::string& kind, const std::function<bool(const jso
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
   pmhost::HostOptions o;
-  o.runnerPath = BuiltPrograms().runner;
-  o.modulePath = BuiltPrograms().module;
+  o.runnerPath = PM_RUNNER_PATH;
+  o.modulePath = PM_MODULE_PATH;
   o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
   o.runnerLog = folder.RunnerLog();
   return o;
@@ -177,12 +172,6 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
     if (line.rfind("RssAnon:", 0) == 0) usage.privateKiB = std::atol(line.c_str() + 8);
   }
   return usage;
-}
-
-int Occurrences(const std::string& text, const std::string& what) {
-  int n = 0;
-  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
-  return n;
 }
 
 std::optional<ProcessUsage> LevelOf(pid_t pid) {

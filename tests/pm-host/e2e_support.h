@@ -28,6 +28,7 @@
 #include "pm-host/queue_reader.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/json.h"
+#include "support/runner_child.h"  // Occurrences
 #include "support/wait.h"
 
 namespace pmtest {
@@ -38,14 +39,8 @@ namespace pmtest {
 // processes and move pictures many times slower than a quiet optimised one.
 inline constexpr std::chrono::seconds kPatience{30};
 
-// The programs under test; set from the build (see pm_e2e_support).
-struct Programs {
-  std::string runner;
-  std::string module;
-  std::string testsrc;
-  std::string host;  // the pm-host program
-};
-const Programs& BuiltPrograms();
+// The programs under test come from the build: PM_RUNNER_PATH,
+// PM_MODULE_PATH, PM_TESTSRC_PATH and PM_HOST_PATH (see pm_e2e_support).
 
 // A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs; both
 // removed with the object.
@@ -95,11 +90,7 @@ class Sender {
 // Lock: lock_ guards every field below it; nothing is called under it.
 class RampSink : public pmhost::FrameSink {
  public:
-  struct Size {
-    int width = 0;
-    int height = 0;
-    bool operator==(const Size&) const = default;
-  };
+  using Size = std::pair<int, int>;  // width, height
 
   explicit RampSink(bool ramp = true) : ramp_(ramp) {}
 
@@ -206,8 +197,6 @@ class RampSink : public pmhost::FrameSink {
   std::vector<int> channels_;
   std::vector<std::string> problems_;
 };
-
-inline void PrintTo(const RampSink::Size& s, std::ostream* os) { *os << s.width << "x" << s.height; }
 
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
@@ -376,9 +365,6 @@ class OwnLevelKept : public ::testing::Test {
  private:
   std::optional<ProcessUsage> own_;
 };
-
-// How often `what` occurs in `text`.
-int Occurrences(const std::string& text, const std::string& what);
 
 // The /dev/shm entries a live process has mapped (names without the folder,
 // each once), from /proc/PID/maps; entries already unlinked are included.
