@@ -288,15 +288,19 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreRecei
   const std::optional<ProcessUsage> idle = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(idle);
   for (const std::string& id : ids) ASSERT_TRUE(c.Session().StartSource(id, json::object()));
-  auto allReceivingSince = [&](const std::vector<std::size_t>& marks, const std::vector<int>& videos) {
+  std::vector<std::size_t> marks(kSenders, 0);  // reports before this round
+  std::vector<int> videos(kSenders, 0);         // pictures before this round
+  // Every source reported `state` since its mark (and, for 2, has pictures
+  // since then).
+  auto allReportedSince = [&](int state) {
     for (int i = 0; i < kSenders; ++i) {
-      if (!c.reports.ReportedSince(ids[i], marks[i], 2) || c.sink.Videos(ids[i]) <= videos[i]) return false;
+      if (!c.reports.ReportedSince(ids[i], marks[i], state) || (state == 2 && c.sink.Videos(ids[i]) <= videos[i])) {
+        return false;
+      }
     }
     return true;
   };
-  std::vector<std::size_t> marks(kSenders, 0);
-  std::vector<int> videos(kSenders, 0);
-  ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience)) << c.Log();
+  ASSERT_TRUE(pmtest::WaitFor([&] { return allReportedSince(2); }, kPatience)) << c.Log();
   const std::optional<ProcessUsage> level = LevelOf(c.Runner());
   ASSERT_TRUE(level);
 
@@ -310,12 +314,8 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreRecei
       sender->Process().Signal(SIGKILL);
     }
     for (auto& sender : senders) ASSERT_TRUE(sender->Process().Wait(kPatience).has_value());
-    ASSERT_TRUE(pmtest::WaitFor([&] {
-      for (int i = 0; i < kSenders; ++i) {
-        if (!c.reports.ReportedSince(ids[i], marks[i], 3)) return false;
-      }
-      return true;
-    }, kPatience)) << "a source did not notice its sender's end";
+    ASSERT_TRUE(pmtest::WaitFor([&] { return allReportedSince(3); }, kPatience))
+        << "a source did not notice its sender's end";
 
     // Every sender gone, every source idle: the runner must sleep.
     const double cpuBefore = pm::ProcessCpuSeconds(c.Runner());
@@ -333,7 +333,7 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreRecei
       ASSERT_TRUE(senders[i]->Start(c.folder, name(i), args));
     }
     // A picture may overtake the report it came with.
-    ASSERT_TRUE(pmtest::WaitFor([&] { return allReceivingSince(marks, videos); }, kPatience))
+    ASSERT_TRUE(pmtest::WaitFor([&] { return allReportedSince(2); }, kPatience))
         << "not every source came back\n" << c.Log();
     for (int i = 0; i < kSenders; ++i) {
       const std::vector<int> all = c.reports.States(ids[i]);

@@ -122,7 +122,6 @@ INSTANTIATE_TEST_SUITE_P(
         Case{"HostHelp", PM_HOST_PATH, {"--help"}, 0, "2 a usage error"},
         Case{"ReceiveHelp", PM_HOST_PATH, {"receive", "--help"}, 0, "=highest"},
         Case{"RunnerHelp", PM_RUNNER_PATH, {"--help"}, 0, "--connect"},
-        Case{"TestsrcHelp", PM_TESTSRC_PATH, {"--help"}, 0, "=1280"},
         // Usage errors: 2 from every program, nothing on standard output.
         Case{"HostWithoutCommand", PM_HOST_PATH, {}, 2, "", "subcommand is required"},
         Case{"HostSecondsAndFrames", PM_HOST_PATH, {"receive", "x", "--seconds", "1", "--frames", "1"}, 2, ""},

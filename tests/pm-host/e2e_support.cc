@@ -24,16 +24,6 @@ namespace pmtest {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-Folder::Folder() {
-  std::string pattern = ::testing::TempDir() + "pm-e2e-XXXXXX";
-  if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
-}
-
-Folder::~Folder() {
-  std::error_code ignored;
-  if (!path.empty()) std::filesystem::remove_all(path, ignored);
-}
-
 std::string Folder::ReadRunnerLog() const {
   std::ifstream in(RunnerLog());
   return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
@@ -121,10 +111,6 @@ void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
   });
   std::mutex lock;  // guards widths
   std::vector<int> widths;
-  auto count = [&](auto match) {
-    std::lock_guard<std::mutex> guard(lock);
-    return std::count_if(widths.begin(), widths.end(), match);
-  };
   std::atomic<bool> stop{false};
   pmhost::ReceiveOptions o = ReceiveFrom(folder, id);
   o.seconds = 120;
@@ -134,7 +120,10 @@ void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
     widths.push_back(frame.width);
   };
   o.whileReceiving = [&](pmhost::Session&, const std::string&) {
-    pmtest::WaitFor([&] { return count([](int w) { return w == kOwnWidth; }) >= 10; }, kPatience);
+    pmtest::WaitFor([&] {
+      std::lock_guard<std::mutex> guard(lock);
+      return std::count(widths.begin(), widths.end(), kOwnWidth) >= 10;
+    }, kPatience);
     stop = true;
   };
   const pmhost::ReceiveResult result = pmhost::Receive(o);

@@ -14,6 +14,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <thread>
 #include <utility>
@@ -45,14 +46,11 @@ inline constexpr std::chrono::seconds kPatience{30};
 // A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs; both
 // removed with the object.
 struct Folder {
-  Folder();
-  ~Folder();
-  Folder(const Folder&) = delete;
-  Folder& operator=(const Folder&) = delete;
   std::string Registry() const { return path + "/registry"; }
   std::string RunnerLog() const { return path + "/runner.log"; }
   std::string ReadRunnerLog() const;
-  std::string path;
+  const pmtest::Registry made;  // made now, removed with the object
+  const std::string path = made.path;
   // When not 0, senders started in it take the lowest free port from this
   // one (NDI_LOOPBACK_FIRST_PORT), as the vendor runtime's do from 5961.
   int firstPort = 0;
@@ -126,7 +124,7 @@ class RampSink : public pmhost::FrameSink {
       Problem("sound continues at " + std::to_string(first) + " instead of " + std::to_string(s.nextSample % 1024));
     }
     s.nextSample = first + frame.samples;
-    channels_.push_back(frame.channels);
+    channels_.insert(frame.channels);
   }
 
   void OnBadRecord(const std::string&, const std::string& reason) override {
@@ -164,7 +162,8 @@ class RampSink : public pmhost::FrameSink {
     std::lock_guard<std::mutex> guard(lock_);
     return sizes_;
   }
-  std::vector<int> Channels() const {
+  // The channel counts of the sound seen.
+  std::set<int> Channels() const {
     std::lock_guard<std::mutex> guard(lock_);
     return channels_;
   }
@@ -194,7 +193,7 @@ class RampSink : public pmhost::FrameSink {
   int holding_ = 0;
   std::map<std::string, Stream> streams_;
   std::vector<std::pair<Size, int>> sizes_;
-  std::vector<int> channels_;
+  std::set<int> channels_;
   std::vector<std::string> problems_;
 };
 
