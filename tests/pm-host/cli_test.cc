@@ -8,7 +8,6 @@
 #include <sys/stat.h>
 
 #include <fstream>
-#include <mutex>
 
 #include "e2e_support.h"
 
@@ -53,13 +52,11 @@ Output RunProgram(const std::string& path, const std::vector<std::string>& args,
   return result;
 }
 
-enum class Program { Host, Runner, Testsrc };
-
 struct Case {
   const char* name;
-  Program program;
-  // {runner} {module} {folder} {sender} {dying-runner} stand for paths and
-  // the running sender's name.
+  const char* program;  // its path
+  // {folder} {sender} {dying-runner} stand for paths and the running
+  // sender's name.
   std::vector<std::string> args;
   int status;
   const char* out;  // nullptr: not checked; "": nothing; else a text it holds
@@ -74,7 +71,6 @@ class CommandLine : public ::testing::TestWithParam<Case> {};
 
 TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   const Case& c = GetParam();
-  const pmtest::Programs& programs = pmtest::BuiltPrograms();
   pmtest::Folder folder;
   pmtest::Sender sender;
   if (c.sender) {
@@ -84,22 +80,18 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   // discovery for the host.
   std::ofstream(folder.path + "/not-a-module.so") << "text";
   const std::string dying = folder.path + "/dying-runner";
-  std::ofstream(dying) << "#!/bin/sh\n\"" << programs.runner << "\" \"$@\" 2>\"$0.log\" &\npid=$!\n"
+  std::ofstream(dying) << "#!/bin/sh\n\"" << PM_RUNNER_PATH << "\" \"$@\" 2>\"$0.log\" &\npid=$!\n"
                        << "until grep -q 'creating discovery' \"$0.log\"; do sleep 0.05; done\n"
                        << "kill -9 $pid\nwait $pid\n";
   ::chmod(dying.c_str(), 0755);
 
   std::vector<std::string> args;
   for (std::string arg : c.args) {
-    arg = Replace(arg, "{runner}", programs.runner);
-    arg = Replace(arg, "{module}", programs.module);
     arg = Replace(arg, "{folder}", folder.path);
     arg = Replace(arg, "{dying-runner}", dying);
     args.push_back(Replace(arg, "{sender}", c.sender ? sender.Name() : ""));
   }
-  const std::string& path =
-      c.program == Program::Host ? programs.host : c.program == Program::Runner ? programs.runner : programs.testsrc;
-  const Output run = RunProgram(path, args, folder);
+  const Output run = RunProgram(c.program, args, folder);
   EXPECT_EQ(run.status, c.status) << run.err;
   if (c.out != nullptr) {
     EXPECT_TRUE(*c.out == '\0' ? run.out.empty() : run.out.find(c.out) != std::string::npos) << run.out;
@@ -113,7 +105,7 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   }
 }
 
-const std::vector<std::string> kHostOptions{"--runner", "{runner}", "--module", "{module}",
+const std::vector<std::string> kHostOptions{"--runner", PM_RUNNER_PATH, "--module", PM_MODULE_PATH,
                                             "--runner-log", "{folder}/runner.log"};
 
 std::vector<std::string> Join(std::vector<std::string> a, const std::vector<std::string>& b) {
@@ -126,38 +118,37 @@ INSTANTIATE_TEST_SUITE_P(
     ::testing::Values(
         // --version and --help end with 0 and print to standard output; help
         // shows the defaults. (Every program's come from the same parser.)
-        Case{"HostVersion", Program::Host, {"--version"}, 0, "pm-host "},
-        Case{"HostHelp", Program::Host, {"--help"}, 0, "2 a usage error"},
-        Case{"ReceiveHelp", Program::Host, {"receive", "--help"}, 0, "=highest"},
-        Case{"RunnerHelp", Program::Runner, {"--help"}, 0, "--connect"},
-        Case{"TestsrcHelp", Program::Testsrc, {"--help"}, 0, "=1280"},
+        Case{"HostVersion", PM_HOST_PATH, {"--version"}, 0, "pm-host "},
+        Case{"HostHelp", PM_HOST_PATH, {"--help"}, 0, "2 a usage error"},
+        Case{"ReceiveHelp", PM_HOST_PATH, {"receive", "--help"}, 0, "=highest"},
+        Case{"RunnerHelp", PM_RUNNER_PATH, {"--help"}, 0, "--connect"},
         // Usage errors: 2 from every program, nothing on standard output.
-        Case{"HostWithoutCommand", Program::Host, {}, 2, "", "subcommand is required"},
-        Case{"HostSecondsAndFrames", Program::Host, {"receive", "x", "--seconds", "1", "--frames", "1"}, 2, ""},
-        Case{"HostRunnerAfterCommandMissing", Program::Host, {"receive", "x", "--runner", "{folder}/none"}, 2, "",
+        Case{"HostWithoutCommand", PM_HOST_PATH, {}, 2, "", "subcommand is required"},
+        Case{"HostSecondsAndFrames", PM_HOST_PATH, {"receive", "x", "--seconds", "1", "--frames", "1"}, 2, ""},
+        Case{"HostRunnerAfterCommandMissing", PM_HOST_PATH, {"receive", "x", "--runner", "{folder}/none"}, 2, "",
              "--runner"},
-        Case{"HostBadPtz", Program::Host, {"receive", "x", "--ptz", "[1]"}, 2, "", "not a JSON object"},
-        Case{"RunnerWithoutConnect", Program::Runner, {"--module", "{module}"}, 2, ""},
-        Case{"RunnerModuleMissing", Program::Runner, {"--module", "{folder}/none.so", "--connect", "1"}, 2, ""},
-        Case{"TestsrcWithoutName", Program::Testsrc, {"--width", "64"}, 2, "", "--name"},
+        Case{"HostBadPtz", PM_HOST_PATH, {"receive", "x", "--ptz", "[1]"}, 2, "", "not a JSON object"},
+        Case{"RunnerWithoutConnect", PM_RUNNER_PATH, {"--module", PM_MODULE_PATH}, 2, ""},
+        Case{"RunnerModuleMissing", PM_RUNNER_PATH, {"--module", "{folder}/none.so", "--connect", "1"}, 2, ""},
+        Case{"TestsrcWithoutName", PM_TESTSRC_PATH, {"--width", "64"}, 2, "", "--name"},
         // Jobs that fail.
-        Case{"RunnerModuleCannotRun", Program::Runner, {"--module", "{folder}/not-a-module.so", "--connect", "1"}, 3,
+        Case{"RunnerModuleCannotRun", PM_RUNNER_PATH, {"--module", "{folder}/not-a-module.so", "--connect", "1"}, 3,
              "", "cannot load"},
-        Case{"ReceiveWavCannotBeWritten", Program::Host,
+        Case{"ReceiveWavCannotBeWritten", PM_HOST_PATH,
              Join({"receive", "{sender}", "--seconds", "1", "--wav", "{folder}/none/x.wav"}, kHostOptions), 1, "",
              "cannot write", true},
-        Case{"ListRunnerDies", Program::Host, {"list", "--seconds", "60", "--runner", "{dying-runner}"}, 1, nullptr,
+        Case{"ListRunnerDies", PM_HOST_PATH, {"list", "--seconds", "60", "--runner", "{dying-runner}"}, 1, nullptr,
              "during the run"},
-        Case{"ReceiveNoSuchSource", Program::Host, Join({"receive", "nobody", "--seconds", "1"}, kHostOptions), 1,
+        Case{"ReceiveNoSuchSource", PM_HOST_PATH, Join({"receive", "nobody", "--seconds", "1"}, kHostOptions), 1,
              "", "no source matches"},
         // The host options before and after the command.
-        Case{"ListOptionsAfter", Program::Host, Join({"list", "--seconds", "1"}, kHostOptions), 0, "+ ", "", true},
-        Case{"ListOptionsBefore", Program::Host, Join(kHostOptions, {"list", "--seconds", "1"}), 0, "+ ", "", true},
+        Case{"ListOptionsAfter", PM_HOST_PATH, Join({"list", "--seconds", "1"}, kHostOptions), 0, "+ ", "", true},
+        Case{"ListOptionsBefore", PM_HOST_PATH, Join(kHostOptions, {"list", "--seconds", "1"}), 0, "+ ", "", true},
         // The demo: its pictures and sound intact, and its snapshot showing
         // the bars (it reads its PNG back), found in the build tree.
-        Case{"Demo", Program::Host, {"demo", "--json", "--png", "{folder}/demo.png"}, 0, "\"passed\":true",
+        Case{"Demo", PM_HOST_PATH, {"demo", "--json", "--png", "{folder}/demo.png"}, 0, "\"passed\":true",
              "frames arrived intact"},
-        Case{"ReceiveJson", Program::Host,
+        Case{"ReceiveJson", PM_HOST_PATH,
              Join({"receive", "{sender}", "--frames", "10", "--json", "--wav", "{folder}/x.wav"}, kHostOptions), 0,
              "\"frames\"", "", true, true}),
     [](const ::testing::TestParamInfo<Case>& info) { return std::string(info.param.name); });

@@ -24,21 +24,6 @@ namespace pmtest {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-const Programs& BuiltPrograms() {
-  static const Programs programs{PM_RUNNER_PATH, PM_MODULE_PATH, PM_TESTSRC_PATH, PM_HOST_PATH};
-  return programs;
-}
-
-Folder::Folder() {
-  std::string pattern = ::testing::TempDir() + "pm-e2e-XXXXXX";
-  if (::mkdtemp(pattern.data()) != nullptr) path = pattern;
-}
-
-Folder::~Folder() {
-  std::error_code ignored;
-  if (!path.empty()) std::filesystem::remove_all(path, ignored);
-}
-
 std::string Folder::ReadRunnerLog() const {
   std::ifstream in(RunnerLog());
   return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
@@ -46,7 +31,7 @@ std::string Folder::ReadRunnerLog() const {
 
 bool Sender::Start(const Folder& folder, const std::string& name, std::vector<std::string> args) {
   pmhost::ChildOptions o;
-  o.path = BuiltPrograms().testsrc;
+  o.path = PM_TESTSRC_PATH;
   o.args = {"--name", name};
   // Two minutes unless the caller says how long.
   if (std::find(args.begin(), args.end(), "--seconds") == args.end() &&
@@ -80,8 +65,8 @@ bool Sender::WaitFor(const std::string& kind, const std::function<bool(const jso
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
   pmhost::HostOptions o;
-  o.runnerPath = BuiltPrograms().runner;
-  o.modulePath = BuiltPrograms().module;
+  o.runnerPath = PM_RUNNER_PATH;
+  o.modulePath = PM_MODULE_PATH;
   o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
   o.runnerLog = folder.RunnerLog();
   return o;
@@ -126,10 +111,6 @@ void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
   });
   std::mutex lock;  // guards widths
   std::vector<int> widths;
-  auto count = [&](auto match) {
-    std::lock_guard<std::mutex> guard(lock);
-    return std::count_if(widths.begin(), widths.end(), match);
-  };
   std::atomic<bool> stop{false};
   pmhost::ReceiveOptions o = ReceiveFrom(folder, id);
   o.seconds = 120;
@@ -139,7 +120,10 @@ void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
     widths.push_back(frame.width);
   };
   o.whileReceiving = [&](pmhost::Session&, const std::string&) {
-    pmtest::WaitFor([&] { return count([](int w) { return w == kOwnWidth; }) >= 10; }, kPatience);
+    pmtest::WaitFor([&] {
+      std::lock_guard<std::mutex> guard(lock);
+      return std::count(widths.begin(), widths.end(), kOwnWidth) >= 10;
+    }, kPatience);
     stop = true;
   };
   const pmhost::ReceiveResult result = pmhost::Receive(o);
@@ -177,12 +161,6 @@ std::optional<ProcessUsage> UsageOf(pid_t pid) {
     if (line.rfind("RssAnon:", 0) == 0) usage.privateKiB = std::atol(line.c_str() + 8);
   }
   return usage;
-}
-
-int Occurrences(const std::string& text, const std::string& what) {
-  int n = 0;
-  for (auto at = text.find(what); at != std::string::npos; at = text.find(what, at + what.size())) ++n;
-  return n;
 }
 
 std::optional<ProcessUsage> LevelOf(pid_t pid) {

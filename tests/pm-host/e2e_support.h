@@ -14,6 +14,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <thread>
 #include <utility>
@@ -28,6 +29,7 @@
 #include "pm-host/queue_reader.h"
 #include "pm-host/receive.h"
 #include "pm/runtime/json.h"
+#include "support/runner_child.h"  // Occurrences
 #include "support/wait.h"
 
 namespace pmtest {
@@ -38,26 +40,17 @@ namespace pmtest {
 // processes and move pictures many times slower than a quiet optimised one.
 inline constexpr std::chrono::seconds kPatience{30};
 
-// The programs under test; set from the build (see pm_e2e_support).
-struct Programs {
-  std::string runner;
-  std::string module;
-  std::string testsrc;
-  std::string host;  // the pm-host program
-};
-const Programs& BuiltPrograms();
+// The programs under test come from the build: PM_RUNNER_PATH,
+// PM_MODULE_PATH, PM_TESTSRC_PATH and PM_HOST_PATH (see pm_e2e_support).
 
 // A private registry folder (NDI_LOOPBACK_DIR) and a folder for logs; both
 // removed with the object.
 struct Folder {
-  Folder();
-  ~Folder();
-  Folder(const Folder&) = delete;
-  Folder& operator=(const Folder&) = delete;
   std::string Registry() const { return path + "/registry"; }
   std::string RunnerLog() const { return path + "/runner.log"; }
   std::string ReadRunnerLog() const;
-  std::string path;
+  const pmtest::Registry made;  // made now, removed with the object
+  const std::string path = made.path;
   // When not 0, senders started in it take the lowest free port from this
   // one (NDI_LOOPBACK_FIRST_PORT), as the vendor runtime's do from 5961.
   int firstPort = 0;
@@ -95,11 +88,7 @@ class Sender {
 // Lock: lock_ guards every field below it; nothing is called under it.
 class RampSink : public pmhost::FrameSink {
  public:
-  struct Size {
-    int width = 0;
-    int height = 0;
-    bool operator==(const Size&) const = default;
-  };
+  using Size = std::pair<int, int>;  // width, height
 
   explicit RampSink(bool ramp = true) : ramp_(ramp) {}
 
@@ -135,7 +124,7 @@ class RampSink : public pmhost::FrameSink {
       Problem("sound continues at " + std::to_string(first) + " instead of " + std::to_string(s.nextSample % 1024));
     }
     s.nextSample = first + frame.samples;
-    channels_.push_back(frame.channels);
+    channels_.insert(frame.channels);
   }
 
   void OnBadRecord(const std::string&, const std::string& reason) override {
@@ -173,7 +162,8 @@ class RampSink : public pmhost::FrameSink {
     std::lock_guard<std::mutex> guard(lock_);
     return sizes_;
   }
-  std::vector<int> Channels() const {
+  // The channel counts of the sound seen.
+  std::set<int> Channels() const {
     std::lock_guard<std::mutex> guard(lock_);
     return channels_;
   }
@@ -203,11 +193,9 @@ class RampSink : public pmhost::FrameSink {
   int holding_ = 0;
   std::map<std::string, Stream> streams_;
   std::vector<std::pair<Size, int>> sizes_;
-  std::vector<int> channels_;
+  std::set<int> channels_;
   std::vector<std::string> problems_;
 };
-
-inline void PrintTo(const RampSink::Size& s, std::ostream* os) { *os << s.width << "x" << s.height; }
 
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
@@ -376,9 +364,6 @@ class OwnLevelKept : public ::testing::Test {
  private:
   std::optional<ProcessUsage> own_;
 };
-
-// How often `what` occurs in `text`.
-int Occurrences(const std::string& text, const std::string& what);
 
 // The /dev/shm entries a live process has mapped (names without the folder,
 // each once), from /proc/PID/maps; entries already unlinked are included.

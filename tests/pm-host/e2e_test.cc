@@ -13,7 +13,6 @@
 #include <unistd.h>
 
 #include "e2e_support.h"
-#include "support/wait.h"
 
 namespace {
 

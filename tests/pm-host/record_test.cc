@@ -35,22 +35,14 @@ Wire Sealed(std::uint32_t token, std::uint64_t size, std::uint32_t stride, const
 
 Wire Video(std::uint32_t token, std::uint64_t size, std::uint32_t stride, std::uint32_t code, std::int16_t width,
            std::int16_t height) {
-  pm::VideoPayload p;
-  p.mediaTime = 123456789;
-  p.format.code = code;
-  p.format.width = width;
-  p.format.height = height;
-  p.format.scan = pm::kScanProgressive;
+  const pm::VideoPayload p{
+      .mediaTime = 123456789, .format = {.code = code, .width = width, .height = height, .scan = pm::kScanProgressive}};
   return Sealed(token, size, stride, &p, sizeof p);
 }
 
 Wire Audio(std::uint32_t token, std::uint64_t size, std::uint32_t code, std::int32_t samples, std::uint32_t rate,
            std::uint8_t channels) {
-  pm::AudioPayload p;
-  p.code = code;
-  p.samples = samples;
-  p.sampleRate = rate;
-  p.channels = channels;
+  const pm::AudioPayload p{.code = code, .samples = samples, .sampleRate = rate, .channels = channels};
   return Sealed(token, size, 1, &p, sizeof p);
 }
 

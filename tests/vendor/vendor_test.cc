@@ -196,15 +196,13 @@ TEST_F(Vendor, TallyMetadataShotEventsAndPtzGoBothWaysExactlyAndAudioOnlyBringsN
   o.ptz = {json{{"command", "Zoom"}, {"zoom", 0.5}}, json{{"command", "PanTilt"}, {"pan", 0.25}, {"tilt", -0.5}}};
   const pmhost::ReceiveResult result = pmhost::Receive(o);
   pmtest::ExpectOrderlyEnd(result, Place());
-  auto metadata = [](const std::string& xml) {
-    return [xml](const json& e) { return e.value("xml", "") == xml; };
-  };
-  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<metadata>\n    <receiver_info name=\"Skyrelay\" vendor=\"Quillfront LLC\" "
-                                                 "protocol_version=\"1\"/>\n</metadata>\n")));
-  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<metadata>\n    <media_settings width=\"1280\" height=\"720\" "
-                                                 "framerate=\"1\"/>\n</metadata>\n")));
-  EXPECT_TRUE(Cam().WaitFor("metadata", metadata("<skyrelay_ext>\n    <event value=\"Vendor shot\" preview=\"1\" "
-                                                 "live=\"0\"/>\n</skyrelay_ext>\n")));
+  for (const char* xml :
+       {"<metadata>\n    <receiver_info name=\"Skyrelay\" vendor=\"Quillfront LLC\" protocol_version=\"1\"/>\n"
+        "</metadata>\n",
+        "<metadata>\n    <media_settings width=\"1280\" height=\"720\" framerate=\"1\"/>\n</metadata>\n",
+        "<skyrelay_ext>\n    <event value=\"Vendor shot\" preview=\"1\" live=\"0\"/>\n</skyrelay_ext>\n"}) {
+    EXPECT_TRUE(Cam().WaitFor("metadata", [xml](const json& e) { return e.value("xml", "") == xml; })) << xml;
+  }
   EXPECT_TRUE(Cam().WaitFor("tally", [](const json& e) { return e.value("preview", false) && !e.value("program", true); }));
   EXPECT_TRUE(Cam().WaitFor("ptz", [](const json& e) {
     return e.value("command", "") == "zoom" && e["values"].value("zoom", 0.0) == 0.5;
