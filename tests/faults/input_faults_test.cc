@@ -17,12 +17,19 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
 
 #include "e2e_support.h"
 #include "pm/shm/queue_record.h"
+#include "pm-host/queue_reader.h"
 #include "pm/ipc/connection.h"
 #include "support/host_link.h"
 #include "support/host_socket.h"
+#include "support/wait.h"
 
 namespace {
 

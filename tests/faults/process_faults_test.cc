@@ -14,9 +14,18 @@
 #include <signal.h>
 #include <sys/prctl.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
 #include <random>
+#include <string>
+#include <thread>
+#include <vector>
 
 #include "e2e_support.h"
 #include "pm/ipc/connection.h"
@@ -24,6 +33,7 @@
 #include "pm/runtime/proc_stat.h"
 #include "pm/runtime/system.h"
 #include "pm/shm/shared_memory_queue.h"
+#include "support/wait.h"
 
 namespace {
 

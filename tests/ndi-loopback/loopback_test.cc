@@ -16,8 +16,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <fstream>
+#include <functional>
+#include <string>
 #include <tuple>
+#include <vector>
 
 #include "e2e_support.h"
 #include "ndi-loopback/net.h"
@@ -25,6 +29,7 @@
 #include "ndi-loopback/wire.h"
 #include "ndi-testsrc/pattern.h"
 #include "ndi/ndi_abi.h"
+#include "support/wait.h"
 
 namespace {
 

@@ -8,6 +8,9 @@
 #include <sys/stat.h>
 
 #include <fstream>
+#include <mutex>
+#include <string>
+#include <vector>
 
 #include "e2e_support.h"
 

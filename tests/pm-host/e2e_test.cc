@@ -13,6 +13,7 @@
 #include <unistd.h>
 
 #include "e2e_support.h"
+#include "support/wait.h"
 
 namespace {
 
