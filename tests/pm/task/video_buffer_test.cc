@@ -18,6 +18,8 @@
 
 namespace {
 
+using pmtest::VideoFormatOf;
+
 constexpr std::uint8_t kUntouched = 0xEE;
 
 // Exactly `n` bytes on the heap: byte i is (i * step + seed), or all
@@ -30,10 +32,6 @@ struct Bytes {
   std::size_t size;
   std::unique_ptr<std::uint8_t[]> data;
 };
-
-pm::VideoFormat Format(std::uint32_t code, int width, int height) {
-  return pmtest::VideoFormatOf(code, width, height);
-}
 
 // A video buffer over plain memory that counts its mappings.
 class MemoryVideoBuffer : public pm::VideoBuffer {
@@ -117,7 +115,7 @@ TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.code);
-    const pm::VideoFormat f = Format(c.code, c.width, c.height);
+    const pm::VideoFormat f = VideoFormatOf(c.code, c.width, c.height);
     const Bytes source = SourcePicture(f, c.sourceStride == 0 ? c.rowBytes : c.sourceStride);
     MemoryVideoBuffer buffer(f, c.stride);
     buffer.CopyFrame(source.data.get(), c.sourceStride);
@@ -147,7 +145,7 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
     for (std::uint32_t code : {pm::kCodeI420, pm::kCodeYV12}) {
       SCOPED_TRACE(testing::Message() << "width " << w << " code " << code);
       Planar src(h, w + 3, w / 2 + 1);
-      MemoryVideoBuffer buffer(Format(pm::kCodeNV12, w, h), stride);
+      MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeNV12, w, h), stride);
       buffer.ConvertFrame(code, src.planes);
       EXPECT_EQ(buffer.maps, 1);
       EXPECT_EQ(buffer.unmaps, 1);
@@ -190,7 +188,7 @@ TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
         src.planeCount = 1;
         src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
                                 : pm::Plane{pixels.data.get(), h, stride};
-        MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
+        MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
         buffer.ConvertFrame(k.code, src);
         for (int r = 0; r < h; ++r) {
           const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
@@ -272,7 +270,7 @@ TEST(VideoBuffer, RefusedCopiesAndConversionsWriteNothingPastAPlaneAndUnmap) {
   for (std::size_t i = 0; i < std::size(cases); ++i) {
     const Case& c = cases[i];
     SCOPED_TRACE(i);
-    MemoryVideoBuffer buffer(Format(c.to, w, h), c.dstStride);
+    MemoryVideoBuffer buffer(VideoFormatOf(c.to, w, h), c.dstStride);
     buffer.mapless = c.mapless;
     c.run(buffer);
     EXPECT_EQ(buffer.maps, c.maps);
