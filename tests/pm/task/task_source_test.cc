@@ -206,12 +206,10 @@ TEST_F(TaskSourceTest, CommandsPassNullForAbsentKeysAndAnswersThatAreNotJson) {
   StartSource("a");
   journal_.Clear();
   EXPECT_EQ(Ask("pm::tsrc::set_configuration", {{"unique_id", "a"}})["unique_id"], "a");
-  Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}});
-  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
-  reply = Ask("pm::tsrc::gui_to_configuration", {{"unique_id", "a"}, {"gui", {{"x", 2}}}});
-  EXPECT_EQ(reply["config"], Json::parse(R"({"answer":1})"));
-  reply = Ask("pm::tsrc::configuration_to_gui", {{"unique_id", "a"}, {"config", Json::object()}});
-  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
+  const Json answer = {{"answer", 1}};
+  EXPECT_EQ(Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}})["gui"], answer);
+  EXPECT_EQ(Ask("pm::tsrc::gui_to_configuration", {{"unique_id", "a"}, {"gui", {{"x", 2}}}})["config"], answer);
+  EXPECT_EQ(Ask("pm::tsrc::configuration_to_gui", {{"unique_id", "a"}, {"config", Json::object()}})["gui"], answer);
   Ask("pm::tsrc::execute_custom_action_command", {{"unique_id", "a"}});
   Ask("pm::tsrc::handle_shot_event", {{"unique_id", "a"}, {"event", 7}});
   EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 null", "validate a#1 null", R"(to_config a#1 {"x":2})",
@@ -219,7 +217,7 @@ TEST_F(TaskSourceTest, CommandsPassNullForAbsentKeysAndAnswersThatAreNotJson) {
   // A source's answer that is not JSON becomes null, with a line.
   StartSource("notjson");
   pmtest::LogCapture log;
-  reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "notjson"}, {"gui", "g"}});
+  const Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "notjson"}, {"gui", "g"}});
   ASSERT_TRUE(reply.contains("gui"));
   EXPECT_TRUE(reply["gui"].is_null());
   EXPECT_TRUE(log.Contains("pmjson::Parse failed: validate_gui '{not json'"));
