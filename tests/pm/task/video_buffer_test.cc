@@ -10,6 +10,7 @@
 #include <cstring>
 #include <functional>
 #include <memory>
+#include <utility>
 #include <vector>
 
 #include "pm/shm/formats.h"
@@ -119,8 +120,7 @@ TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
     const Bytes source = SourcePicture(f, c.sourceStride == 0 ? c.rowBytes : c.sourceStride);
     MemoryVideoBuffer buffer(f, c.stride);
     buffer.CopyFrame(source.data.get(), c.sourceStride);
-    EXPECT_EQ(buffer.maps, 1);
-    EXPECT_EQ(buffer.unmaps, 1);
+    EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
     const pm::VideoPlanes planes = pm::LayoutPlanes(f, source.data.get(), c.stride);
     for (int plane = 0; plane < planes.planeCount; ++plane) {
       for (int r = 0; r < planes.plane[plane].rows; ++r) {
@@ -147,8 +147,7 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
       Planar src(h, w + 3, w / 2 + 1);
       MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeNV12, w, h), stride);
       buffer.ConvertFrame(code, src.planes);
-      EXPECT_EQ(buffer.maps, 1);
-      EXPECT_EQ(buffer.unmaps, 1);
+      EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
       const pm::Plane& luma = src.planes.plane[0];
       for (int r = 0; r < h; ++r) {
         for (int c = 0; c < stride; ++c) {
@@ -273,8 +272,7 @@ TEST(VideoBuffer, RefusedCopiesAndConversionsWriteNothingPastAPlaneAndUnmap) {
     MemoryVideoBuffer buffer(VideoFormatOf(c.to, w, h), c.dstStride);
     buffer.mapless = c.mapless;
     c.run(buffer);
-    EXPECT_EQ(buffer.maps, c.maps);
-    EXPECT_EQ(buffer.unmaps, c.maps);
+    EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(c.maps, c.maps));
     if (c.written == kNothing) {
       EXPECT_TRUE(buffer.AllUntouched());
       continue;
