@@ -63,13 +63,10 @@ TEST_F(MediaClock, VideoAdvancesInExactFrameStepsNearTheAudioClock) {
 TEST_F(MediaClock, VideoFarFromTheAudioClockJumpsToIt) {
   clock.AudioSent(1600);
   clock.AudioTime(48000);
-  const auto first = clock.NextVideoTime(Rate(30, 1));
+  clock.NextVideoTime(Rate(30, 1));
   for (int i = 0; i < 300; ++i) clock.AudioSent(1600);  // ten seconds of audio at once
   const std::int64_t audio = clock.AudioTime(48000);
-  const auto second = clock.NextVideoTime(Rate(30, 1));
-  EXPECT_NE(second.first, first.first + pm::kTicksPerSecond / 30);
-  EXPECT_EQ(second.first, audio);
-  EXPECT_FALSE(second.second);
+  EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(audio, false));  // not one frame step on
 }
 
 TEST_F(MediaClock, VideoTimeThatWouldNotAdvanceIsBumpedAsADiscontinuity) {
