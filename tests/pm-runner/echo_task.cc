@@ -44,6 +44,5 @@ class EchoTask : public pm::Task {
 }  // namespace
 
 extern "C" __attribute__((visibility("default"))) pm::TaskBase* pmTask_Factory() {
-  pm::Log(pm::LogType::Normal, "", "EchoTask: created\n");
   return new EchoTask();
 }

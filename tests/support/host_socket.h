@@ -79,19 +79,13 @@ class HostPeer {
     }
     return true;
   }
-  std::optional<std::string> ReadFrame(std::chrono::milliseconds limit = std::chrono::seconds(5)) {
-    unsigned char header[4];
-    if (!ReadExact(header, 4, limit)) return std::nullopt;
-    const std::uint32_t n = pm::LoadLe32(header);
-    std::string text(n, '\0');
-    if (n > 0 && !ReadExact(text.data(), n, limit)) return std::nullopt;
-    return text;
-  }
   // The next frame parsed; a discarded value when none came.
   nlohmann::json ReadJson(std::chrono::milliseconds limit = std::chrono::seconds(5)) {
-    auto text = ReadFrame(limit);
-    if (!text) return nlohmann::json(nlohmann::json::value_t::discarded);
-    return nlohmann::json::parse(*text, nullptr, false);
+    unsigned char header[4];
+    std::string text;
+    if (ReadExact(header, 4, limit)) text.resize(pm::LoadLe32(header));
+    if (text.empty() || !ReadExact(text.data(), text.size(), limit)) return nlohmann::json::value_t::discarded;
+    return nlohmann::json::parse(text, nullptr, false);
   }
   // True when the peer ends the stream (or resets it) within the limit; data
   // before the end is skipped.

@@ -46,26 +46,23 @@ struct Pair {
 TEST(SocketErrors, ClassifyByTheirNumbers) {
   struct Row {
     int err, wsa;
-    bool gone, timedOut, interrupted, alreadyConnected;
+    const char* classes;  // g: gone, t: timed out, i: interrupted, a: already connected
   };
   // An expired SO_RCVTIMEO is EAGAIN/EWOULDBLOCK on Linux: it must read as a
   // timeout, not as a dead peer.
   const Row rows[] = {
-      {ENOTSOCK, ENOTSOCK, true, false, false, false},   {EBADF, EBADF, true, false, false, false},
-      {ECONNRESET, ECONNRESET, true, false, false, false}, {EPIPE, EPIPE, true, false, false, false},
-      {ECONNABORTED, ECONNABORTED, false, true, false, false}, {ETIMEDOUT, ETIMEDOUT, false, true, false, false},
-      {EAGAIN, EAGAIN, false, true, false, false},
-      {EINTR, 0, false, false, true, false},             {0, EINTR, false, false, true, false},
-      {EISCONN, EISCONN, false, false, false, true},     {ECONNREFUSED, ECONNREFUSED, false, false, false, false},
-      {0, 10054, false, false, false, false},            {-3, 111, false, false, false, false},
+      {ENOTSOCK, ENOTSOCK, "g"},          {EBADF, EBADF, "g"},           {ECONNRESET, ECONNRESET, "g"},
+      {EPIPE, EPIPE, "g"},                {ECONNABORTED, ECONNABORTED, "t"}, {ETIMEDOUT, ETIMEDOUT, "t"},
+      {EAGAIN, EAGAIN, "t"},              {EINTR, 0, "i"},               {0, EINTR, "i"},
+      {EISCONN, EISCONN, "a"},            {ECONNREFUSED, ECONNREFUSED, ""}, {0, 10054, ""},
+      {-3, 111, ""},
   };
   for (const Row& row : rows) {
     const LastSocketError error{row.err, row.wsa};
     SCOPED_TRACE(pm::ip::ErrorText(error));  // (its form: in the acceptor's line, tests/pm/ipc)
-    EXPECT_EQ(error.Gone(), row.gone);
-    EXPECT_EQ(error.TimedOut(), row.timedOut);
-    EXPECT_EQ(error.Interrupted(), row.interrupted);
-    EXPECT_EQ(error.AlreadyConnected(), row.alreadyConnected);
+    EXPECT_EQ(std::string(error.Gone() ? "g" : "") + (error.TimedOut() ? "t" : "") + (error.Interrupted() ? "i" : "") +
+                  (error.AlreadyConnected() ? "a" : ""),
+              row.classes);
   }
 }
 

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "pm/ipc/framing.h"
+#include "support/host_socket.h"
 
 namespace {
 
@@ -15,11 +16,6 @@ using pm::ipc::EncodeFrame;
 using pm::ipc::FrameReader;
 using pm::ipc::kMaxFrameBytes;
 using Messages = std::vector<std::string>;
-
-std::string Prefix(std::uint32_t n) {
-  const auto prefix = pm::ipc::FramePrefix(n);
-  return std::string(prefix.begin(), prefix.end());
-}
 
 Messages Drain(FrameReader& reader) {
   Messages out;
@@ -67,7 +63,7 @@ TEST(FrameReader, LengthOverTheLimitStopsTheStreamForGood) {
     SCOPED_TRACE(length);
     FrameReader reader;
     const std::string before = EncodeFrame("ok");
-    const std::string stream = before + Prefix(length) + EncodeFrame("after");
+    const std::string stream = before + pmtest::HostPeer::Prefix(length) + EncodeFrame("after");
     EXPECT_EQ(reader.Feed(stream.data(), stream.size()), before.size() + 4);
     EXPECT_EQ(reader.Feed(stream.data() + before.size() + 4, 9), 0u);
     EXPECT_EQ(Drain(reader), Messages{"ok"});

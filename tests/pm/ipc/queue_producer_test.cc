@@ -42,7 +42,7 @@ struct Reader {
   }
 };
 
-struct Fixture : ::testing::Test {
+struct QueueProducer : ::testing::Test {
   // First, so that it outlives the producer thread, which may log until it
   // is joined.
   pmtest::LogCapture log;
@@ -92,14 +92,12 @@ struct Fixture : ::testing::Test {
   }
 };
 
-using ProducerRecord = Fixture;
-
 // A record is its token (little-endian) and the record bytes, written as one
 // block from any number of entries to each reader once; entries that do not
 // add up to the record size (also only modulo 2^32), or miss their bytes,
 // write nothing and take no token. The same connection again, or none, is
 // refused.
-TEST_F(ProducerRecord, IsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
+TEST_F(QueueProducer, RecordIsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
   auto reader = Add();
   EXPECT_FALSE(producer.AddConnection(reader->task));
   EXPECT_FALSE(producer.AddConnection(nullptr));
@@ -118,12 +116,10 @@ TEST_F(ProducerRecord, IsTheTokenThenTheEntriesAndWrongEntriesWriteNothing) {
   EXPECT_TRUE(Released().empty());
 }
 
-using ProducerTokens = Fixture;
-
 // A token is released, on the producer thread, once every reader it went to
 // has returned it; returns a reader does not owe (again, or never sent) are
 // logged and ignored and do not cost the reader its place.
-TEST_F(ProducerTokens, ReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIgnored) {
+TEST_F(QueueProducer, TokenReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIgnored) {
   auto a = Add();
   auto b = Add();
   ASSERT_TRUE(Send(5));
@@ -148,7 +144,7 @@ TEST_F(ProducerTokens, ReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIgnore
 // every pending token in ascending order, both on the calling thread; a
 // destroyed producer drops what is pending without callbacks and leaves the
 // reader's connection to its other owners.
-TEST_F(ProducerTokens, SendBeforeAnyReaderAndStopReleaseOnTheCallingThreadDestructionDropsSilently) {
+TEST_F(QueueProducer, SendBeforeAnyReaderAndStopReleaseOnTheCallingThreadDestructionDropsSilently) {
   EXPECT_TRUE(Send(9));
   EXPECT_EQ(Released(), Tokens{9});
   auto reader = Add();
@@ -170,7 +166,7 @@ TEST_F(ProducerTokens, SendBeforeAnyReaderAndStopReleaseOnTheCallingThreadDestru
 // writing its record (Stop, or its only reader gone) is released by that
 // Send once the write has ended, never under it. The reader does not read, so
 // its socket buffers fill and the write blocks until the test reads.
-TEST_F(ProducerTokens, TokenGivenUpWhileItsRecordIsBeingWrittenIsReleasedAfterTheWrite) {
+TEST_F(QueueProducer, TokenGivenUpWhileItsRecordIsBeingWrittenIsReleasedAfterTheWrite) {
   constexpr std::uint32_t kBig = 4 << 20;  // many times what the socket buffers below hold
   const std::vector<std::uint8_t> big(kBig, 0x5A);
   const std::pair<const char*, std::function<void(Reader&)>> cases[] = {
@@ -217,12 +213,10 @@ TEST_F(ProducerTokens, TokenGivenUpWhileItsRecordIsBeingWrittenIsReleasedAfterTh
   }
 }
 
-using ProducerReaders = Fixture;
-
 // Returns that arrive while the producer does not watch the reader (before it
 // is added, or while the producer is stopped) are stale: discarded when it
 // starts watching, never taken for returns of later records.
-TEST_F(ProducerReaders, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
+TEST_F(QueueProducer, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
   for (const bool restart : {false, true}) {
     SCOPED_TRACE(restart ? "returned while stopped" : "returned before added");
     const std::size_t before = Released().size();
@@ -250,7 +244,7 @@ TEST_F(ProducerReaders, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
 // A reader whose end closes (the host's process ended, or we closed it) is
 // dropped with what it alone still owed, and its dead socket does not make
 // the producer spin.
-TEST_F(ProducerReaders, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
+TEST_F(QueueProducer, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   auto a = Add();
   auto b = Add();
   for (std::uint32_t token : {7u, 2u, 5u, 6u}) ASSERT_TRUE(Send(token));

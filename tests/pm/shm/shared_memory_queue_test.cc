@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "pm/runtime/context.h"
+#include "pm/runtime/little_endian.h"
 #include "pm/runtime/system.h"
 #include "pm/shm/shared_gpu_memory.h"
 #include "pm/shm/shared_memory_queue.h"
@@ -113,9 +114,7 @@ TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnRe
   ASSERT_TRUE(host.ReadRecord(&token, record));
   EXPECT_EQ(token, segment->id);
   EXPECT_EQ(std::memcmp(record, ".UPC", 4), 0);  // the CPU type tag
-  std::uint64_t size = 0;
-  std::memcpy(&size, record + 12, 8);
-  EXPECT_EQ(size, 4096u);
+  EXPECT_EQ(pm::LoadLe64(record + 12), 4096u);  // the segment's size
   EXPECT_EQ(std::memcmp(record + 24, payload, 34), 0);
   EXPECT_EQ(Sums(record, 60), std::make_pair(0u, 0u));
 

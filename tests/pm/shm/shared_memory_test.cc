@@ -42,26 +42,10 @@ int OpenDescriptors() {
   return count - 1;  // the directory's own descriptor
 }
 
-// Every test ends with nothing of this process left in /dev/shm (other test
-// processes run beside this one and make segments of their own).
-class SharedCpuMemoryTest : public testing::Test {
- protected:
-  void TearDown() override {
-    DIR* dir = ::opendir("/dev/shm");
-    while (dirent* entry = dir ? ::readdir(dir) : nullptr) {
-      const std::string name = entry->d_name;
-      if (name.rfind(Prefix(), 0) != 0) continue;
-      ADD_FAILURE() << "left in /dev/shm: " << name;
-      ::shm_unlink(("/" + name).c_str());
-    }
-    if (dir) ::closedir(dir);
-  }
-};
-
 // A private entry of the whole size, whose mapping keeps no descriptor open;
 // without a name Create makes a unique one; creating again releases the old
 // name first; destruction removes the name.
-TEST_F(SharedCpuMemoryTest, CreateMakesAPrivateUniqueEntryAndReCreateOrDestructionRemovesIt) {
+TEST(SharedCpuMemory, CreateMakesAPrivateUniqueEntryAndReCreateOrDestructionRemovesIt) {
   const int descriptorsBefore = OpenDescriptors();
   auto a = Segment::New();
   auto b = Segment::New();
@@ -89,7 +73,7 @@ TEST_F(SharedCpuMemoryTest, CreateMakesAPrivateUniqueEntryAndReCreateOrDestructi
 // A second process (using only system calls, like a host) maps the segment
 // by name, reads what the task wrote and writes back; its mapping outlives
 // the creator and the name, which the creator removes.
-TEST_F(SharedCpuMemoryTest, AnotherProcessSharesTheSegmentByNameAndOutlivesItsCreator) {
+TEST(SharedCpuMemory, AnotherProcessSharesTheSegmentByNameAndOutlivesItsCreator) {
   constexpr int kSize = 4096 * 3;
   const std::string name = UniqueName();
   auto segment = Segment::New();
@@ -132,7 +116,7 @@ TEST_F(SharedCpuMemoryTest, AnotherProcessSharesTheSegmentByNameAndOutlivesItsCr
 // Open, or Create on a name that exists, maps the same object: never shrunk
 // under a reader of the larger size, grown for a larger request, and unlinked
 // only by its creator.
-TEST_F(SharedCpuMemoryTest, ExistingNamesAreSharedNeverShrunkAndUnlinkedOnlyByTheCreator) {
+TEST(SharedCpuMemory, ExistingNamesAreSharedNeverShrunkAndUnlinkedOnlyByTheCreator) {
   const std::string name = UniqueName();
   auto creator = Segment::New();
   ASSERT_TRUE(creator->Create(name, 16384));
@@ -162,7 +146,7 @@ TEST_F(SharedCpuMemoryTest, ExistingNamesAreSharedNeverShrunkAndUnlinkedOnlyByTh
 // Locks nest; a stray Unlock does not wrap the count into "locked for good";
 // the stride set before the first lock is what Lock reports. MakeShared hands
 // the segment to its release instead of deleting it.
-TEST_F(SharedCpuMemoryTest, LocksNestAStrayUnlockDoesNotWrapAndMakeSharedReleasesInsteadOfDeleting) {
+TEST(SharedCpuMemory, LocksNestAStrayUnlockDoesNotWrapAndMakeSharedReleasesInsteadOfDeleting) {
   auto segment = Segment::New();
   EXPECT_EQ(segment->Lock(), std::make_pair(static_cast<std::uint8_t*>(nullptr), 0));  // unmapped, still counted
   segment->Unlock();
@@ -192,7 +176,7 @@ TEST_F(SharedCpuMemoryTest, LocksNestAStrayUnlockDoesNotWrapAndMakeSharedRelease
 // entry in /dev/shm: mapping more than the object holds (it would fault past
 // its end), a zero-byte segment (its fresh name goes again), a name with a
 // slash, one too long, one missing.
-TEST_F(SharedCpuMemoryTest, FailuresLogOneLineAndLeaveNothingBehind) {
+TEST(SharedCpuMemory, FailuresLogOneLineAndLeaveNothingBehind) {
   const std::string existing = UniqueName(), empty = UniqueName(), missing = UniqueName();
   auto creator = Segment::New();
   ASSERT_TRUE(creator->Create(existing, 4096));

@@ -17,14 +17,6 @@ namespace {
 
 using nlohmann::json;
 
-// The command's own keys of a notification: the envelope removed.
-json Payload(json message) {
-  message.erase("pm::unique_id");
-  message.erase("pm::command");
-  message.erase("pm::request");
-  return message;
-}
-
 struct Fixture {
   pmtest::HostLink link;
   std::shared_ptr<pm::SourceCallbacks> callbacks =
@@ -36,7 +28,9 @@ struct Fixture {
     if (!message) return nullptr;
     EXPECT_EQ((*message)["pm::request"], true);
     EXPECT_TRUE((*message)["pm::unique_id"].is_number_unsigned());
-    return Payload(*message);
+    // The command's own keys: the envelope removed.
+    for (const char* key : {"pm::unique_id", "pm::command", "pm::request"}) message->erase(key);
+    return *message;
   }
 
   // Opens the queue and connects a host reader to it.
@@ -53,10 +47,6 @@ class QueueTest : public ::testing::Test, public Fixture {
   void SetUp() override { reader = OpenQueue(); }
   std::unique_ptr<pmtest::QueueReader> reader;
 };
-
-pm::VideoFormat Video(std::uint32_t code, int width, int height) {
-  return pmtest::VideoFormatOf(code, width, height);
-}
 
 // Each notification carries exactly its keys (a float stays a float); a text
 // that is not JSON goes as null.
@@ -130,7 +120,7 @@ TEST_F(QueueTest, AudioRequestsAreSizedOrRefusedBeforeThePool) {
 }
 
 TEST_F(QueueTest, VideoRequests_JpegNeedsAByteSizeAndGetsStrideOne) {
-  pm::VideoFormat jpeg = Video(pm::kCodeJpeg, 640, 480);
+  pm::VideoFormat jpeg = pmtest::VideoFormatOf(pm::kCodeJpeg, 640, 480);
   {
     pmtest::LogCapture capture;
     EXPECT_EQ(callbacks->RequestVideoBuffer(jpeg, 0), nullptr);
@@ -145,7 +135,7 @@ TEST_F(QueueTest, VideoRequests_JpegNeedsAByteSizeAndGetsStrideOne) {
 
 TEST_F(QueueTest, VideoRequests_StopCreatingSegmentsAtTheLimit) {
   callbacks->SetMaxVideoBuffers(2);
-  pm::VideoFormat format = Video(pm::kCode2vuy, 64, 64);
+  pm::VideoFormat format = pmtest::VideoFormatOf(pm::kCode2vuy, 64, 64);
   auto a = callbacks->RequestVideoBuffer(format, 0);
   auto b = callbacks->RequestVideoBuffer(format, 0);
   ASSERT_TRUE(a && b);

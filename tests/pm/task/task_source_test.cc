@@ -107,20 +107,6 @@ class ScriptedDiscovery : public pm::SourceDiscovery {
   std::function<void()> onStart_;
 };
 
-// Sends a command on `peer` and returns its reply (discarded when none
-// comes), skipping other frames.
-Json AskOn(pmtest::HostPeer& peer, std::uint64_t id, const std::string& command, Json body) {
-  body["pm::command"] = command;
-  body["pm::unique_id"] = id;
-  body["pm::request"] = true;
-  if (!peer.WriteJson(body)) return Json::value_t::discarded;
-  for (;;) {
-    const Json frame = peer.ReadJson(5s);
-    if (frame.is_discarded()) return frame;
-    if (frame.value("pm::response", false) && frame.value("pm::unique_id", std::uint64_t{0}) == id) return frame;
-  }
-}
-
 // A task with scripted factories, one dispatcher attached as the runner
 // attaches it, and the host's end of that connection.
 class TaskSourceTest : public ::testing::Test {
@@ -161,11 +147,12 @@ class TaskSourceTest : public ::testing::Test {
     if (kept != nullptr) *kept = dispatcher;
     return peer;
   }
-  pmtest::HostPeer AttachAnother() { return Attach(anotherListener_); }
 
   // Sends a command and returns its reply, skipping the task's own requests
   // (a started source announces its buffer queue).
-  Json Ask(const std::string& command, Json body = Json::object()) { return AskOn(host_, ++requestId_, command, body); }
+  Json Ask(const std::string& command, Json body = Json::object()) {
+    return pmtest::Ask(host_, command, ++requestId_, std::move(body));
+  }
   void StartSource(const std::string& id, const Json* config = nullptr) {
     Json body = {{"unique_id", id}};
     if (config) body["config"] = *config;
@@ -219,12 +206,10 @@ TEST_F(TaskSourceTest, CommandsPassNullForAbsentKeysAndAnswersThatAreNotJson) {
   StartSource("a");
   journal_.Clear();
   EXPECT_EQ(Ask("pm::tsrc::set_configuration", {{"unique_id", "a"}})["unique_id"], "a");
-  Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}});
-  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
-  reply = Ask("pm::tsrc::gui_to_configuration", {{"unique_id", "a"}, {"gui", {{"x", 2}}}});
-  EXPECT_EQ(reply["config"], Json::parse(R"({"answer":1})"));
-  reply = Ask("pm::tsrc::configuration_to_gui", {{"unique_id", "a"}, {"config", Json::object()}});
-  EXPECT_EQ(reply["gui"], Json::parse(R"({"answer":1})"));
+  const Json answer = {{"answer", 1}};
+  EXPECT_EQ(Ask("pm::tsrc::validate_gui", {{"unique_id", "a"}})["gui"], answer);
+  EXPECT_EQ(Ask("pm::tsrc::gui_to_configuration", {{"unique_id", "a"}, {"gui", {{"x", 2}}}})["config"], answer);
+  EXPECT_EQ(Ask("pm::tsrc::configuration_to_gui", {{"unique_id", "a"}, {"config", Json::object()}})["gui"], answer);
   Ask("pm::tsrc::execute_custom_action_command", {{"unique_id", "a"}});
   Ask("pm::tsrc::handle_shot_event", {{"unique_id", "a"}, {"event", 7}});
   EXPECT_EQ(journal_.Lines(), (Lines{"config a#1 null", "validate a#1 null", R"(to_config a#1 {"x":2})",
@@ -232,7 +217,7 @@ TEST_F(TaskSourceTest, CommandsPassNullForAbsentKeysAndAnswersThatAreNotJson) {
   // A source's answer that is not JSON becomes null, with a line.
   StartSource("notjson");
   pmtest::LogCapture log;
-  reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "notjson"}, {"gui", "g"}});
+  const Json reply = Ask("pm::tsrc::validate_gui", {{"unique_id", "notjson"}, {"gui", "g"}});
   ASSERT_TRUE(reply.contains("gui"));
   EXPECT_TRUE(reply["gui"].is_null());
   EXPECT_TRUE(log.Contains("pmjson::Parse failed: validate_gui '{not json'"));
@@ -295,8 +280,7 @@ TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
   Ask("pm::tsrc::stop_source", {{"unique_id", 5}});  // read leniently as "5"
   EXPECT_EQ(task_->SourceCount(), 1u);
   EXPECT_FALSE(dispatcher_->Ended());
-  ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::stop_source"}, {"pm::unique_id", 99},
-                               {"pm::request", true}, {"unique_id", "6"}}));
+  ASSERT_TRUE(host_.WriteJson(pmtest::Request("pm::tsrc::stop_source", 99, {{"unique_id", "6"}})));
   EXPECT_TRUE(host_.SeesEndOfStream());
   EXPECT_TRUE(pmtest::WaitFor([&] { return dispatcher_->Ended(); }));
   EXPECT_EQ(task_->DispatcherCount(), 0u);
@@ -310,16 +294,15 @@ TEST_F(TaskSourceTest, StopOfTheLastSourceWithoutDiscoveryEndsTheConnections) {
 // connections running. A Start that throws takes its discovery out again,
 // stopped.
 TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut) {
-  pmtest::HostPeer other = AttachAnother();
+  pmtest::HostPeer other = Attach(anotherListener_);
   StartSource("a");
   discoveryMayStart_ = false;
-  ASSERT_TRUE(host_.WriteJson({{"pm::command", "pm::tsrc::start_discovery"}, {"pm::unique_id", 900},
-                               {"pm::request", true}}));
+  ASSERT_TRUE(host_.WriteJson(pmtest::Request("pm::tsrc::start_discovery", 900)));
   ASSERT_TRUE(pmtest::WaitFor([&] { return discoveryStarting_.load(); }));
-  EXPECT_FALSE(AskOn(other, 1, "pm::tsrc::stop_source", {{"unique_id", "a"}}).is_discarded());
+  EXPECT_FALSE(pmtest::Ask(other, "pm::tsrc::stop_source", 1, {{"unique_id", "a"}}).is_discarded());
   discoveryMayStart_ = true;
   EXPECT_FALSE(Ask("pm::tsrc::discovery_hotplug_event").is_discarded());
-  EXPECT_FALSE(AskOn(other, 2, "pm::tsrc::source_hotplug_event", {{"unique_id", "a"}}).is_discarded());
+  EXPECT_FALSE(pmtest::Ask(other, "pm::tsrc::source_hotplug_event", 2, {{"unique_id", "a"}}).is_discarded());
   EXPECT_EQ(task_->DispatcherCount(), 2u);
   EXPECT_EQ(journal_.Lines(),
             (Lines{"config a#1 ", "start a#1", "start discovery#1", "stop a#1", "hotplug discovery#1"}));
@@ -332,13 +315,13 @@ TEST_F(TaskSourceTest, DiscoveryIsStoredBeforeItStartsAndAFailedStartIsTakenOut)
 }
 
 TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopTheRest) {
-  pmtest::HostPeer second = AttachAnother();
+  pmtest::HostPeer second = Attach(anotherListener_);
 
   constexpr int kRounds = 15;
   const auto drive = [](pmtest::HostPeer& peer) {
     for (int i = 0; i < kRounds; ++i) {
-      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 1), "pm::tsrc::start_discovery", Json::object()).is_discarded());
-      EXPECT_FALSE(AskOn(peer, static_cast<std::uint64_t>(2 * i + 2), "pm::tsrc::start_source", {{"unique_id", "a"}}).is_discarded());
+      EXPECT_FALSE(pmtest::Ask(peer, "pm::tsrc::start_discovery", 2 * i + 1).is_discarded());
+      EXPECT_FALSE(pmtest::Ask(peer, "pm::tsrc::start_source", 2 * i + 2, {{"unique_id", "a"}}).is_discarded());
     }
   };
   std::thread other([&] { drive(second); });

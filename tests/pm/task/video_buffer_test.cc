@@ -10,6 +10,7 @@
 #include <cstring>
 #include <functional>
 #include <memory>
+#include <utility>
 #include <vector>
 
 #include "pm/shm/formats.h"
@@ -17,6 +18,8 @@
 #include "pm/task/pixel_kernels.h"
 
 namespace {
+
+using pmtest::VideoFormatOf;
 
 constexpr std::uint8_t kUntouched = 0xEE;
 
@@ -30,10 +33,6 @@ struct Bytes {
   std::size_t size;
   std::unique_ptr<std::uint8_t[]> data;
 };
-
-pm::VideoFormat Format(std::uint32_t code, int width, int height) {
-  return pmtest::VideoFormatOf(code, width, height);
-}
 
 // A video buffer over plain memory that counts its mappings.
 class MemoryVideoBuffer : public pm::VideoBuffer {
@@ -117,12 +116,11 @@ TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.code);
-    const pm::VideoFormat f = Format(c.code, c.width, c.height);
+    const pm::VideoFormat f = VideoFormatOf(c.code, c.width, c.height);
     const Bytes source = SourcePicture(f, c.sourceStride == 0 ? c.rowBytes : c.sourceStride);
     MemoryVideoBuffer buffer(f, c.stride);
     buffer.CopyFrame(source.data.get(), c.sourceStride);
-    EXPECT_EQ(buffer.maps, 1);
-    EXPECT_EQ(buffer.unmaps, 1);
+    EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
     const pm::VideoPlanes planes = pm::LayoutPlanes(f, source.data.get(), c.stride);
     for (int plane = 0; plane < planes.planeCount; ++plane) {
       for (int r = 0; r < planes.plane[plane].rows; ++r) {
@@ -147,10 +145,9 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
     for (std::uint32_t code : {pm::kCodeI420, pm::kCodeYV12}) {
       SCOPED_TRACE(testing::Message() << "width " << w << " code " << code);
       Planar src(h, w + 3, w / 2 + 1);
-      MemoryVideoBuffer buffer(Format(pm::kCodeNV12, w, h), stride);
+      MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeNV12, w, h), stride);
       buffer.ConvertFrame(code, src.planes);
-      EXPECT_EQ(buffer.maps, 1);
-      EXPECT_EQ(buffer.unmaps, 1);
+      EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
       const pm::Plane& luma = src.planes.plane[0];
       for (int r = 0; r < h; ++r) {
         for (int c = 0; c < stride; ++c) {
@@ -190,7 +187,7 @@ TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
         src.planeCount = 1;
         src.plane[0] = bottomUp ? pm::Plane{pixels.data.get() + (h - 1) * stride, h, -stride}
                                 : pm::Plane{pixels.data.get(), h, stride};
-        MemoryVideoBuffer buffer(Format(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
+        MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
         buffer.ConvertFrame(k.code, src);
         for (int r = 0; r < h; ++r) {
           const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
@@ -272,11 +269,10 @@ TEST(VideoBuffer, RefusedCopiesAndConversionsWriteNothingPastAPlaneAndUnmap) {
   for (std::size_t i = 0; i < std::size(cases); ++i) {
     const Case& c = cases[i];
     SCOPED_TRACE(i);
-    MemoryVideoBuffer buffer(Format(c.to, w, h), c.dstStride);
+    MemoryVideoBuffer buffer(VideoFormatOf(c.to, w, h), c.dstStride);
     buffer.mapless = c.mapless;
     c.run(buffer);
-    EXPECT_EQ(buffer.maps, c.maps);
-    EXPECT_EQ(buffer.unmaps, c.maps);
+    EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(c.maps, c.maps));
     if (c.written == kNothing) {
       EXPECT_TRUE(buffer.AllUntouched());
       continue;
