@@ -539,12 +539,16 @@ TEST_F(NdiSource, ErrorsAreToldAndKeptUntilAReconnect) {
     fault();
     source->Stop();
     env.clock = std::make_shared<pmtest::ManualClock>();  // each run's waits counted from 1
+    const std::size_t told = callbacks->Seen().guis.size();
     Make();
     source->Start();
-    UntilState(ReceiverState::Error);
+    // The panel is told just after the state changes.
+    Until([&] {
+      const auto guis = callbacks->Seen().guis;
+      return guis.size() > told && guis.back().find("\"indication\":101") != std::string::npos;
+    });
+    EXPECT_EQ(source->State(), ReceiverState::Error);
     EXPECT_TRUE(logs.Contains(line));
-    const std::string gui = callbacks->Seen().guis.back();
-    EXPECT_NE(gui.find("\"indication\":101"), std::string::npos) << gui;
     ndi.FailFinderCreate(false);
     ndi.FailReceiverCreate(false);
   }
