@@ -42,16 +42,8 @@ namespace nditest {
 struct TestEnvironment {
   std::shared_ptr<pmtest::ManualClock> clock = std::make_shared<pmtest::ManualClock>();
   std::shared_ptr<std::atomic<int>> exits = std::make_shared<std::atomic<int>>(0);
-  TaskNDISource::LoopEnvironment Make(std::chrono::milliseconds stopTimeout = std::chrono::seconds(5),
-                                      std::function<void()> onExit = nullptr) const {
-    TaskNDISource::LoopEnvironment env;
-    env.clock = clock;
-    env.stopTimeout = stopTimeout;
-    env.exitProcess = [counter = exits, onExit] {
-      ++*counter;
-      if (onExit) onExit();
-    };
-    return env;
+  TaskNDISource::LoopEnvironment Make() const {
+    return {clock, std::chrono::seconds(5), [counter = exits] { ++*counter; }};
   }
 };
 
@@ -133,7 +125,6 @@ struct Observed {
   int listCalls = 0;
   std::vector<ReceiverCreated> receivers;
   int receiversDestroyed = 0;
-  int connectionQueries = 0;
   std::vector<ndi_tally> tallies;
   // Every send tried, as its text without the zero its length must count.
   std::vector<std::string> metadataSent;
@@ -193,7 +184,6 @@ class ScriptedNdi {
     edit();
     changed_.notify_all();
   }
-  void* NewHandle() { return &handleSpace_[++handles_ % 64]; }
   static std::int32_t Take(ndi_video_frame_v2* video, ndi_audio_frame_v2* audio, ndi_metadata_frame* metadata) {
     ScriptedNdi& n = Current();
     std::unique_lock<std::mutex> lock(n.mutex_);
@@ -241,32 +231,21 @@ class ScriptedNdi {
   std::deque<std::shared_ptr<nditest::Capture>> queue_;
   std::map<const void*, std::shared_ptr<nditest::Capture>> handedOut_;
   bool block_ = false;
-  int handles_ = 0;  // handle values are distinct small addresses within this object
-  char handleSpace_[64] = {};
 };
 
 class FakeVideoBuffer : public pm::VideoBuffer {
  public:
   explicit FakeVideoBuffer(const pm::VideoFormat& format)
       : format_(format), memory(static_cast<std::size_t>(pm::FrameSize(format, 0))) {}
-  // The intake only copies whole frames.
-  pm::VideoPlanes Planes() override { return {}; }
+  // The host buffer's own copy (CopyFrame) lays the picture out over plain
+  // memory, one row of the format each, so reading past a short frame shows.
+  pm::VideoPlanes Planes() override { return pm::LayoutPlanes(format_, memory.data(), 0); }
   std::pair<std::uint8_t*, std::int32_t> MapData() override { return {nullptr, 0}; }
   void UnmapData() override {}
   pm::VideoFormat Format() const override { return format_; }
-  // Copies height rows (and NV12's chroma rows) of one row of the format
-  // each, as the host buffer does, so reading past a short frame shows.
-  void CopyFrame(const std::uint8_t* source, std::int32_t sourceStride) override {
-    copiedStride = sourceStride;
-    const std::ptrdiff_t row = pm::DefaultStride(format_);
-    for (std::ptrdiff_t r = 0; r < std::ptrdiff_t{format_.height} * (format_.code == pm::kCodeNV12 ? 3 : 2) / 2; ++r) {
-      std::memcpy(memory.data() + r * row, source + r * sourceStride, static_cast<std::size_t>(row));
-    }
-  }
 
   pm::VideoFormat format_;
   std::vector<std::uint8_t> memory;
-  std::int32_t copiedStride = 0;
 };
 
 class FakeAudioBuffer : public pm::AudioBuffer {
@@ -370,7 +349,7 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
       if (n.failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
       ++n.seen_.findersCreated;
       n.seen_.maxLiveFinders = std::max(n.seen_.maxLiveFinders, n.seen_.findersCreated - n.seen_.findersDestroyed);
-      return n.NewHandle();
+      return &n;  // any handle will do
     });
   };
   api->find_get_current_sources = [](void*, std::uint32_t* count) {
@@ -389,16 +368,11 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
       const ndi_source& to = s->source_to_connect_to;
       n.seen_.receivers.push_back(ReceiverCreated{to.ndi_name ? to.ndi_name : "", to.url_address ? to.url_address : "",
                                                   s->color_format, s->bandwidth, s->allow_video_fields});
-      return n.NewHandle();
+      return &n;  // any handle will do
     });
   };
   api->recv_destroy = [](void*) { Locked([](ScriptedNdi& n) { ++n.seen_.receiversDestroyed; }); };
-  api->recv_get_no_connections = [](void*) {
-    return Locked([](ScriptedNdi& n) {
-      ++n.seen_.connectionQueries;
-      return n.connections_;
-    });
-  };
+  api->recv_get_no_connections = [](void*) { return Locked([](ScriptedNdi& n) { return n.connections_; }); };
   api->recv_capture_v2 = [](void*, ndi_video_frame_v2* v, ndi_audio_frame_v2* a, ndi_metadata_frame* m,
                             std::uint32_t) { return Take(v, a, m); };
   api->recv_free_video_v2 = [](void*, const ndi_video_frame_v2* v) { Free(v->data); };
