@@ -35,18 +35,6 @@ class DiscoveryTest : public ::testing::Test {
   int waits = 1;
 };
 
-TEST_F(DiscoveryTest, ScansAfter125MsThenDoublingTo4s) {
-  discovery->Start();
-  EXPECT_EQ(env.clock->AwaitWait(1), 125);
-  EXPECT_EQ(ndi.Seen().listCalls, 0);
-  std::vector<std::int64_t> intervals;
-  for (int scan = 1; scan <= 7; ++scan) {
-    intervals.push_back(NextScan());
-    EXPECT_EQ(ndi.Seen().listCalls, scan);
-  }
-  EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
-}
-
 // A sender is announced once while it stays, withdrawn once, and announced
 // anew when it is back. Senders are told apart by URL, so two with one name
 // are two entries with one id. Within a scan every withdrawal comes first, and an id that an entry
@@ -69,7 +57,7 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
       {"both of two vanished", {{at1, at2}, {}, {}}, {on, on, off, off}},
 
       {"entries without name or url are ignored",
-       {{Entry{std::nullopt, "10.0.0.1:1"}, Entry{"B (y)", std::nullopt}, Entry{"", "10.0.0.3:1"}, Entry{"C (z)", ""}, at1}},
+       {{Entry{nullptr, "10.0.0.1:1"}, Entry{"B (y)", nullptr}, Entry{"", "10.0.0.3:1"}, Entry{"C (z)", ""}, at1}},
        {on}},
       {"stays, vanishes and comes back", {{at1}, {at1}, {}, {}, {at1}}, {on, off, on}},
   };
@@ -88,19 +76,25 @@ TEST_F(DiscoveryTest, WithdrawalsComeFirstSoAPresentIdEndsAvailable) {
   EXPECT_EQ(logs.Count("#ndisource: Discovered NDI Source: A (x) (10.0.0.1:1)\n"), 2);
 }
 
-TEST_F(DiscoveryTest, StopEndsAWaitAndARestartKeepsTheTableAndIsNotCutShortByAnEarlierStop) {
+// Scans come 125 ms after a start, then at intervals doubling to 4 s. Stop
+// ends a wait without another scan; a restart keeps the table and is not cut
+// short by an earlier Stop.
+TEST_F(DiscoveryTest, ScansDoubleTo4sUntilAStopAndARestartKeepsTheTable) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Stop();  // nothing runs: the signal must not outlive this call's purpose
   discovery->Start();
-  NextScan();
-  discovery->Stop();  // during a wait: ends without another scan
-  EXPECT_EQ(ndi.Seen().listCalls, 1);
+  EXPECT_EQ(env.clock->AwaitWait(1), 125);
+  EXPECT_EQ(ndi.Seen().listCalls, 0);
+  std::vector<std::int64_t> intervals;
+  for (int scan = 1; scan <= 7; ++scan) intervals.push_back(NextScan());
+  EXPECT_EQ(intervals, (std::vector<std::int64_t>{250, 500, 1000, 2000, 4000, 4000, 4000}));
+  discovery->Stop();  // during a wait
+  EXPECT_EQ(ndi.Seen().listCalls, 7);
   EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
   EXPECT_EQ(*env.exits, 0);
   discovery->Start();
   discovery->Start();  // a second start while running is ignored
-  waits = 3;           // the first loop's two waits, then this loop's first
-  EXPECT_EQ(env.clock->AwaitWait(waits), 125);
+  EXPECT_EQ(env.clock->AwaitWait(++waits), 125);  // after the first loop's eight waits
   NextScan();
   EXPECT_EQ(callbacks->Seen().calls.size(), 1u);  // still there: not announced again
   EXPECT_EQ(ndi.Seen().findersCreated, 2);

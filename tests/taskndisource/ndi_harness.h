@@ -112,10 +112,9 @@ struct ReceiverCreated {
   bool operator==(const ReceiverCreated&) const = default;
 };
 
-struct Entry {
-  std::optional<std::string> name;
-  std::optional<std::string> url;
-};
+// A sender as the finder lists it (either text may be null); the texts must
+// outlive the test.
+using Entry = ndi_source;
 
 // What the task did to the runtime, as one snapshot.
 struct Observed {
@@ -355,8 +354,7 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   api->find_get_current_sources = [](void*, std::uint32_t* count) {
     return Locked([&](ScriptedNdi& n) -> const ndi_source* {
       ++n.seen_.listCalls;
-      n.list_.clear();
-      for (const Entry& e : n.entries_) n.list_.push_back({e.name ? e.name->c_str() : nullptr, e.url ? e.url->c_str() : nullptr});
+      n.list_ = n.entries_;
       *count = static_cast<std::uint32_t>(n.list_.size());
       return n.list_.empty() ? nullptr : n.list_.data();
     });

@@ -76,12 +76,12 @@ TEST_F(NdiSource, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
     std::uint32_t fourcc, code;
     int stride;
     bool progressive;
-    int rows, rowBytes;
+    int rowBytes;
   } cases[] = {
-      {kNdiFourCCUYVY, 0x32767579u /* '2vuy' */, 40, true, 4, 32},
-      {kNdiFourCCUYVA, pm::kCode2vuy, 32, false, 4, 32},
-      {kNdiFourCCNV12, pm::kCodeNV12, 24, true, 6, 16},
-      {kNdiFourCCBGRA, pm::kCodeRgba, 72, false, 4, 64},
+      {kNdiFourCCUYVY, 0x32767579u /* '2vuy' */, 40, true, 32},
+      {kNdiFourCCUYVA, pm::kCode2vuy, 32, false, 32},
+      {kNdiFourCCNV12, pm::kCodeNV12, 24, true, 16},
+      {kNdiFourCCBGRA, pm::kCodeRgba, 72, false, 64},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.fourcc);
@@ -92,11 +92,8 @@ TEST_F(NdiSource, EachPixelFormatIsRequestedAsItsHostCodeAndCopiedRowByRow) {
     const pm::VideoFormat r = sent->format_;
     EXPECT_EQ((std::vector<std::uint32_t>{r.code, std::uint32_t(r.width), std::uint32_t(r.height), std::uint32_t(r.scan)}),
               (std::vector<std::uint32_t>{c.code, 16, 4, std::uint32_t(c.progressive ? 'P' : 'U')}));
-    for (int row = 0; row < c.rows; ++row) {
-      ASSERT_EQ(0, std::memcmp(sent->memory.data() + row * c.rowBytes, frame->bytes.data() + row * c.stride,
-                               static_cast<std::size_t>(c.rowBytes)))
-          << row;
-    }
+    // The same picture without padding.
+    EXPECT_EQ(sent->memory, VideoCapture(c.fourcc, 16, 4, c.rowBytes)->bytes);
     EXPECT_EQ(info, (MediaInfo{16, 4, 30000, 1001, 0, 0}));
   }
 }
@@ -142,11 +139,9 @@ TEST_F(NdiSource, BadFramesAndBuffersLoseOnlyThatFrameWithItsLine) {
   EXPECT_TRUE(callbacks->Seen().calls.empty());
   // The largest describable frame is taken.
   ASSERT_TRUE(Deliver(VideoCapture(kNdiFourCCNV12, 32767, 1, 32767)));
-  EXPECT_EQ(int{callbacks->Seen().videoSent.back()->format_.width}, 32767);
-  EXPECT_TRUE(Deliver(AnyVideo()));
   callbacks->OverrideVideoFormat(pm::VideoFormat{pm::kCode2vuy, 1920, 1080});
   EXPECT_FALSE(Deliver(AnyVideo()));
-  EXPECT_EQ(callbacks->Seen().videoSent.size(), 2u);  // the largest and the good one
+  EXPECT_EQ(callbacks->Seen().videoSent.size(), 1u);  // the largest
   callbacks->OverrideAudioBytes(2 * 16 * 4 - 1);
   EXPECT_FALSE(Deliver(AudioCapture(48000, 2, 16)));
   EXPECT_TRUE(logs.Contains("#ndisource: audio buffer too small for the NDI audio frame\n"));
@@ -378,10 +373,9 @@ TEST_F(NdiSource, PtzSupportIsReportedWithTheModelNameAndAgainWhenTheNameArrives
 // back on the same receiver; while stopped they are dropped.
 TEST_F(NdiSource, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.1}});
+  ndi.SetConnections(0);
   ndi.Push(AnyVideo());
   source->Start();
-  UntilStates({1, 2});
-  ndi.SetConnections(0);
   UntilStates({1, 2, 3});
   EXPECT_EQ(source->PublishedMediaInfo(), MediaInfo{});
   source->ExecutePtzCommand({{"command", "Zoom"}, {"zoom", 0.5}});
@@ -402,45 +396,25 @@ TEST_F(NdiSource, PtzWhileStoppedIsDroppedAndInIdleWaitsForAFrame) {
 // Video: size and rate to two decimals (none without a rate); audio: channels
 // and rate to one decimal under 48 kHz; empty without a size or channels.
 TEST(StatusText, VideoAndAudioLines) {
-  const auto video = [](int w, int h, int n, int d) { return TaskNDISource::VideoStatusText(MediaInfo{w, h, n, d, 0, 0}); };
-  const auto audio = [](int rate, int channels) {
-    return TaskNDISource::AudioStatusText(MediaInfo{0, 0, 0, 0, rate, channels});
+  const std::pair<MediaInfo, const char*> cases[] = {
+      {{1920, 1080, 25, 2}, "1920x1080 @ 12.50 fps"},
+      {{1280, 720, 30, 0}, "1280x720"},
+      {{1280, -1, 30, 1}, ""},
+      {{16, 16, 2147483647, 1}, "16x16 @ 2147483647 fps"},  // would overflow when scaled
+      {{0, 0, 0, 0, 44100, 1}, "Mono @ 44.1 kHz"},
+      {{0, 0, 0, 0, 22050, 2}, "Stereo @ 22.0 kHz"},
+      {{0, 0, 0, 0, 0, 2}, "Stereo"},
+      {{0, 0, 0, 0, 48000, 0}, ""},
   };
-  const std::pair<std::string, const char*> cases[] = {
-      {video(1920, 1080, 25, 2), "1920x1080 @ 12.50 fps"},
-      {video(1280, 720, 30, 0), "1280x720"},
-      {video(1280, -1, 30, 1), ""},
-      {video(16, 16, 2147483647, 1), "16x16 @ 2147483647 fps"},  // would overflow when scaled
-      {audio(44100, 1), "Mono @ 44.1 kHz"},
-      {audio(22050, 2), "Stereo @ 22.0 kHz"},
-      {audio(0, 2), "Stereo"},
-      {audio(48000, 0), ""},
-  };
-  for (const auto& [text, expected] : cases) EXPECT_EQ(text, expected);
-}
-
-// The panel as the host gets it, byte for byte.
-TEST_F(NdiSource, StatusPanelIsExact) {
-  NDISource::Config config;
-  config.bandwidth = "ndi_bandwidth_audio_only";
-  EXPECT_EQ(source->BuildStatusGui(config, ReceiverState::Error),
-            R"({"audio":{"ghosted":false,"indication":0,"justification":108,"pm::order":4,)"
-            R"("title":"ndi_audio_status_label","type":"static_text","value":"","visible":true},)"
-            R"("bandwidth":{"ghosted":false,"pm::order":0,"title":"ndi_bandwidth_label","type":"popup",)"
-            R"("value":2,"valueSetID":"","values":["ndi_bandwidth_highest","ndi_bandwidth_lowest",)"
-            R"("ndi_bandwidth_audio_only"],"visible":true},)"
-            R"("reconnect":{"action":1668641652,"command":"taskndisource::reconnect","ghosted":false,)"
-            R"("pm::order":1,"title":"ndi_reconnect_button","type":"button","visible":true},)"
-            R"("status":{"ghosted":false,"indication":101,"justification":108,"pm::order":2,)"
-            R"("title":"p_status_label","type":"static_text","value":"taskvistafeed_status_error",)"
-            R"("visible":true},)"
-            R"("video":{"ghosted":false,"indication":0,"justification":108,"pm::order":3,)"
-            R"("title":"ndi_video_status_label","type":"static_text","value":"","visible":true}})");
+  for (const auto& [info, text] : cases) {
+    EXPECT_EQ(TaskNDISource::VideoStatusText(info) + TaskNDISource::AudioStatusText(info), text);
+  }
 }
 
 // The pop-up's index becomes the bandwidth's name (leniently read, out of
 // range the first), and a configuration comes back through the panel as it
-// was; text that is not JSON gives nothing.
+// was; text that is not JSON gives nothing. The panel's button sends the
+// command a reconnect is run by.
 TEST_F(NdiSource, PanelAndConfigurationTranslateBothWays) {
   const std::pair<const char*, const char*> cases[] = {
       {R"({"bandwidth":{"value":0}})", "ndi_bandwidth_highest"},
@@ -456,6 +430,7 @@ TEST_F(NdiSource, PanelAndConfigurationTranslateBothWays) {
   EXPECT_EQ(source->GuiToConfiguration("{not json"), "");
   EXPECT_EQ(source->ConfigurationToGui("{not json"), "");
   EXPECT_EQ(Json::parse(source->ConfigurationToGui(R"({"bandwidth":5})"))["bandwidth"]["value"], 0);
+  EXPECT_EQ(Json::parse(source->ConfigurationToGui("{}"))["reconnect"]["command"], "taskndisource::reconnect");
 }
 
 // ============================================================= Receiver loop
@@ -525,7 +500,7 @@ TEST_F(NdiSource, ErrorsAreToldAndKeptUntilAReconnect) {
 // never sent. A status change reports PTZ support with the model name of the
 // metadata before it; every frame handed out is freed.
 TEST_F(NdiSource, ConnectedSenderIsToldTallyDocumentsAndEventsThenReceives) {
-  ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{std::nullopt, "10.0.0.2:1"}, Entry{kName, kUrl},
+  ndi.SetSources({Entry{"OTHER (x)", "10.0.0.1:1"}, Entry{nullptr, "10.0.0.2:1"}, Entry{kName, kUrl},
                   Entry{kName, "10.0.0.3:1"}});
   ndi.SetPtzSupported(true);
   source->HandleShotEvent("TALLY_PREVIEW_ON");
