@@ -11,8 +11,9 @@
 // FakeCallbacks: the host's side of a source, noting every call in order as
 // text ("state 1", "reset", "production 3", "video 1234", "audio 0",
 // "buildout 352800000", "ptz NDI3/Model", "gui"), with buffers over plain
-// memory. TestEnvironment: a loop environment on the manual clock whose exit
-// hook counts instead of ending the process.
+// memory. TestEnvironment: a loop environment on the manual clock; a loop that
+// misses the stop deadline aborts the test binary at once (production ends
+// the process the same way).
 
 #include <algorithm>
 #include <atomic>
@@ -41,10 +42,7 @@ namespace nditest {
 
 struct TestEnvironment {
   std::shared_ptr<pmtest::ManualClock> clock = std::make_shared<pmtest::ManualClock>();
-  std::shared_ptr<std::atomic<int>> exits = std::make_shared<std::atomic<int>>(0);
-  TaskNDISource::LoopEnvironment Make() const {
-    return {clock, std::chrono::seconds(5), [counter = exits] { ++*counter; }};
-  }
+  TaskNDISource::LoopEnvironment Make() const { return {clock, std::chrono::seconds(5), [] { std::abort(); }}; }
 };
 
 // One result of recv_capture_v2, with storage for the data it points at.
@@ -187,7 +185,6 @@ class ScriptedNdi {
     ScriptedNdi& n = Current();
     std::unique_lock<std::mutex> lock(n.mutex_);
     ++n.seen_.captures;
-    n.changed_.notify_all();
     n.changed_.wait(lock, [&] { return !n.block_; });
     if (n.queue_.empty()) n.changed_.wait_for(lock, std::chrono::milliseconds(1), [&] { return !n.queue_.empty(); });
     if (n.queue_.empty()) return kNdiFrameNone;
@@ -210,10 +207,8 @@ class ScriptedNdi {
     call << name << '(';
     [[maybe_unused]] const char* separator = "";
     ((call << separator << args, separator = ","), ...);
-    return Locked([&](ScriptedNdi& n) {
-      n.seen_.ptzCalls.push_back(call.str() + ")");
-      return true;
-    });
+    Locked([&](ScriptedNdi& n) { n.seen_.ptzCalls.push_back(call.str() + ")"); });
+    return true;
   }
 
   std::mutex mutex_;  // guards everything below
