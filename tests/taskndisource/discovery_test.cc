@@ -3,8 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-
 #include "ndi_harness.h"
 #include "support/log_capture.h"
 #include "support/wait.h"
@@ -100,10 +98,10 @@ TEST_F(DiscoveryTest, ScansDoubleTo4sUntilAStopAndARestartKeepsTheTable) {
 }
 
 TEST_F(DiscoveryTest, FinderThatCannotBeCreatedEndsTheLoopUntilTheNextStart) {
-  ndi.FailFinderCreate(true);
+  ndi.FailCreate("finder");
   discovery->Start();
   ASSERT_TRUE(pmtest::WaitFor([&] { return logs.Contains("#ndisource: failed to create NDI source finder\n"); }));
-  ndi.FailFinderCreate(false);
+  ndi.FailCreate("");
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Start();
   NextScan();

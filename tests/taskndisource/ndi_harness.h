@@ -150,8 +150,8 @@ class ScriptedNdi {
 
   // Script.
   void SetSources(std::vector<Entry> entries) { Edit([&] { entries_ = std::move(entries); }); }
-  void FailFinderCreate(bool fail) { Edit([&] { failFinder_ = fail; }); }
-  void FailReceiverCreate(bool fail) { Edit([&] { failReceiver_ = fail; }); }
+  // Making a "finder" or a "receiver" fails; "" for neither.
+  void FailCreate(std::string what) { Edit([&] { failing_ = std::move(what); }); }
   void SetConnections(int count) { Edit([&] { connections_ = count; }); }
   void SetTallyResult(bool ok) { Edit([&] { tallyOk_ = ok; }); }
   void SetMetadataResult(bool ok) { Edit([&] { metadataOk_ = ok; }); }
@@ -216,8 +216,7 @@ class ScriptedNdi {
   Observed seen_;
   std::vector<Entry> entries_;
   std::vector<ndi_source> list_;  // handed out by the finder, valid until its next list
-  bool failFinder_ = false;
-  bool failReceiver_ = false;
+  std::string failing_;
   int connections_ = 1;
   bool tallyOk_ = true;
   bool metadataOk_ = true;
@@ -340,7 +339,7 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   auto api = std::make_shared<TaskNDISource::NdiApi>();
   api->find_create_v2 = [](const ndi_find_create* settings) {
     return Locked([&](ScriptedNdi& n) -> void* {
-      if (n.failFinder_ || settings == nullptr || !settings->show_local_sources) return nullptr;
+      if (n.failing_ == "finder" || settings == nullptr || !settings->show_local_sources) return nullptr;
       ++n.seen_.findersCreated;
       n.seen_.maxLiveFinders = std::max(n.seen_.maxLiveFinders, n.seen_.findersCreated - n.seen_.findersDestroyed);
       return &n;  // any handle will do
@@ -357,7 +356,7 @@ inline std::shared_ptr<const TaskNDISource::NdiApi> ScriptedNdi::Api() const {
   api->find_destroy = [](void*) { Locked([](ScriptedNdi& n) { ++n.seen_.findersDestroyed; }); };
   api->recv_create_v2 = [](const ndi_recv_create* s) {
     return Locked([&](ScriptedNdi& n) -> void* {
-      if (n.failReceiver_) return nullptr;
+      if (n.failing_ == "receiver") return nullptr;
       const ndi_source& to = s->source_to_connect_to;
       n.seen_.receivers.push_back(ReceiverCreated{to.ndi_name ? to.ndi_name : "", to.url_address ? to.url_address : "",
                                                   s->color_format, s->bandwidth, s->allow_video_fields});
