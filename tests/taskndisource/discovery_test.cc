@@ -80,7 +80,7 @@ TEST_F(DiscoveryTest, ScansDoubleTo4sUntilAStopAndARestartKeepsTheTable) {
   ndi.SetSources({Entry{"A (x)", "10.0.0.1:1"}});
   discovery->Stop();  // nothing runs: the signal must not outlive this call's purpose
   discovery->Start();
-  EXPECT_EQ(env.clock->AwaitWait(1), 125);
+  ASSERT_EQ(env.clock->AwaitWait(1), 125);
   EXPECT_EQ(ndi.Seen().listCalls, 0);
   std::vector<std::int64_t> intervals;
   for (int scan = 1; scan <= 7; ++scan) intervals.push_back(NextScan());
@@ -90,7 +90,7 @@ TEST_F(DiscoveryTest, ScansDoubleTo4sUntilAStopAndARestartKeepsTheTable) {
   EXPECT_EQ(ndi.Seen().findersDestroyed, 1);
   discovery->Start();
   discovery->Start();  // a second start while running is ignored
-  EXPECT_EQ(env.clock->AwaitWait(++waits), 125);  // after the first loop's eight waits
+  ASSERT_EQ(env.clock->AwaitWait(++waits), 125);  // after the first loop's eight waits
   NextScan();
   EXPECT_EQ(callbacks->Seen().calls.size(), 1u);  // still there: not announced again
   EXPECT_EQ(ndi.Seen().findersCreated, 2);

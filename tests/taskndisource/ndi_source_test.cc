@@ -552,7 +552,7 @@ TEST_P(ListedUrl, MakesTheReceiverAgainOnlyForAnotherListedUrl) {
   env.clock->AdvanceMs(250);
   if (c.madeAgainFor != nullptr) {
     Until([&] { return ndi.Seen().receivers.size() == 2; });
-    EXPECT_EQ(ndi.Seen().receivers[1].url, c.madeAgainFor);
+    EXPECT_EQ(ndi.Seen().receivers.at(1).url, c.madeAgainFor);
     EXPECT_EQ(ndi.Seen().receiversDestroyed, 1);
     ndi.Push(AnyVideo());
   } else {
