@@ -479,10 +479,10 @@ TEST_F(NdiSource, ConnectedSenderIsToldTallyDocumentsAndEventsThenReceives) {
   ndi.SetPtzSupported(true);
   source->HandleShotEvent("TALLY_PREVIEW_ON");
   source->HandleShotEvent("Cut before start");
-  for (const auto& frame : {AnyVideo(), nditest::MetadataCapture(R"(<ndi_product model_name="Cam"/>)"),
-                            nditest::MetadataCapture("", kNdiFrameStatusChange), nditest::MetadataCapture("", kNdiFrameError)}) {
-    ndi.Push(frame);
-  }
+  ndi.Push(AnyVideo());
+  ndi.Push(nditest::MetadataCapture(R"(<ndi_product model_name="Cam"/>)"));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameStatusChange));
+  ndi.Push(nditest::MetadataCapture("", kNdiFrameError));
   source->Start();
   UntilStates({1, 2});
   // One panel for Connecting, one for Receiving with the media format (each
