@@ -19,42 +19,6 @@ namespace {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-struct Output {
-  int status = -1;
-  std::string out, err;
-};
-
-std::string Replace(std::string text, const std::string& from, const std::string& to) {
-  for (std::size_t at = text.find(from); at != std::string::npos; at = text.find(from, at + to.size())) {
-    text.replace(at, from.size(), to);
-  }
-  return text;
-}
-
-// Runs a program to its end with standard output and error apart.
-Output RunProgram(const std::string& path, const std::vector<std::string>& args, const pmtest::Folder& folder) {
-  Output result;
-  std::mutex lock;  // guards result.out
-  {
-    pmhost::ChildProcess child;
-    pmhost::ChildOptions o;
-    o.path = path;
-    o.args = args;
-    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-    o.stderrPath = folder.path + "/stderr.txt";
-    o.captureStdout = true;
-    o.onLine = [&](const std::string& line) {
-      std::lock_guard<std::mutex> guard(lock);
-      result.out += line + "\n";
-    };
-    if (!child.Start(std::move(o))) return result;
-    result.status = child.Wait(90s).value_or(-2);
-  }  // joins the reader of standard output
-  std::ifstream in(folder.path + "/stderr.txt");
-  result.err.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-  return result;
-}
-
 struct Case {
   const char* name;
   const char* program;  // its path
@@ -88,22 +52,43 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
                        << "kill -9 $pid\nwait $pid\n";
   ::chmod(dying.c_str(), 0755);
 
-  std::vector<std::string> args;
+  // Run to its end, standard output and error apart.
+  pmhost::ChildOptions o;
+  o.path = c.program;
+  const std::pair<std::string, std::string> names[] = {
+      {"{folder}", folder.path}, {"{dying-runner}", dying}, {"{sender}", c.sender ? sender.Name() : ""}};
   for (std::string arg : c.args) {
-    arg = Replace(arg, "{folder}", folder.path);
-    arg = Replace(arg, "{dying-runner}", dying);
-    args.push_back(Replace(arg, "{sender}", c.sender ? sender.Name() : ""));
+    for (const auto& [name, value] : names) {
+      if (const std::size_t at = arg.find(name); at != std::string::npos) arg.replace(at, name.size(), value);
+    }
+    o.args.push_back(arg);
   }
-  const Output run = RunProgram(c.program, args, folder);
-  EXPECT_EQ(run.status, c.status) << run.err;
+  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  o.stderrPath = folder.path + "/stderr.txt";
+  o.captureStdout = true;
+  std::mutex lock;  // guards out
+  std::string out;
+  o.onLine = [&](const std::string& line) {
+    std::lock_guard<std::mutex> guard(lock);
+    out += line + "\n";
+  };
+  int status = -1;
+  {
+    pmhost::ChildProcess child;
+    ASSERT_TRUE(child.Start(std::move(o)));
+    status = child.Wait(90s).value_or(-2);
+  }  // joins the reader of standard output
+  std::ifstream in(folder.path + "/stderr.txt");
+  const std::string err{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+  EXPECT_EQ(status, c.status) << err;
   if (c.out != nullptr) {
-    EXPECT_TRUE(*c.out == '\0' ? run.out.empty() : run.out.find(c.out) != std::string::npos) << run.out;
+    EXPECT_TRUE(*c.out == '\0' ? out.empty() : out.find(c.out) != std::string::npos) << out;
   }
-  EXPECT_NE(run.err.find(c.err), std::string::npos) << run.err;
+  EXPECT_NE(err.find(c.err), std::string::npos) << err;
   if (c.json) {
-    const json document = json::parse(run.out, nullptr, false);
-    ASSERT_TRUE(document.is_object()) << run.out;
-    EXPECT_GE(document.value("frames", 0), 10) << run.out;
+    const json document = json::parse(out, nullptr, false);
+    ASSERT_TRUE(document.is_object()) << out;
+    EXPECT_GE(document.value("frames", 0), 10) << out;
     EXPECT_EQ(document.value("source", ""), sender.Name());
   }
 }

@@ -96,19 +96,14 @@ void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
     return std::vector<std::string>{"--pattern", "blocks", "--width", std::to_string(width), "--height",
                                     std::to_string(width * 9 / 16), "--fps", "30", "--no-audio"};
   };
-  auto own = std::make_unique<Sender>();
-  ASSERT_TRUE(own->Start(folder, "Own", args(kOwnWidth)));
-  const std::string id = pmhost::kSourceIdPrefix + own->Name();
-  own->Process().Signal(SIGKILL);
-  ASSERT_TRUE(own->Process().Wait(kPatience).has_value());
-  Sender other;
+  Sender own, other, again;
+  ASSERT_TRUE(own.Start(folder, "Own", args(kOwnWidth)));
+  const std::string id = pmhost::kSourceIdPrefix + own.Name();
+  own.Process().Signal(SIGKILL);
+  ASSERT_TRUE(own.Process().Wait(kPatience).has_value());
   bool up = false;
-  std::thread starts([&] {
-    up = other.Start(folder, "Other", args(kOtherWidth));
-    auto again = std::make_unique<Sender>();
-    up = again->Start(folder, "Own", args(kOwnWidth)) && up;
-    own = std::move(again);
-  });
+  std::thread starts(
+      [&] { up = other.Start(folder, "Other", args(kOtherWidth)) && again.Start(folder, "Own", args(kOwnWidth)); });
   std::mutex lock;  // guards widths
   std::vector<int> widths;
   std::atomic<bool> stop{false};

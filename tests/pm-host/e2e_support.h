@@ -256,11 +256,6 @@ class Reports {
     auto found = states_.find(id);
     return found == states_.end() ? std::vector<int>{} : found->second;
   }
-  // Whether `id` reported `state` after its first `from` reports.
-  bool ReportedSince(const std::string& id, std::size_t from, int state) const {
-    const std::vector<int> s = States(id);
-    return s.size() > from && std::find(s.begin() + static_cast<long>(from), s.end(), state) != s.end();
-  }
   // How often discovery announced `id`.
   int Announced(const std::string& id) const {
     std::lock_guard<std::mutex> guard(lock_);
