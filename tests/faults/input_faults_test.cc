@@ -36,11 +36,8 @@
 namespace {
 
 using nlohmann::json;
-using namespace std::chrono_literals;
 
-using pmtest::Folder;
 using pmtest::RampSink;
-using pmtest::Sender;
 using pmtest::SegmentsOf;
 using pmtest::kPatience;
 
@@ -81,7 +78,7 @@ TEST_P(Channels, ArriveIntactUpTo127AndAreRefusedWithOneLineFrom128) {
   args.insert(args.end(), {"--audio-rate", "48000", "--audio-channels", std::to_string(channels)});
   ASSERT_NO_FATAL_FAILURE(c.Start("Channels", args));
   ASSERT_NO_FATAL_FAILURE(ReceiveUntil(c, [&] {
-    return fits ? c.sink.Sounds() >= 15 : c.sink.Pictures() >= 15 && c.Log().find(refusal) != std::string::npos;
+    return fits ? c.sink.Sounds() >= 15 : c.sink.Videos() >= 15 && c.Log().find(refusal) != std::string::npos;
   }));
   const std::string log = c.Log();
   EXPECT_EQ(pmtest::Occurrences(log, refusal), fits ? 0 : 1) << log;
@@ -130,8 +127,8 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
 // so this is also the whole chain's case of 'rgba' pictures (the other cases
 // carry '2vuy').
 TEST_F(InputFaults, UnknownAndRepeatedTokensAndASecondReaderLeaveThePicturesFlowingIntact) {
-  Folder folder;
-  Sender sender;
+  pmtest::Folder folder;
+  pmtest::Sender sender;
   std::vector<std::string> args = kSmallPictures;
   args.insert(args.end(), {"--format", "bgra", "--no-audio"});
   ASSERT_TRUE(sender.Start(folder, "Tokens", args));
@@ -207,7 +204,7 @@ TEST_F(InputFaults, UnknownAndRepeatedTokensAndASecondReaderLeaveThePicturesFlow
   for (std::uint32_t token : repeated) EXPECT_GE(told(token), 1) << token << "\n" << log;
   pmtest::ExpectBackAtLevel(pid, *level, "after the tokens and the refused readers");
   EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
-  EXPECT_EQ(sink.Pictures(), 5 + 9 + 3 + 10);
+  EXPECT_EQ(sink.Videos(), 5 + 9 + 3 + 10);
   // The last stop_source ends the runner in order, having removed its
   // segments.
   EXPECT_TRUE(host.WriteJson(pmtest::Request("pm::tsrc::stop_source", 2, {{"unique_id", id}})));

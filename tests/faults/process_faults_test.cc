@@ -40,7 +40,6 @@ namespace {
 using nlohmann::json;
 using namespace std::chrono_literals;
 using pmtest::Chain;
-using pmtest::Folder;
 using pmtest::ProcessUsage;
 using pmtest::Sender;
 using pmtest::SegmentsOf;
@@ -219,7 +218,7 @@ struct Subreaper {
 TEST_F(ProcessFaults, ARunnerWhoseHostIsKilledEndsWithin5sAndLeavesNothingInDevShm) {
   Subreaper reaper;
   ASSERT_TRUE(reaper.enabled);
-  Folder folder;
+  pmtest::Folder folder;
   Sender sender;
   ASSERT_TRUE(sender.Start(folder, "Orphan", Small("60")));
 

@@ -47,8 +47,7 @@ bool Sender::Start(const Folder& folder, const std::string& name, std::vector<st
     std::lock_guard<std::mutex> guard(lock_);
     if (event.is_object()) events_.push_back(std::move(event));
   };
-  if (!process_.Start(std::move(o))) return false;
-  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, kPatience);
+  return process_.Start(std::move(o)) && WaitFor("ready");
 }
 
 json Sender::Find(const std::string& kind, const std::function<bool(const json&)>& match) {
@@ -64,12 +63,10 @@ bool Sender::WaitFor(const std::string& kind, const std::function<bool(const jso
 }
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
-  pmhost::HostOptions o;
-  o.runnerPath = PM_RUNNER_PATH;
-  o.modulePath = PM_MODULE_PATH;
-  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-  o.runnerLog = folder.RunnerLog();
-  return o;
+  return {.runnerPath = PM_RUNNER_PATH,
+          .modulePath = PM_MODULE_PATH,
+          .env = {{"NDI_LOOPBACK_DIR", folder.Registry()}},
+          .runnerLog = folder.RunnerLog()};
 }
 
 pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
@@ -92,10 +89,7 @@ int SegmentsOf(const std::vector<std::string>& bases) {
 
 void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
   constexpr int kOwnWidth = 640, kOtherWidth = 320;
-  auto args = [](int width) {
-    return std::vector<std::string>{"--pattern", "blocks", "--width", std::to_string(width), "--height",
-                                    std::to_string(width * 9 / 16), "--fps", "30", "--no-audio"};
-  };
+  const auto args = [](int width) { return BlocksArgs(width, width * 9 / 16, {"--no-audio"}); };
   Sender own, other, again;
   ASSERT_TRUE(own.Start(folder, "Own", args(kOwnWidth)));
   const std::string id = pmhost::kSourceIdPrefix + own.Name();

@@ -5,7 +5,6 @@
 // and probes of a process's and /dev/shm's state.
 #include <sys/types.h>
 
-#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <cstdint>
@@ -149,8 +148,7 @@ class RampSink : public pmhost::FrameSink {
     return holding_ > 0 && !open_;
   }
   // Pictures of one source, or of all.
-  int Videos(const std::string& id) const { return Count(id, &Stream::pictures); }
-  int Pictures() const { return Count({}, &Stream::pictures); }
+  int Videos(const std::string& id = {}) const { return Count(id, &Stream::pictures); }
   int Sounds() const { return Count({}, &Stream::sounds); }
   // Every fault seen, in order (empty when everything arrived intact).
   std::vector<std::string> Problems() const {
@@ -196,6 +194,14 @@ class RampSink : public pmhost::FrameSink {
   std::set<int> channels_;
   std::vector<std::string> problems_;
 };
+
+// ndi-testsrc's arguments for the "blocks" pattern at 30 fps, then `more`.
+inline std::vector<std::string> BlocksArgs(int width, int height, std::vector<std::string> more = {}) {
+  std::vector<std::string> args = {"--pattern", "blocks", "--width", std::to_string(width),
+                                   "--height",  std::to_string(height), "--fps", "30"};
+  args.insert(args.end(), more.begin(), more.end());
+  return args;
+}
 
 // Host options for the built runner and module in the folder's registry.
 pmhost::HostOptions HostOptionsFor(const Folder& folder);
@@ -277,8 +283,6 @@ class Reports {
 struct Chain {
   explicit Chain(bool ramp = true) : sink(ramp) {}
   ~Chain() { sink.Open(); }
-  Chain(const Chain&) = delete;
-  Chain& operator=(const Chain&) = delete;
   pmhost::Session& Session() { return host.GetSession(); }
   pid_t Runner() const { return host.RunnerPid(); }
   std::string Log() const { return folder.ReadRunnerLog(); }
@@ -306,8 +310,7 @@ struct Chain {
   std::string QueueBase() {
     std::string base;
     WaitFor([&] {
-      const auto queue = Session().Queue(id);
-      if (queue) base = queue->MemoryBase();
+      if (const auto queue = Session().Queue(id)) base = queue->MemoryBase();
       return !base.empty();
     }, kPatience);
     return base;

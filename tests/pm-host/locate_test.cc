@@ -37,9 +37,8 @@ TEST_P(Locate, FindsEachCompanionWhereTheLayoutPutsIt) {
     const std::string path = pmhost::LocateIn(companion, folder);
     return path.empty() ? path : fs::relative(path, tree).string();
   };
-  EXPECT_EQ(found(Companion::Runner), c.runner);
-  EXPECT_EQ(found(Companion::Module), c.module);
-  EXPECT_EQ(found(Companion::Sender), c.sender);
+  EXPECT_EQ(std::vector<std::string>({found(Companion::Runner), found(Companion::Module), found(Companion::Sender)}),
+            std::vector<std::string>({c.runner, c.module, c.sender}));
   fs::remove_all(tree);
 }
 

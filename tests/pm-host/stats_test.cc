@@ -20,9 +20,7 @@ TEST(ReceiveStats, CountsMissingPicturesFromGapsInMediaTimeAndSoundSecondsFromSa
   send(23);  // 20, 21, 22 missing
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);
   // A lost connection is not a drop: the sender was away.
-  stats.State(3);
-  stats.State(1);
-  stats.State(2);
+  for (int state : {3, 1, 2}) stats.State(state);
   send(500);
   send(501);
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);

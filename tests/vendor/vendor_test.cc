@@ -30,6 +30,7 @@ namespace {
 
 using nlohmann::json;
 using namespace std::chrono_literals;
+using pmtest::BlocksArgs;
 using pmtest::Folder;
 using pmtest::Sender;
 
@@ -43,13 +44,6 @@ constexpr char kSkipped[] =
     "vendor tests skipped: not inside scripts/ndi-sandbox (PM_NDI_SANDBOX is not 1), and the vendor runtime's "
     "discovery never runs on the machine's own network";
 
-std::vector<std::string> Blocks(int width, int height, std::vector<std::string> more = {}) {
-  std::vector<std::string> args = {"--pattern", "blocks", "--width", std::to_string(width),
-                                   "--height",  std::to_string(height), "--fps", "30"};
-  args.insert(args.end(), more.begin(), more.end());
-  return args;
-}
-
 // The camera every case may use: 1920x1080 UYVY at 30 fps with 48 kHz stereo,
 // PTZ and a model name.
 struct Camera : ::testing::Environment {
@@ -58,8 +52,8 @@ struct Camera : ::testing::Environment {
     folder = std::make_unique<Folder>();
     sender = std::make_unique<Sender>();
     up = sender->Start(*folder, "Vendor Camera",
-                       Blocks(1920, 1080, {"--ptz", "--model", "PX-7", "--audio-rate", "48000", "--audio-channels",
-                                           "2", "--seconds", "900"}));
+                       BlocksArgs(1920, 1080, {"--ptz", "--model", "PX-7", "--audio-rate", "48000", "--audio-channels",
+                                               "2", "--seconds", "900"}));
   }
   void TearDown() override {
     sender.reset();
@@ -152,7 +146,7 @@ class Vendor : public ::testing::Test {
 
 TEST_F(Vendor, DiscoveryListsTwoSendersAndWithdrawsAKilledOne) {
   Sender other;
-  ASSERT_TRUE(other.Start(Place(), "Vendor Brief", Blocks(640, 360, {"--no-audio"})));
+  ASSERT_TRUE(other.Start(Place(), "Vendor Brief", BlocksArgs(640, 360, {"--no-audio"})));
   std::mutex lock;  // guards seen, gone
   std::set<std::string> seen, gone;
   std::atomic<bool> stop{false};
@@ -227,7 +221,7 @@ TEST_F(Vendor, SendersArriveWholeAndInOrderInTheHostCodeOfTheColourFormat) {
     const bool camera = std::string(format) == "uyvy";
     Sender sender;
     ASSERT_TRUE(camera || sender.Start(Place(), std::string("Vendor ") + format,
-                                       Blocks(640, 360, {"--format", format, "--no-audio"})));
+                                       BlocksArgs(640, 360, {"--format", format, "--no-audio"})));
     Watch watch;
     pmhost::ReceiveOptions o = From(camera ? Cam() : sender, watch);
     o.frames = camera ? 90 : 30;
@@ -252,31 +246,31 @@ TEST_F(Vendor, SendersArriveWholeAndInOrderInTheHostCodeOfTheColourFormat) {
 }
 
 TEST_F(Vendor, AKilledSenderGives3AndItsReturn1Then2AndPicturesAgain) {
-  const std::vector<std::string> args = Blocks(640, 360, {"--no-audio"});
-  auto sender = std::make_unique<Sender>();
-  ASSERT_TRUE(sender->Start(Place(), "Vendor Phoenix", args));
+  const std::vector<std::string> args = BlocksArgs(640, 360, {"--no-audio"});
+  Sender first, again;
+  ASSERT_TRUE(first.Start(Place(), "Vendor Phoenix", args));
   Watch watch;
   std::atomic<bool> stop{false};
   bool restarted = false;
   std::vector<int> afterDeath, afterReturn;
   int before = 0;
-  pmhost::ReceiveOptions o = From(*sender, watch);
+  pmhost::ReceiveOptions o = From(first, watch);
   o.seconds = 120;
   o.interrupted = &stop;
   o.whileReceiving = [&](pmhost::Session&, const std::string&) {
+    // The states reported after the first `mark`.
     auto since = [&](std::size_t mark) {
       const std::vector<int> s = watch.Now().states;
       return std::vector<int>(s.begin() + static_cast<long>(std::min(mark, s.size())), s.end());
     };
     if (pmtest::WaitFor([&] { return watch.Now().Pictures() > 0; }, 20s)) {
       const std::size_t mark = watch.Now().states.size();
-      sender->Process().Signal(SIGKILL);
-      sender->Process().Wait(10s);
+      first.Process().Signal(SIGKILL);
+      first.Process().Wait(10s);
       pmtest::WaitFor([&] { return std::ranges::count(since(mark), 3) > 0; }, 20s);
       afterDeath = since(mark);
       const std::size_t back = watch.Now().states.size();
-      sender = std::make_unique<Sender>();
-      restarted = sender->Start(Place(), "Vendor Phoenix", args);
+      restarted = again.Start(Place(), "Vendor Phoenix", args);
       before = watch.Now().Pictures();
       pmtest::WaitFor([&] { return InOrder(since(back), 1, 2) && watch.Now().Pictures() > before; }, 40s);
       afterReturn = since(back);
