@@ -57,7 +57,7 @@ void ReceiveUntil(pmtest::Chain& c, const std::function<bool()>& done) {
   // when the source stops may name a segment the task has already removed.)
   EXPECT_EQ(c.sink.Problems(), std::vector<std::string>{});
   EXPECT_TRUE(c.Session().StopSource(c.id));
-  c.EndDiscoveryAndExpectOrderlyExit();
+  c.EndAndExpectOrderlyExit();
 }
 
 // --- Channel counts ------------------------------------------------------

@@ -351,9 +351,7 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreRecei
   // Only the optimised build tells: under the sanitizers the runner's
   // allocator and shadow bookkeeping for the pictures it just let go of
   // keep it busy after its sources went idle.
-  if (kWithoutSanitizer) {
-    EXPECT_LT(goneCpu / goneWall, 0.05) << "runner CPU share while the senders were gone";
-  }
+  EXPECT_LT(kWithoutSanitizer ? goneCpu / goneWall : 0.0, 0.05) << "runner CPU share while the senders were gone";
   ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(c.Runner(), *level, "receiving again after the last round"));
   if (kWithoutSanitizer) {
     // The runtime keeps at most 8 queued and 4 pooled pictures for each
@@ -369,12 +367,8 @@ TEST_F(ProcessFaults, SendersKilledMidFrameAndStartedAgainAfterEachDelayAreRecei
     EXPECT_LT(highestPrivate, idle->privateKiB + kSenders * 13 * kPictureKiB + 32 * 1024)
         << "private KiB " << idle->privateKiB << " before the sources, " << level->privateKiB << " receiving";
   }
-  const std::vector<std::string> bases = c.Session().MemoryBases();
-  EXPECT_EQ(bases.size(), static_cast<std::size_t>(kSenders));
-  for (const std::string& id : ids) c.Session().StopSource(id);
-  EXPECT_EQ(c.host.WaitRunner(kPatience), std::optional<int>(0)) << c.Log();
-  EXPECT_EQ(c.host.Stop(), 0);
-  EXPECT_EQ(SegmentsOf(bases), 0);
+  EXPECT_EQ(c.Session().MemoryBases().size(), static_cast<std::size_t>(kSenders));
+  c.EndAndExpectOrderlyExit(ids);
   senders.clear();
 }
 
@@ -395,7 +389,7 @@ TEST_F(ProcessFaults, AThousandSourceStartStopCyclesLeaveNoDescriptorThreadMemor
   const std::vector<std::string> bases = c.Session().MemoryBases();
   EXPECT_EQ(bases.size(), static_cast<std::size_t>(kCycles + 1));
   EXPECT_EQ(SegmentsOf(bases), 0);
-  c.EndDiscoveryAndExpectOrderlyExit();
+  c.EndAndExpectOrderlyExit();
 }
 
 // stop_source may destroy a source's queue at the very moment its listener
@@ -453,12 +447,7 @@ TEST_F(ProcessFaults, TwoHundredDiscoveryStartStopCyclesLeaveNoDescriptorThreadO
   ASSERT_TRUE(c.Session().StartDiscovery());
   EXPECT_TRUE(pmtest::WaitFor([&] { return c.reports.Announced(c.id) > announced; }, kPatience));
   ASSERT_TRUE(c.Session().StopDiscovery());
-  const std::vector<std::string> bases = c.Session().MemoryBases();
-  // The last stop_source ends the task (its reply may not leave first).
-  c.Session().StopSource(c.id);
-  EXPECT_EQ(c.host.WaitRunner(kPatience), std::optional<int>(0)) << c.Log();
-  EXPECT_EQ(c.host.Stop(), 0);
-  EXPECT_EQ(SegmentsOf(bases), 0);
+  c.EndAndExpectOrderlyExit({c.id});
 }
 
 }  // namespace

@@ -40,9 +40,7 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   const Case& c = GetParam();
   pmtest::Folder folder;
   pmtest::Sender sender;
-  if (c.sender) {
-    ASSERT_TRUE(sender.Start(folder, "Cli", {"--width", "64", "--height", "16", "--fps", "60"}));
-  }
+  ASSERT_TRUE(!c.sender || sender.Start(folder, "Cli", {"--width", "64", "--height", "16", "--fps", "60"}));
   // Not a module; and a runner that dies (SIGKILL) once its task has started
   // discovery for the host.
   std::ofstream(folder.path + "/not-a-module.so") << "text";
@@ -52,7 +50,8 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
                        << "kill -9 $pid\nwait $pid\n";
   ::chmod(dying.c_str(), 0755);
 
-  // Run to its end, standard output and error apart.
+  // Run to its end, standard output and error apart (the runner's log goes
+  // with the host's).
   pmhost::ChildOptions o;
   o.path = c.program;
   const std::pair<std::string, std::string> names[] = {
@@ -64,7 +63,7 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
     o.args.push_back(arg);
   }
   o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-  o.stderrPath = folder.path + "/stderr.txt";
+  o.stderrPath = folder.RunnerLog();
   o.captureStdout = true;
   std::mutex lock;  // guards out
   std::string out;
@@ -78,12 +77,9 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
     ASSERT_TRUE(child.Start(std::move(o)));
     status = child.Wait(90s).value_or(-2);
   }  // joins the reader of standard output
-  std::ifstream in(folder.path + "/stderr.txt");
-  const std::string err{std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+  const std::string err = folder.ReadRunnerLog();
   EXPECT_EQ(status, c.status) << err;
-  if (c.out != nullptr) {
-    EXPECT_TRUE(*c.out == '\0' ? out.empty() : out.find(c.out) != std::string::npos) << out;
-  }
+  EXPECT_TRUE(c.out == nullptr || (*c.out == '\0' ? out.empty() : out.find(c.out) != std::string::npos)) << out;
   EXPECT_NE(err.find(c.err), std::string::npos) << err;
   if (c.json) {
     const json document = json::parse(out, nullptr, false);
@@ -93,8 +89,7 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   }
 }
 
-const std::vector<std::string> kHostOptions{"--runner", PM_RUNNER_PATH, "--module", PM_MODULE_PATH,
-                                            "--runner-log", "{folder}/runner.log"};
+const std::vector<std::string> kHostOptions{"--runner", PM_RUNNER_PATH, "--module", PM_MODULE_PATH};
 
 std::vector<std::string> Join(std::vector<std::string> a, const std::vector<std::string>& b) {
   a.insert(a.end(), b.begin(), b.end());

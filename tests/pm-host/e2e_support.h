@@ -106,7 +106,6 @@ class RampSink : public pmhost::FrameSink {
     if (sizes_.empty() || !(sizes_.back().first == size)) sizes_.push_back({size, 0});
     ++sizes_.back().second;
     ++holding_;
-    changed_.notify_all();
     changed_.wait(hold, [this] { return open_; });
     --holding_;
   }
@@ -315,13 +314,16 @@ struct Chain {
     }, kPatience);
     return base;
   }
-  // The orderly end of a tree whose only remaining task work is discovery
-  // (stop_discovery alone does not end the task): stop it, close the
-  // connection, and the runner exits 0 having removed every segment of
-  // every memory base of the run itself.
-  void EndDiscoveryAndExpectOrderlyExit() {
+  // The orderly end of the tree, and the runner exits 0 having removed
+  // every segment of every memory base of the run itself. Given the
+  // running `sources`, stopping them ends the task (the last reply may not
+  // leave first); without, the only remaining task work is discovery, and
+  // stop_discovery alone does not end the task: the connection closes.
+  void EndAndExpectOrderlyExit(const std::vector<std::string>& sources = {}) {
     const std::vector<std::string> bases = Session().MemoryBases();
-    EXPECT_TRUE(Session().StopDiscovery());
+    for (const std::string& source : sources) Session().StopSource(source);
+    EXPECT_EQ(sources.empty() ? std::optional<int>(0) : host.WaitRunner(kPatience), std::optional<int>(0)) << Log();
+    EXPECT_TRUE(!sources.empty() || Session().StopDiscovery());
     EXPECT_EQ(host.Stop(), 0) << Log();
     EXPECT_EQ(SegmentsOf(bases), 0);
     EXPECT_EQ(host.RemovedSegments(), 0) << "an orderly runner removes its own segments";
@@ -332,7 +334,7 @@ struct Chain {
     ASSERT_TRUE(Session().StopSource(id));
     EXPECT_TRUE(WaitFor([&] { return SegmentsOf({base}) == 0; }, kPatience)) << SegmentsOf({base});
     ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(Runner(), level, "after stop_source"));
-    EndDiscoveryAndExpectOrderlyExit();
+    EndAndExpectOrderlyExit();
   }
 
   RampSink sink;  // first: outlives the host's readers
