@@ -86,10 +86,8 @@ void ExpectCyclesLeaveNothing(Chain& c, const char* what, int count, int warmUp,
   ASSERT_NO_FATAL_FAILURE(ExpectBackAtLevel(c.Runner(), *level, "after the cycles"));
   const std::optional<ProcessUsage> after = pmtest::UsageOf(c.Runner());
   ASSERT_TRUE(after);
-  if (kWithoutSanitizer) {
-    EXPECT_LT(after->residentKiB - level->residentKiB, limitKiB)
-        << what << ": resident KiB " << level->residentKiB << " -> " << after->residentKiB;
-  }
+  EXPECT_LT(kWithoutSanitizer ? after->residentKiB - level->residentKiB : 0, limitKiB)
+      << what << ": resident KiB " << level->residentKiB << " -> " << after->residentKiB;
   ExpectBackAtLevel(0, *ownLevel, "the test process");
 }
 

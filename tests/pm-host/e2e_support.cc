@@ -1,6 +1,5 @@
 #include "e2e_support.h"
 
-#include <dirent.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <unistd.h>
@@ -136,10 +135,9 @@ void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder)
 std::optional<ProcessUsage> UsageOf(pid_t pid) {
   const std::string proc = pid == 0 ? "/proc/self" : "/proc/" + std::to_string(pid);
   ProcessUsage usage;
-  DIR* fds = ::opendir((proc + "/fd").c_str());
-  if (fds == nullptr) return std::nullopt;
-  while (const dirent* entry = ::readdir(fds)) usage.descriptors += entry->d_name[0] != '.' ? 1 : 0;
-  ::closedir(fds);
+  std::error_code error;
+  usage.descriptors = static_cast<int>(std::distance(std::filesystem::directory_iterator(proc + "/fd", error), {}));
+  if (error) return std::nullopt;
   if (pid == 0) --usage.descriptors;  // the directory stream itself
   std::ifstream status(proc + "/status");
   if (!status) return std::nullopt;
@@ -183,12 +181,9 @@ std::vector<std::string> SharedMemoryMappedBy(pid_t pid) {
   std::string line;
   const std::string folder = "/dev/shm/";
   while (std::getline(maps, line)) {
-    const std::size_t at = line.find(folder);
-    if (at == std::string::npos) continue;
-    std::string name = line.substr(at + folder.size());
-    const std::size_t deleted = name.find(" (deleted)");
-    if (deleted != std::string::npos) name.resize(deleted);
-    names.insert(name);
+    // The name runs to the end, or to the " (deleted)" of an unlinked entry.
+    const std::size_t at = line.find(folder), from = at + folder.size(), to = line.find(" (deleted)");
+    if (at != std::string::npos) names.insert(line.substr(from, to - from));
   }
   return {names.begin(), names.end()};
 }

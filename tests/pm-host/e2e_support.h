@@ -258,14 +258,12 @@ class Reports {
   }
   std::vector<int> States(const std::string& id) const {
     std::lock_guard<std::mutex> guard(lock_);
-    auto found = states_.find(id);
-    return found == states_.end() ? std::vector<int>{} : found->second;
+    return states_.count(id) != 0 ? states_.at(id) : std::vector<int>{};
   }
   // How often discovery announced `id`.
   int Announced(const std::string& id) const {
     std::lock_guard<std::mutex> guard(lock_);
-    auto found = announced_.find(id);
-    return found == announced_.end() ? 0 : found->second;
+    return announced_.count(id) != 0 ? announced_.at(id) : 0;
   }
 
  private:
@@ -298,13 +296,11 @@ struct Chain {
   // Starts the source until a picture arrives, then stops it: whatever the
   // runtime makes once and keeps is then made before `level` is taken.
   void WarmUp(std::optional<ProcessUsage>* level = nullptr) {
-    const int before = sink.Videos(id);
     ASSERT_TRUE(Session().StartSource(id, nlohmann::json::object()));
-    ASSERT_TRUE(WaitFor([&] { return sink.Videos(id) > before; }, kPatience)) << Log();
+    ASSERT_TRUE(WaitFor([&] { return sink.Videos(id) > 0; }, kPatience)) << Log();
     ASSERT_TRUE(Session().StopSource(id));
-    if (level == nullptr) return;
-    *level = LevelOf(Runner());
-    ASSERT_TRUE(*level);
+    if (level != nullptr) *level = LevelOf(Runner());
+    ASSERT_TRUE(level == nullptr || *level);
   }
   std::string QueueBase() {
     std::string base;
