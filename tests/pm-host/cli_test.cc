@@ -32,8 +32,6 @@ struct Case {
   bool json = false;     // standard output is exactly one JSON document
 };
 
-void PrintTo(const Case& c, std::ostream* os) { *os << c.name; }
-
 class CommandLine : public ::testing::TestWithParam<Case> {};
 
 TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {

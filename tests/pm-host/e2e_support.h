@@ -353,9 +353,7 @@ class OwnLevelKept : public ::testing::Test {
     own_ = UsageOf(0);
     ASSERT_TRUE(own_);
   }
-  void TearDown() override {
-    if (own_) ExpectBackAtLevel(0, *own_, "the test process");
-  }
+  void TearDown() override { if (own_) ExpectBackAtLevel(0, *own_, "the test process"); }
 
  private:
   std::optional<ProcessUsage> own_;

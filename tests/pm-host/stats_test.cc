@@ -21,8 +21,7 @@ TEST(ReceiveStats, CountsMissingPicturesFromGapsInMediaTimeAndSoundSecondsFromSa
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);
   // A lost connection is not a drop: the sender was away.
   for (int state : {3, 1, 2}) stats.State(state);
-  send(500);
-  send(501);
+  for (int frame : {500, 501}) send(frame);
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);
   EXPECT_EQ(stats.Snapshot(0).states, (std::vector<int>{3, 1, 2}));
   // Sound seconds follow the sample count and rate.
