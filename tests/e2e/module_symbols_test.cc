@@ -3,7 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdio>
-#include <regex>
+#include <set>
 #include <sstream>
 #include <string>
 
@@ -11,9 +11,10 @@ namespace {
 
 TEST(TaskModule, ExportsOnlyTheFactory) {
   // What the linker, and the sanitizer and unwinder runtimes, may put into a
-  // shared object.
-  const std::regex kAdded(
-      "_init|_fini|_edata|_end|__bss_start|(__asan|__ubsan|__tsan|__sanitizer|__lsan|__gcov|__cxa_|__gxx_).*");
+  // shared object: these names, and names that begin with one of the "__"
+  // ones and an underscore.
+  const std::set<std::string> added = {"_init",  "_fini",  "_edata",      "_end",   "__bss_start", "__asan", "__ubsan",
+                                       "__tsan", "__lsan", "__sanitizer", "__gcov", "__cxa",       "__gxx"};
   // One line per symbol: name, type, value, size.
   const std::string command = std::string("nm -D --defined-only -P '") + PM_MODULE_PATH + "' 2>&1";
   FILE* pipe = ::popen(command.c_str(), "r");
@@ -29,7 +30,8 @@ TEST(TaskModule, ExportsOnlyTheFactory) {
     if (name == "pmTask_Factory") {
       factoryType = type;
     } else {
-      EXPECT_TRUE(std::regex_match(name, kAdded)) << "exported: " << name << " " << type;
+      EXPECT_TRUE(added.count(name) + added.count(name.substr(0, name.find('_', 2))) > 0)
+          << "exported: " << name << " " << type;
     }
   }
   EXPECT_EQ(factoryType, "T") << output;
