@@ -16,6 +16,7 @@
 // source running ends in order in the killed-host fault case.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <functional>
 #include <memory>
@@ -27,6 +28,7 @@
 #include "pm/shm/queue_record.h"
 #include "pm-host/queue_reader.h"
 #include "pm/ipc/connection.h"
+#include "pm/runtime/proc_stat.h"
 #include "support/host_link.h"
 #include "support/host_socket.h"
 #include "support/wait.h"
@@ -34,11 +36,8 @@
 namespace {
 
 using nlohmann::json;
-using namespace std::chrono_literals;
 
-using pmtest::Folder;
 using pmtest::RampSink;
-using pmtest::Sender;
 using pmtest::SegmentsOf;
 using pmtest::kPatience;
 
@@ -58,7 +57,7 @@ void ReceiveUntil(pmtest::Chain& c, const std::function<bool()>& done) {
   // when the source stops may name a segment the task has already removed.)
   EXPECT_EQ(c.sink.Problems(), std::vector<std::string>{});
   EXPECT_TRUE(c.Session().StopSource(c.id));
-  c.EndDiscoveryAndExpectOrderlyExit();
+  c.EndAndExpectOrderlyExit();
 }
 
 // --- Channel counts ------------------------------------------------------
@@ -79,7 +78,7 @@ TEST_P(Channels, ArriveIntactUpTo127AndAreRefusedWithOneLineFrom128) {
   args.insert(args.end(), {"--audio-rate", "48000", "--audio-channels", std::to_string(channels)});
   ASSERT_NO_FATAL_FAILURE(c.Start("Channels", args));
   ASSERT_NO_FATAL_FAILURE(ReceiveUntil(c, [&] {
-    return fits ? c.sink.Sounds() >= 15 : c.sink.Pictures() >= 15 && c.Log().find(refusal) != std::string::npos;
+    return fits ? c.sink.Sounds() >= 15 : c.sink.Videos() >= 15 && c.Log().find(refusal) != std::string::npos;
   }));
   const std::string log = c.Log();
   EXPECT_EQ(pmtest::Occurrences(log, refusal), fits ? 0 : 1) << log;
@@ -98,18 +97,15 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
   // 16 MB, so only a few of them travel.
   ASSERT_NO_FATAL_FAILURE(c.Start("Zoom", {"--pattern", "ramp", "--sizes", "1920x1080,1280x720,3840x2160",
                                            "--frames-per-size", "6", "--fps", "15", "--no-audio"}));
-  using Size = RampSink::Size;
-  const Size hd{1920, 1080}, small{1280, 720}, uhd{3840, 2160};
   // Done once the host has seen 1080p shrink to 720p, 720p grow to 2160p
   // and 2160p shrink back to 1080p (into the pool's larger segments), with
   // two pictures of the last.
+  const RampSink::Size order[] = {{1920, 1080}, {1280, 720}, {3840, 2160}, {1920, 1080}};
   const auto sawTheSequence = [&] {
     const auto runs = c.sink.SizeRuns();
+    const auto sizeIs = [](const RampSink::Size& size, const auto& run) { return run.first == size; };
     for (std::size_t i = 0; i + 3 < runs.size(); ++i) {
-      if (runs[i].first == hd && runs[i + 1].first == small && runs[i + 2].first == uhd && runs[i + 3].first == hd &&
-          runs[i + 3].second >= 2) {
-        return true;
-      }
+      if (std::equal(order, order + 4, runs.data() + i, sizeIs) && runs[i + 3].second >= 2) return true;
     }
     return false;
   };
@@ -131,31 +127,24 @@ TEST_F(InputFaults, PictureSizeChangesMidStreamKeepEveryPictureIntact) {
 // so this is also the whole chain's case of 'rgba' pictures (the other cases
 // carry '2vuy').
 TEST_F(InputFaults, UnknownAndRepeatedTokensAndASecondReaderLeaveThePicturesFlowingIntact) {
-  Folder folder;
-  Sender sender;
+  pmtest::Folder folder;
+  pmtest::Sender sender;
   std::vector<std::string> args = kSmallPictures;
   args.insert(args.end(), {"--format", "bgra", "--no-audio"});
   ASSERT_TRUE(sender.Start(folder, "Tokens", args));
   pmtest::HostListener listener;
-  pmhost::ChildProcess runner;
-  pmhost::ChildOptions o;
-  o.path = PM_RUNNER_PATH;
-  o.args = {"--module", PM_MODULE_PATH, "--connect", std::to_string(listener.Port())};
-  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-  o.stderrPath = folder.RunnerLog();
-  ASSERT_TRUE(runner.Start(std::move(o)));
+  pmtest::RunnerProcess runner(pmtest::Args(PM_MODULE_PATH, {listener.Port()}),
+                               {{"NDI_LOOPBACK_DIR", folder.Registry()}});
+  ASSERT_TRUE(runner.Started());
   pmtest::HostPeer host = listener.Accept(kPatience);
   ASSERT_TRUE(host.Valid());
   const std::string id = pmhost::kSourceIdPrefix + sender.Name();
-  auto request = [&](const char* command, int n, json body) {
-    body.update({{"pm::command", command}, {"pm::unique_id", n}, {"pm::request", true}, {"unique_id", id}});
-    return host.WriteJson(body);
-  };
-  ASSERT_TRUE(request("pm::tsrc::start_source", 1, {{"config", json::object()}}));
+  ASSERT_TRUE(
+      host.WriteJson(pmtest::Request("pm::tsrc::start_source", 1, {{"unique_id", id}, {"config", json::object()}})));
   json start = json::object();
   while (start.value("pm::command", "") != id + "::start_queue") {
     start = host.ReadJson(kPatience);
-    ASSERT_TRUE(start.is_object()) << folder.ReadRunnerLog();
+    ASSERT_TRUE(start.is_object()) << runner.Stderr();
   }
   const int port = start.value("port", 0);
   const std::string base = start.value("memoryBase", "");
@@ -177,8 +166,8 @@ TEST_F(InputFaults, UnknownAndRepeatedTokensAndASecondReaderLeaveThePicturesFlow
     }
     return true;
   };
-  ASSERT_TRUE(read(5)) << folder.ReadRunnerLog();
-  const pid_t pid = runner.Pid();
+  ASSERT_TRUE(read(5)) << runner.Stderr();
+  const pid_t pid = pm::ChildrenNamed(::getpid(), "pm-runner").at(0);
   const auto level = pmtest::LevelOf(pid);
   ASSERT_TRUE(level.has_value());
 
@@ -197,29 +186,27 @@ TEST_F(InputFaults, UnknownAndRepeatedTokensAndASecondReaderLeaveThePicturesFlow
   // second one is refused, or if the system still lets it in, it is never
   // given a record.
   for (int attempt = 0; attempt < 5; ++attempt) {
-    std::unique_ptr<pm::ipc::Connection> second = pm::ipc::Connection::Open(port);
-    if (!second) continue;
+    const std::unique_ptr<pm::ipc::Connection> second = pm::ipc::Connection::Open(port);
     std::uint8_t wire[pm::kQueueWireRecordBytes];
-    EXPECT_FALSE(second->ReadFromSocket(wire, sizeof wire, 300)) << "a second reader was given a record";
-    second->Close();
+    EXPECT_FALSE(second && second->ReadFromSocket(wire, sizeof wire, 300)) << "a second reader was given a record";
   }
   ASSERT_TRUE(read(10));
 
-  const std::string log = folder.ReadRunnerLog();
-  for (const char* line : {"Token (0) not found.", "Token (1000000) not found.", "Token (2147483647) not found.",
-                           "Token (-2147483648) not found.", "Token (-2) not found.", "Token (-1) not found."}) {
-    EXPECT_EQ(pmtest::Occurrences(log, line), 3) << line << "\n" << log;
-  }
-  for (std::uint32_t token : repeated) {
-    EXPECT_GE(pmtest::Occurrences(log, "Token (" + std::to_string(token) + ") not found."), 1) << token << "\n" << log;
-  }
+  const std::string log = runner.Stderr();
+  // Each unknown token told every time (as the signed number the queue's
+  // log shows), each repeated one at least once.
+  const auto told = [&](std::uint32_t token) {
+    return pmtest::Occurrences(log, "Token (" + std::to_string(static_cast<std::int32_t>(token)) + ") not found.");
+  };
+  for (std::uint32_t token : unknown) EXPECT_EQ(told(token), 3) << token << "\n" << log;
+  for (std::uint32_t token : repeated) EXPECT_GE(told(token), 1) << token << "\n" << log;
   pmtest::ExpectBackAtLevel(pid, *level, "after the tokens and the refused readers");
   EXPECT_EQ(sink.Problems(), std::vector<std::string>{});
-  EXPECT_EQ(sink.Pictures(), 5 + 9 + 3 + 10);
+  EXPECT_EQ(sink.Videos(), 5 + 9 + 3 + 10);
   // The last stop_source ends the runner in order, having removed its
   // segments.
-  EXPECT_TRUE(request("pm::tsrc::stop_source", 2, json::object()));
-  EXPECT_EQ(runner.Wait(kPatience), std::optional<int>(0)) << folder.ReadRunnerLog();
+  EXPECT_TRUE(host.WriteJson(pmtest::Request("pm::tsrc::stop_source", 2, {{"unique_id", id}})));
+  EXPECT_EQ(runner.Wait(kPatience), std::optional<int>(0)) << runner.Stderr();
   EXPECT_EQ(SegmentsOf({base}), 0);
 }
 

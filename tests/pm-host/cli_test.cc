@@ -19,42 +19,6 @@ namespace {
 using nlohmann::json;
 using namespace std::chrono_literals;
 
-struct Output {
-  int status = -1;
-  std::string out, err;
-};
-
-std::string Replace(std::string text, const std::string& from, const std::string& to) {
-  for (std::size_t at = text.find(from); at != std::string::npos; at = text.find(from, at + to.size())) {
-    text.replace(at, from.size(), to);
-  }
-  return text;
-}
-
-// Runs a program to its end with standard output and error apart.
-Output RunProgram(const std::string& path, const std::vector<std::string>& args, const pmtest::Folder& folder) {
-  Output result;
-  std::mutex lock;  // guards result.out
-  {
-    pmhost::ChildProcess child;
-    pmhost::ChildOptions o;
-    o.path = path;
-    o.args = args;
-    o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-    o.stderrPath = folder.path + "/stderr.txt";
-    o.captureStdout = true;
-    o.onLine = [&](const std::string& line) {
-      std::lock_guard<std::mutex> guard(lock);
-      result.out += line + "\n";
-    };
-    if (!child.Start(std::move(o))) return result;
-    result.status = child.Wait(90s).value_or(-2);
-  }  // joins the reader of standard output
-  std::ifstream in(folder.path + "/stderr.txt");
-  result.err.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-  return result;
-}
-
 struct Case {
   const char* name;
   const char* program;  // its path
@@ -68,17 +32,13 @@ struct Case {
   bool json = false;     // standard output is exactly one JSON document
 };
 
-void PrintTo(const Case& c, std::ostream* os) { *os << c.name; }
-
 class CommandLine : public ::testing::TestWithParam<Case> {};
 
 TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
   const Case& c = GetParam();
   pmtest::Folder folder;
   pmtest::Sender sender;
-  if (c.sender) {
-    ASSERT_TRUE(sender.Start(folder, "Cli", {"--width", "64", "--height", "16", "--fps", "60"}));
-  }
+  ASSERT_TRUE(!c.sender || sender.Start(folder, "Cli", {"--width", "64", "--height", "16", "--fps", "60"}));
   // Not a module; and a runner that dies (SIGKILL) once its task has started
   // discovery for the host.
   std::ofstream(folder.path + "/not-a-module.so") << "text";
@@ -88,28 +48,46 @@ TEST_P(CommandLine, ExitsWithItsStatusAndPrintsWhereItShould) {
                        << "kill -9 $pid\nwait $pid\n";
   ::chmod(dying.c_str(), 0755);
 
-  std::vector<std::string> args;
+  // Run to its end, standard output and error apart (the runner's log goes
+  // with the host's).
+  pmhost::ChildOptions o;
+  o.path = c.program;
+  const std::pair<std::string, std::string> names[] = {
+      {"{folder}", folder.path}, {"{dying-runner}", dying}, {"{sender}", c.sender ? sender.Name() : ""}};
   for (std::string arg : c.args) {
-    arg = Replace(arg, "{folder}", folder.path);
-    arg = Replace(arg, "{dying-runner}", dying);
-    args.push_back(Replace(arg, "{sender}", c.sender ? sender.Name() : ""));
+    for (const auto& [name, value] : names) {
+      if (const std::size_t at = arg.find(name); at != std::string::npos) arg.replace(at, name.size(), value);
+    }
+    o.args.push_back(arg);
   }
-  const Output run = RunProgram(c.program, args, folder);
-  EXPECT_EQ(run.status, c.status) << run.err;
-  if (c.out != nullptr) {
-    EXPECT_TRUE(*c.out == '\0' ? run.out.empty() : run.out.find(c.out) != std::string::npos) << run.out;
-  }
-  EXPECT_NE(run.err.find(c.err), std::string::npos) << run.err;
+  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
+  o.stderrPath = folder.RunnerLog();
+  o.captureStdout = true;
+  std::mutex lock;  // guards out
+  std::string out;
+  o.onLine = [&](const std::string& line) {
+    std::lock_guard<std::mutex> guard(lock);
+    out += line + "\n";
+  };
+  int status = -1;
+  {
+    pmhost::ChildProcess child;
+    ASSERT_TRUE(child.Start(std::move(o)));
+    status = child.Wait(90s).value_or(-2);
+  }  // joins the reader of standard output
+  const std::string err = folder.ReadRunnerLog();
+  EXPECT_EQ(status, c.status) << err;
+  EXPECT_TRUE(c.out == nullptr || (*c.out == '\0' ? out.empty() : out.find(c.out) != std::string::npos)) << out;
+  EXPECT_NE(err.find(c.err), std::string::npos) << err;
   if (c.json) {
-    const json document = json::parse(run.out, nullptr, false);
-    ASSERT_TRUE(document.is_object()) << run.out;
-    EXPECT_GE(document.value("frames", 0), 10) << run.out;
+    const json document = json::parse(out, nullptr, false);
+    ASSERT_TRUE(document.is_object()) << out;
+    EXPECT_GE(document.value("frames", 0), 10) << out;
     EXPECT_EQ(document.value("source", ""), sender.Name());
   }
 }
 
-const std::vector<std::string> kHostOptions{"--runner", PM_RUNNER_PATH, "--module", PM_MODULE_PATH,
-                                            "--runner-log", "{folder}/runner.log"};
+const std::vector<std::string> kHostOptions{"--runner", PM_RUNNER_PATH, "--module", PM_MODULE_PATH};
 
 std::vector<std::string> Join(std::vector<std::string> a, const std::vector<std::string>& b) {
   a.insert(a.end(), b.begin(), b.end());

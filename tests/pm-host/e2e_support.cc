@@ -1,9 +1,7 @@
 #include "e2e_support.h"
 
-#include <dirent.h>
 #include <signal.h>
 #include <stdlib.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
@@ -47,8 +45,7 @@ bool Sender::Start(const Folder& folder, const std::string& name, std::vector<st
     std::lock_guard<std::mutex> guard(lock_);
     if (event.is_object()) events_.push_back(std::move(event));
   };
-  if (!process_.Start(std::move(o))) return false;
-  return pmtest::WaitFor([&] { return !Find("ready").is_null(); }, kPatience);
+  return process_.Start(std::move(o)) && WaitFor("ready");
 }
 
 json Sender::Find(const std::string& kind, const std::function<bool(const json&)>& match) {
@@ -64,12 +61,10 @@ bool Sender::WaitFor(const std::string& kind, const std::function<bool(const jso
 }
 
 pmhost::HostOptions HostOptionsFor(const Folder& folder) {
-  pmhost::HostOptions o;
-  o.runnerPath = PM_RUNNER_PATH;
-  o.modulePath = PM_MODULE_PATH;
-  o.env = {{"NDI_LOOPBACK_DIR", folder.Registry()}};
-  o.runnerLog = folder.RunnerLog();
-  return o;
+  return {.runnerPath = PM_RUNNER_PATH,
+          .modulePath = PM_MODULE_PATH,
+          .env = {{"NDI_LOOPBACK_DIR", folder.Registry()}},
+          .runnerLog = folder.RunnerLog()};
 }
 
 pmhost::ReceiveOptions ReceiveFrom(const Folder& folder, const std::string& source) {
@@ -92,23 +87,15 @@ int SegmentsOf(const std::vector<std::string>& bases) {
 
 void ExpectASourceLedToAnotherSendersPortToComeToItsOwn(const Folder& folder) {
   constexpr int kOwnWidth = 640, kOtherWidth = 320;
-  auto args = [](int width) {
-    return std::vector<std::string>{"--pattern", "blocks", "--width", std::to_string(width), "--height",
-                                    std::to_string(width * 9 / 16), "--fps", "30", "--no-audio"};
-  };
-  auto own = std::make_unique<Sender>();
-  ASSERT_TRUE(own->Start(folder, "Own", args(kOwnWidth)));
-  const std::string id = pmhost::kSourceIdPrefix + own->Name();
-  own->Process().Signal(SIGKILL);
-  ASSERT_TRUE(own->Process().Wait(kPatience).has_value());
-  Sender other;
+  const auto args = [](int width) { return BlocksArgs(width, width * 9 / 16, {"--no-audio"}); };
+  Sender own, other, again;
+  ASSERT_TRUE(own.Start(folder, "Own", args(kOwnWidth)));
+  const std::string id = pmhost::kSourceIdPrefix + own.Name();
+  own.Process().Signal(SIGKILL);
+  ASSERT_TRUE(own.Process().Wait(kPatience).has_value());
   bool up = false;
-  std::thread starts([&] {
-    up = other.Start(folder, "Other", args(kOtherWidth));
-    auto again = std::make_unique<Sender>();
-    up = again->Start(folder, "Own", args(kOwnWidth)) && up;
-    own = std::move(again);
-  });
+  std::thread starts(
+      [&] { up = other.Start(folder, "Other", args(kOtherWidth)) && again.Start(folder, "Own", args(kOwnWidth)); });
   std::mutex lock;  // guards widths
   std::vector<int> widths;
   std::atomic<bool> stop{false};
@@ -147,10 +134,9 @@ void ExpectOrderlyEnd(const pmhost::ReceiveResult& result, const Folder& folder)
 std::optional<ProcessUsage> UsageOf(pid_t pid) {
   const std::string proc = pid == 0 ? "/proc/self" : "/proc/" + std::to_string(pid);
   ProcessUsage usage;
-  DIR* fds = ::opendir((proc + "/fd").c_str());
-  if (fds == nullptr) return std::nullopt;
-  while (const dirent* entry = ::readdir(fds)) usage.descriptors += entry->d_name[0] != '.' ? 1 : 0;
-  ::closedir(fds);
+  std::error_code error;
+  usage.descriptors = static_cast<int>(std::distance(std::filesystem::directory_iterator(proc + "/fd", error), {}));
+  if (error) return std::nullopt;
   if (pid == 0) --usage.descriptors;  // the directory stream itself
   std::ifstream status(proc + "/status");
   if (!status) return std::nullopt;
@@ -194,12 +180,9 @@ std::vector<std::string> SharedMemoryMappedBy(pid_t pid) {
   std::string line;
   const std::string folder = "/dev/shm/";
   while (std::getline(maps, line)) {
-    const std::size_t at = line.find(folder);
-    if (at == std::string::npos) continue;
-    std::string name = line.substr(at + folder.size());
-    const std::size_t deleted = name.find(" (deleted)");
-    if (deleted != std::string::npos) name.resize(deleted);
-    names.insert(name);
+    // The name runs to the end, or to the " (deleted)" of an unlinked entry.
+    const std::size_t at = line.find(folder), from = at + folder.size(), to = line.find(" (deleted)");
+    if (at != std::string::npos) names.insert(line.substr(from, to - from));
   }
   return {names.begin(), names.end()};
 }

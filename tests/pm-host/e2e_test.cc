@@ -17,10 +17,7 @@
 
 namespace {
 
-using nlohmann::json;
-using namespace std::chrono_literals;
 
-using pmtest::Folder;
 using pmtest::SegmentsOf;
 using pmtest::kPatience;
 
@@ -28,7 +25,7 @@ using pmtest::kPatience;
 // vendor runtime does; senders here take ports as the vendor's do (the lowest
 // free one), so the dead sender's port goes to the next sender at once.
 TEST(EndToEnd, ASourceLedToAnotherSendersPortByAStaleListingComesToItsOwnSender) {
-  Folder folder;
+  pmtest::Folder folder;
   folder.firstPort = 20000 + static_cast<int>(::getpid() % 10000);
   pmtest::ExpectASourceLedToAnotherSendersPortToComeToItsOwn(folder);
 }
@@ -40,7 +37,7 @@ using CrashedRunner = pmtest::OwnLevelKept;
 TEST_F(CrashedRunner, ItsSegmentsAreRemovedAndUnmappedByTheHost) {
   pmtest::Chain c(/*ramp=*/false);
   ASSERT_NO_FATAL_FAILURE(c.Start("Crash", {"--width", "64", "--height", "16", "--fps", "30", "--no-audio"}));
-  ASSERT_TRUE(c.Session().StartSource(c.id, json::object()));
+  ASSERT_TRUE(c.Session().StartSource(c.id, nlohmann::json::object()));
   ASSERT_TRUE(pmtest::WaitFor([&] { return c.sink.Videos(c.id) > 3; }, kPatience));
   const std::vector<std::string> bases = c.Session().MemoryBases();
   ASSERT_EQ(bases.size(), 1u);

@@ -18,7 +18,6 @@ using pmhost::Companion;
 struct Layout {
   const char* name;
   std::vector<std::string> files;  // relative to the tree
-  std::string programFolder;       // where pm-host lies, relative to the tree
   std::string runner, module, sender;  // expected, relative to the tree; "" none
 };
 
@@ -32,31 +31,26 @@ TEST_P(Locate, FindsEachCompanionWhereTheLayoutPutsIt) {
     fs::create_directories(fs::path(tree + "/" + file).parent_path());
     std::ofstream(tree + "/" + file) << "x";
   }
-  const std::string folder = tree + "/" + c.programFolder + "/";
+  const std::string folder = tree + "/bin/";  // where pm-host lies
   const auto found = [&](Companion companion) {
     const std::string path = pmhost::LocateIn(companion, folder);
     return path.empty() ? path : fs::relative(path, tree).string();
   };
-  EXPECT_EQ(found(Companion::Runner), c.runner);
-  EXPECT_EQ(found(Companion::Module), c.module);
-  EXPECT_EQ(found(Companion::Sender), c.sender);
+  EXPECT_EQ(std::vector<std::string>({found(Companion::Runner), found(Companion::Module), found(Companion::Sender)}),
+            std::vector<std::string>({c.runner, c.module, c.sender}));
   fs::remove_all(tree);
 }
 
 const std::vector<std::string> kInstalled{"bin/pm-host", "bin/pm-runner", "bin/ndi-testsrc",
                                           "lib/pm-ndisource/libtaskndisource.so"};
 
-void PrintTo(const Layout& layout, std::ostream* os) { *os << layout.name; }
-
 INSTANTIATE_TEST_SUITE_P(
     Layouts, Locate,
     ::testing::Values(
-        Layout{"Installed", kInstalled, "bin", "bin/pm-runner", "lib/pm-ndisource/libtaskndisource.so",
-               "bin/ndi-testsrc"},
+        Layout{"Installed", kInstalled, "bin/pm-runner", "lib/pm-ndisource/libtaskndisource.so", "bin/ndi-testsrc"},
         // A folder is not a program.
-        Layout{"FoldersAreNotFiles", {"bin/pm-runner/x", "lib/pm-ndisource/libtaskndisource.so/x"}, "bin", "", "",
-               ""},
-        Layout{"Nothing", {"bin/pm-host"}, "bin", "", "", ""}),
+        Layout{"FoldersAreNotFiles", {"bin/pm-runner/x", "lib/pm-ndisource/libtaskndisource.so/x"}, "", "", ""},
+        Layout{"Nothing", {"bin/pm-host"}, "", "", ""}),
     [](const ::testing::TestParamInfo<Layout>& info) { return std::string(info.param.name); });
 
 }  // namespace

@@ -3,13 +3,16 @@
 // PNG itself is read back by the demo's check (cli_test).
 #include <gtest/gtest.h>
 
+#include <algorithm>
+
 #include "pm-host/picture.h"
 #include "pm/shm/formats.h"
 
 namespace {
 
 struct Colour {
-  int y, u, v, r, g, b;
+  std::uint8_t y, u, v;
+  int r, g, b;
 };
 // The 75% bars of the test sender: BT.709 limited-range values and their RGB.
 const Colour kBars[] = {{180, 128, 128, 191, 191, 191}, {168, 44, 136, 191, 191, 0}, {145, 147, 44, 0, 191, 191},
@@ -17,28 +20,23 @@ const Colour kBars[] = {{180, 128, 128, 191, 191, 191}, {168, 44, 136, 191, 191,
                         {28, 212, 120, 0, 0, 191},      {16, 128, 128, 0, 0, 0},     {235, 128, 128, 255, 255, 255}};
 
 void ExpectNear(const std::uint8_t* rgb, const Colour& c) {
-  EXPECT_NEAR(rgb[0], c.r, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
-  EXPECT_NEAR(rgb[1], c.g, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
-  EXPECT_NEAR(rgb[2], c.b, 1) << "Y" << c.y << " U" << c.u << " V" << c.v;
+  const int want[] = {c.r, c.g, c.b};
+  for (int i = 0; i < 3; ++i) EXPECT_NEAR(rgb[i], want[i], 1) << "Y" << +c.y << " U" << +c.u << " V" << +c.v;
 }
 
 TEST(Snapshot, BarsIn2vuyAndNV12TurnIntoTheirBT709Colours) {
   const int n = 9;
   pmhost::Picture uyvy{pm::kCode2vuy, 2 * n, 2, 4 * n + 8, std::vector<std::uint8_t>((4 * n + 8) * 2)};
   pmhost::Picture nv12{pm::kCodeNV12, 2 * n, 2, 2 * n + 4, std::vector<std::uint8_t>((2 * n + 4) * 3)};
+  // Each bar two pixels wide, on both rows (NV12: one chroma pair for both).
   for (int i = 0; i < n; ++i) {
-    const auto y = static_cast<std::uint8_t>(kBars[i].y), u = static_cast<std::uint8_t>(kBars[i].u),
-               v = static_cast<std::uint8_t>(kBars[i].v);
-    for (int row = 0; row < 2; ++row) {
-      std::uint8_t* p = uyvy.bytes.data() + row * uyvy.stride + 4 * i;
-      p[0] = u;
-      p[1] = p[3] = y;
-      p[2] = v;
-      nv12.bytes[static_cast<std::size_t>(row) * nv12.stride + 2 * i] = y;
-      nv12.bytes[static_cast<std::size_t>(row) * nv12.stride + 2 * i + 1] = y;
+    const Colour& c = kBars[i];
+    const std::uint8_t pair[] = {c.u, c.y, c.v, c.y}, luma[] = {c.y, c.y}, chroma[] = {c.u, c.v};
+    for (std::uint32_t row = 0; row < 2; ++row) {
+      std::copy_n(pair, 4, uyvy.bytes.begin() + row * uyvy.stride + 4 * i);
+      std::copy_n(luma, 2, nv12.bytes.begin() + row * nv12.stride + 2 * i);
     }
-    nv12.bytes[2u * nv12.stride + 2 * i] = u;
-    nv12.bytes[2u * nv12.stride + 2 * i + 1] = v;
+    std::copy_n(chroma, 2, nv12.bytes.begin() + 2 * nv12.stride + 2 * i);
   }
   for (const pmhost::Picture* p : {&uyvy, &nv12}) {
     const std::vector<std::uint8_t> rgb = pmhost::ToRgb(*p);

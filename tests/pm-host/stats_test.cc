@@ -20,11 +20,8 @@ TEST(ReceiveStats, CountsMissingPicturesFromGapsInMediaTimeAndSoundSecondsFromSa
   send(23);  // 20, 21, 22 missing
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);
   // A lost connection is not a drop: the sender was away.
-  stats.State(3);
-  stats.State(1);
-  stats.State(2);
-  send(500);
-  send(501);
+  for (int state : {3, 1, 2}) stats.State(state);
+  for (int frame : {500, 501}) send(frame);
   EXPECT_EQ(stats.Snapshot(0).drops, 3u);
   EXPECT_EQ(stats.Snapshot(0).states, (std::vector<int>{3, 1, 2}));
   // Sound seconds follow the sample count and rate.
