@@ -29,7 +29,6 @@ struct Bytes {
   explicit Bytes(std::size_t n, int step = 0, int seed = kUntouched) : size(n), data(new std::uint8_t[n == 0 ? 1 : n]) {
     for (std::size_t i = 0; i < n; ++i) data[i] = static_cast<std::uint8_t>(i * step + seed);
   }
-  std::uint8_t& operator[](std::size_t i) { return data[i]; }
   std::size_t size;
   std::unique_ptr<std::uint8_t[]> data;
 };
@@ -54,6 +53,19 @@ class MemoryVideoBuffer : public pm::VideoBuffer {
   std::uint8_t* Row(int plane, int r) {
     const pm::VideoPlanes p = pm::LayoutPlanes(format_, bytes_.data.get(), stride_);
     return p.plane[plane].data + static_cast<std::ptrdiff_t>(r) * p.plane[plane].stride;
+  }
+  // Every byte of every row of every plane, padding included, is
+  // want(plane, row, byte), or anything where that is negative.
+  void ExpectBytes(const std::function<int(int, int, int)>& want) {
+    const pm::VideoPlanes p = pm::LayoutPlanes(format_, bytes_.data.get(), stride_);
+    for (int plane = 0; plane < p.planeCount; ++plane) {
+      for (int r = 0; r < p.plane[plane].rows; ++r) {
+        for (int c = 0; c < p.plane[plane].stride; ++c) {
+          const int expected = want(plane, r, c);
+          ASSERT_TRUE(expected < 0 || Row(plane, r)[c] == expected) << plane << " " << r << " " << c;
+        }
+      }
+    }
   }
   bool AllUntouched() const {
     for (std::size_t i = 0; i < bytes_.size; ++i)
@@ -121,15 +133,7 @@ TEST(VideoBufferCopyFrame, CopiesEveryRowOfEveryPlane) {
     MemoryVideoBuffer buffer(f, c.stride);
     buffer.CopyFrame(source.data.get(), c.sourceStride);
     EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
-    const pm::VideoPlanes planes = pm::LayoutPlanes(f, source.data.get(), c.stride);
-    for (int plane = 0; plane < planes.planeCount; ++plane) {
-      for (int r = 0; r < planes.plane[plane].rows; ++r) {
-        const std::uint8_t* row = buffer.Row(plane, r);
-        for (int k = 0; k < c.stride; ++k) {
-          ASSERT_EQ(row[k], k < c.copiedBytes ? Pattern(plane, r, k) : kUntouched) << plane << " " << r << " " << k;
-        }
-      }
-    }
+    buffer.ExpectBytes([&](int plane, int r, int k) { return k < c.copiedBytes ? Pattern(plane, r, k) : kUntouched; });
   }
 }
 
@@ -149,19 +153,12 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
       buffer.ConvertFrame(code, src.planes);
       EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
       const pm::Plane& luma = src.planes.plane[0];
-      for (int r = 0; r < h; ++r) {
-        for (int c = 0; c < stride; ++c) {
-          ASSERT_EQ(buffer.Row(0, r)[c], c < w ? luma.data[r * luma.stride + c] : kUntouched) << "luma " << r << " " << c;
-        }
-      }
       const pm::Plane& a = src.planes.plane[code == pm::kCodeI420 ? 1 : 2];
       const pm::Plane& b = src.planes.plane[code == pm::kCodeI420 ? 2 : 1];
-      for (int r = 0; r < h / 2; ++r) {
-        for (int c = 0; c < stride; ++c) {
-          const std::uint8_t want = c < (w / 2) * 2 ? (c % 2 == 0 ? a : b).data[r * a.stride + c / 2] : kUntouched;
-          ASSERT_EQ(buffer.Row(1, r)[c], want) << "chroma " << r << " " << c;
-        }
-      }
+      buffer.ExpectBytes([&](int plane, int r, int c) {
+        if (plane == 0) return c < w ? luma.data[r * luma.stride + c] : kUntouched;
+        return c < (w / 2) * 2 ? (c % 2 == 0 ? a : b).data[r * a.stride + c / 2] : kUntouched;
+      });
     }
   }
 }
@@ -189,14 +186,10 @@ TEST(VideoBufferConvertFrame, PackedRgbGetsOpaqueAlphaTopDownAndBottomUp) {
                                 : pm::Plane{pixels.data.get(), h, stride};
         MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeRgba, w, h), 4 * w + k.dstExtra);
         buffer.ConvertFrame(k.code, src);
-        for (int r = 0; r < h; ++r) {
-          const std::uint8_t* in = src.plane[0].data + r * src.plane[0].stride;
-          for (int p = 0; p < w; ++p) {
-            for (int b = 0; b < 3; ++b) ASSERT_EQ(buffer.Row(0, r)[4 * p + b], in[k.inBytes * p + b]) << r << " " << p;
-            ASSERT_EQ(buffer.Row(0, r)[4 * p + 3], 0xFF);
-          }
-          for (int c = 4 * w; c < 4 * w + k.dstExtra; ++c) ASSERT_EQ(buffer.Row(0, r)[c], kUntouched);
-        }
+        buffer.ExpectBytes([&](int, int r, int c) -> int {
+          if (c >= 4 * w) return kUntouched;
+          return c % 4 == 3 ? 0xFF : src.plane[0].data[r * src.plane[0].stride + k.inBytes * (c / 4) + c % 4];
+        });
       }
     }
   }
@@ -278,8 +271,7 @@ TEST(VideoBuffer, RefusedCopiesAndConversionsWriteNothingPastAPlaneAndUnmap) {
       continue;
     }
     EXPECT_NE(buffer.Row(0, h - 1)[w - 1], kUntouched);
-    for (int r = 0; r < h / 2; ++r)
-      for (int k = 0; k < w; ++k) ASSERT_EQ(buffer.Row(1, r)[k], kUntouched) << r << " " << k;
+    buffer.ExpectBytes([](int plane, int, int) { return plane == 1 ? kUntouched : -1; });
   }
 }
 
@@ -302,10 +294,10 @@ TEST(PixelKernels, EveryInterleavePathFollowsTheByteRule) {
         Bytes out(2 * pairs + offset, 31, 200);
         kernel(u.data.get() + offset, v.data.get() + offset, out.data.get() + offset, pairs);
         for (int i = 0; i < pairs; ++i) {
-          ASSERT_EQ(out[offset + 2 * i], u[offset + i]) << pairs << " " << i;
-          ASSERT_EQ(out[offset + 2 * i + 1], v[offset + i]) << pairs << " " << i;
+          ASSERT_EQ(out.data[offset + 2 * i], u.data[offset + i]) << pairs << " " << i;
+          ASSERT_EQ(out.data[offset + 2 * i + 1], v.data[offset + i]) << pairs << " " << i;
         }
-        for (int i = 0; i < offset; ++i) ASSERT_EQ(out[i], static_cast<std::uint8_t>(i * 31 + 200));
+        for (int i = 0; i < offset; ++i) ASSERT_EQ(out.data[i], static_cast<std::uint8_t>(i * 31 + 200));
       }
     }
   }
