@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <memory>
+#include <numeric>
 #include <vector>
 
 #include "pm/ipc/dispatcher.h"
@@ -15,9 +16,8 @@
 namespace {
 
 struct CountingTask : pm::Task {
-  explicit CountingTask(int* counter) : shutdowns(counter) {}
-  void Shutdown() override { ++*shutdowns; }
-  int* shutdowns;
+  void Shutdown() override { ++shutdowns; }
+  static inline int shutdowns = 0;
 };
 
 // Dispatchers without a connection, each on a manual clock of its own, which
@@ -31,16 +31,14 @@ struct CountedDispatchers {
     return dispatcher;
   }
   int Stops() const {
-    int stops = 0;
-    for (const auto& clock : clocks) stops += clock->Sleeps();
-    return stops;
+    return std::accumulate(clocks.begin(), clocks.end(), 0, [](int n, const auto& c) { return n + c->Sleeps(); });
   }
 };
 
 TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndTheDestructorOnlyStopsThem) {
   CountedDispatchers counted;
-  int shutdowns = 0;
-  CountingTask task(&shutdowns);
+  const int& shutdowns = CountingTask::shutdowns;
+  CountingTask task;
   task.AddDispatcher(counted.Make());
   task.AddDispatcher(counted.Make());
   std::shared_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
@@ -59,7 +57,7 @@ TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndTheDestructorOn
   EXPECT_EQ(counted.Stops(), 2);
 
   auto dispatcher = counted.Make();
-  auto* other = new CountingTask(&shutdowns);
+  auto* other = new CountingTask();
   other->AddDispatcher(dispatcher);
   delete static_cast<pm::TaskBase*>(other);  // through the base, as the runner does
   EXPECT_EQ(shutdowns, 2);
