@@ -143,12 +143,8 @@ TEST_F(Callbacks, VideoSends_OfForeignBuffersAreIgnored) {
 }
 
 TEST_F(Callbacks, AudioSends_FeedTheMediaClock) {
-  for (int i = 0; i < 30; ++i) {
-    auto buffer = callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 1600);
-    ASSERT_TRUE(buffer);
-    callbacks->SendAudioBuffer(callbacks->AudioTime(48000), buffer);
-  }
-  EXPECT_EQ(callbacks->AudioTime(48000), 705600000);
+  callbacks->SendAudioBuffer(0, callbacks->RequestAudioBuffer({pm::kCodeFl32, 48000, 2}, 48000));
+  EXPECT_EQ(callbacks->AudioTime(48000), 705600000);  // one second
 }
 
 }  // namespace

@@ -38,9 +38,7 @@ TEST_F(MediaClock, CurrentTimeAndAudioTimeWithoutARateFollowTheSteadyClock) {
 }
 
 TEST_F(MediaClock, VideoBeforeAnyAudioCountsTenDiscontinuitiesThenFollowsTheClock) {
-  for (std::int64_t i = 1; i <= 10; ++i) {
-    EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(i, true));
-  }
+  for (std::int64_t i = 1; i <= 10; ++i) EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(i, true));
   t->Advance(2 * kSecondNs);
   EXPECT_EQ(clock.NextVideoTime(Rate(30, 1)), std::make_pair(2 * pm::kTicksPerSecond, false));
 }
