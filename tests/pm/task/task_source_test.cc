@@ -49,55 +49,49 @@ struct Script {
   std::atomic<bool> discoveryMayStart{true};       // false holds every discovery's Start
 };
 
-class ScriptedSource : public pm::Source {
- public:
+// Each scripted object writes its calls, tagged "<id>#<serial>", into the script.
+struct ScriptedSource : pm::Source {
   ScriptedSource(std::shared_ptr<Callbacks> callbacks, std::string id, int serial, Script* script)
-      : Source(std::move(callbacks), std::move(id)), tag_(UniqueId() + "#" + std::to_string(serial)), script_(script) {}
+      : Source(std::move(callbacks), std::move(id)), tag(UniqueId() + "#" + std::to_string(serial)), script(script) {}
   void Start() override {
-    script_->Add("start " + tag_);
-    if (script_->throwOnStart) throw std::runtime_error("start failed on purpose");
+    script->Add("start " + tag);
+    if (script->throwOnStart) throw std::runtime_error("start failed on purpose");
   }
-  void Stop() override { script_->Add("stop " + tag_); }
+  void Stop() override { script->Add("stop " + tag); }
   void SetConfiguration(std::string text) override {
-    script_->Add("config " + tag_ + " " + text);
-    if (script_->throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
+    script->Add("config " + tag + " " + text);
+    if (script->throwOnConfiguration) throw std::runtime_error("bad configuration on purpose");
   }
-  const std::string& Tag() const { return tag_; }
   std::string ValidateGui(std::string text) override { return Answer("validate ", text); }
   std::string GuiToConfiguration(std::string text) override { return Answer("to_config ", text); }
   std::string ConfigurationToGui(std::string text) override { return Answer("to_gui ", text); }
-  void ExecuteCustomActionCommand(std::string command) override { script_->Add("action " + tag_ + " " + command); }
-  void HandleShotEvent(std::string event) override { script_->Add("shot " + tag_ + " " + event); }
-  void SourceHotplugEvent() override { script_->Add("hotplug " + tag_); }
-
- private:
+  void ExecuteCustomActionCommand(std::string command) override { script->Add("action " + tag + " " + command); }
+  void HandleShotEvent(std::string event) override { script->Add("shot " + tag + " " + event); }
+  void SourceHotplugEvent() override { script->Add("hotplug " + tag); }
   // A source with the id "notjson" answers text that is not JSON.
   std::string Answer(const char* call, const std::string& text) {
-    script_->Add(call + tag_ + " " + text);
+    script->Add(call + tag + " " + text);
     return UniqueId() == "notjson" ? "{not json" : R"({"answer":1})";
   }
 
-  std::string tag_;
-  Script* script_;
+  const std::string tag;
+  Script* const script;
 };
 
-class ScriptedDiscovery : public pm::SourceDiscovery {
- public:
+struct ScriptedDiscovery : pm::SourceDiscovery {
   ScriptedDiscovery(std::shared_ptr<Callbacks> callbacks, int serial, Script* script)
-      : SourceDiscovery(std::move(callbacks)), tag_("discovery#" + std::to_string(serial)), script_(script) {}
+      : SourceDiscovery(std::move(callbacks)), tag("discovery#" + std::to_string(serial)), script(script) {}
   void Start() override {
-    script_->Add("start " + tag_);
-    script_->discoveryStarting = true;
-    pmtest::WaitFor([this] { return script_->discoveryMayStart.load(); }, 60s);
-    if (script_->throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
+    script->Add("start " + tag);
+    script->discoveryStarting = true;
+    pmtest::WaitFor([this] { return script->discoveryMayStart.load(); }, 60s);
+    if (script->throwOnDiscoveryStart) throw std::runtime_error("discovery start failed on purpose");
   }
-  void Stop() override { script_->Add("stop " + tag_); }
-  void DiscoveryHotplugEvent() override { script_->Add("hotplug " + tag_); }
-  const std::string& Tag() const { return tag_; }
+  void Stop() override { script->Add("stop " + tag); }
+  void DiscoveryHotplugEvent() override { script->Add("hotplug " + tag); }
 
- private:
-  std::string tag_;
-  Script* script_;
+  const std::string tag;
+  Script* const script;
 };
 
 // A task with scripted factories, one dispatcher attached as the runner
@@ -311,8 +305,8 @@ TEST_F(TaskSourceTest, ConcurrentStartsOnTwoConnectionsLeaveOneRunningAndStopThe
   auto discovery = std::dynamic_pointer_cast<ScriptedDiscovery>(task_->CurrentDiscovery());
   auto source = std::dynamic_pointer_cast<ScriptedSource>(task_->FindSource("a"));
   ASSERT_TRUE(discovery && source);
-  ExpectOnlySurvivorRunning(script_.Lines(), "discovery#", discovery->Tag());
-  ExpectOnlySurvivorRunning(script_.Lines(), "a#", source->Tag());
+  ExpectOnlySurvivorRunning(script_.Lines(), "discovery#", discovery->tag);
+  ExpectOnlySurvivorRunning(script_.Lines(), "a#", source->tag);
   EXPECT_EQ(task_->SourceCount(), 1u);
 }
 
