@@ -35,12 +35,11 @@ TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
     return text + "1" + std::string(depth, '}');
   };
   const std::string brackets(2 * kLimit, '[');
-  struct Case {
+  const struct {
     const char* label;
     std::string text;
     bool parses;
-  };
-  const Case cases[] = {
+  } cases[] = {
       {"arrays_at_limit", arrays(kLimit, "1"), true},
       {"arrays_over", arrays(kLimit + 1, "1"), false},
       {"objects_at_limit", objects(kLimit), true},
@@ -52,7 +51,7 @@ TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
       {"escaped_backslash_over", arrays(kLimit, "\"\\\\\",[1]"), false},
       {"quarter_million", arrays(250000, "1"), false},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     SCOPED_TRACE(c.label);
     pmtest::LogCapture capture;
     const Json value = pmjson::Parse(c.text, c.label);
@@ -70,18 +69,16 @@ TEST(Parse, NestingDeeperThanTheLimitIsRefusedWithOneLine) {
 // Names from the network need not be UTF-8.
 TEST(Dump, PrintsTextThatIsNotUtf8) { EXPECT_NO_THROW(pmjson::Dump(Json(std::string("a\xFF")))); }
 
-struct Row {
-  Json value;
-  bool asBool;
-  std::int64_t asInteger;
-  double asDouble;
-  std::string asString;
-};
-
 // Every type read leniently, as a field of an object too; a missing key or a
 // value that is not an object gives the field's default.
 TEST(LenientReaders, ReadEveryJsonType) {
-  const Row rows[] = {
+  const struct {
+    Json value;
+    bool asBool;
+    std::int64_t asInteger;
+    double asDouble;
+    std::string asString;
+  } rows[] = {
       {"Yes", true, 0, 0.0, "Yes"},
       {"yes please", false, 0, 0.0, "yes please"},
       {"1", true, 1, 1.0, "1"},
@@ -101,7 +98,7 @@ TEST(LenientReaders, ReadEveryJsonType) {
       {nullptr, false, 0, 0.0, ""},
       {Json::array({1, 2}), false, 0, 0.0, ""},
   };
-  for (const Row& row : rows) {
+  for (const auto& row : rows) {
     SCOPED_TRACE(row.value.dump());
     EXPECT_EQ(pmjson::AsBool(row.value), row.asBool);
     EXPECT_EQ(pmjson::AsInteger(row.value), row.asInteger);

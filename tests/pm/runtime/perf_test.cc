@@ -13,16 +13,15 @@ constexpr std::int64_t kMs = 1000 * 1000;
 // A run longer than the threshold (exclusive) is logged at once, in
 // milliseconds, with the microseconds under 5 ms.
 TEST(PerformanceLog, SlowRunsAreLoggedInTheMillisecondOrMicrosecondForm) {
-  struct Row {
+  const struct {
     std::int64_t thresholdMicros, nanos;
     const char* line;  // null: not logged
-  };
-  const Row rows[] = {{20000, 25 * kMs, "run 25 ms\n"},
+  } rows[] = {{20000, 25 * kMs, "run 25 ms\n"},
                       {20000, 19 * kMs, nullptr},
                       {20000, 20 * kMs, nullptr},
                       {20000, 20 * kMs + 1, "run 20 ms\n"},
                       {1000, 1234567, "run 1 ms (1234 micros)\n"}};
-  for (const Row& row : rows) {
+  for (const auto& row : rows) {
     SCOPED_TRACE(row.nanos);
     pmtest::LogCapture capture;
     PerformanceLog log("run", row.thresholdMicros);

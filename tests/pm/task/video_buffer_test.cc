@@ -152,11 +152,10 @@ TEST(VideoBufferConvertFrame, I420AndYV12InterleaveByTheByteRule) {
       MemoryVideoBuffer buffer(VideoFormatOf(pm::kCodeNV12, w, h), stride);
       buffer.ConvertFrame(code, src.planes);
       EXPECT_EQ(std::make_pair(buffer.maps, buffer.unmaps), std::make_pair(1, 1));
-      const pm::Plane& luma = src.planes.plane[0];
       const pm::Plane& a = src.planes.plane[code == pm::kCodeI420 ? 1 : 2];
       const pm::Plane& b = src.planes.plane[code == pm::kCodeI420 ? 2 : 1];
       buffer.ExpectBytes([&](int plane, int r, int c) {
-        if (plane == 0) return c < w ? luma.data[r * luma.stride + c] : kUntouched;
+        if (plane == 0) return c < w ? src.y.data[r * (w + 3) + c] : kUntouched;
         return c < (w / 2) * 2 ? (c % 2 == 0 ? a : b).data[r * a.stride + c / 2] : kUntouched;
       });
     }
