@@ -200,11 +200,10 @@ TEST(WidgetFromJson, ReadsOnlyTheValue) {
   expected["bandwidth"]["value"] = 2;
   expected["status"]["value"] = "1";  // from an array: its last element
   Json host = expected;               // with everything else changed
-  for (const char* key : {"bandwidth", "reconnect", "status"}) {
-    host[key].update(Json{{"title", "x"}, {"visible", false}, {"ghosted", true}, {"values", {"z"}},
-                          {"valueSetID", "id"}, {"type", "button"}, {"justification", 99}, {"indication", 101},
-                          {"action", 1}, {"command", "rm"}});
-  }
+  const Json changed = {{"title", "x"}, {"visible", false}, {"ghosted", true}, {"values", {"z"}},
+                        {"valueSetID", "id"}, {"type", "button"}, {"justification", 99}, {"indication", 101},
+                        {"action", 1}, {"command", "rm"}};
+  for (const char* key : {"bandwidth", "reconnect", "status"}) host[key].update(changed);
   host["status"]["value"] = {"a", 2, true};
   host["reconnect"]["value"] = "v";
   gui.FromJson(host);

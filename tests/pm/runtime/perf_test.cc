@@ -6,8 +6,6 @@
 
 namespace {
 
-using pm::PerformanceLog;
-
 constexpr std::int64_t kMs = 1000 * 1000;
 
 // A run longer than the threshold (exclusive) is logged at once, in
@@ -24,7 +22,7 @@ TEST(PerformanceLog, SlowRunsAreLoggedInTheMillisecondOrMicrosecondForm) {
   for (const auto& row : rows) {
     SCOPED_TRACE(row.nanos);
     pmtest::LogCapture capture;
-    PerformanceLog log("run", row.thresholdMicros);
+    pm::PerformanceLog log("run", row.thresholdMicros);
     log.Record(row.nanos);
     EXPECT_EQ(capture.Lines(), row.line ? std::vector<std::string>{row.line} : std::vector<std::string>{});
   }
@@ -32,14 +30,14 @@ TEST(PerformanceLog, SlowRunsAreLoggedInTheMillisecondOrMicrosecondForm) {
 
 TEST(PerformanceLog, FiftyFirstSlowRunStopsImmediateLogging) {
   pmtest::LogCapture capture;
-  PerformanceLog log("busy", 1);
+  pm::PerformanceLog log("busy", 1);
   for (int i = 0; i < 60; ++i) log.Record(10 * kMs + i);
   ASSERT_EQ(capture.Lines().size(), 51u);
   EXPECT_EQ(capture.Count("Immediate performance logging stopped"), 1);
 }
 
 TEST(PerformanceScope, StoppingTwiceRecordsOnce) {
-  PerformanceLog log("scope", 1000000);
+  pm::PerformanceLog log("scope", 1000000);
   {
     pm::PerformanceScope scope(log);
     scope.Stop();
