@@ -126,8 +126,8 @@ TEST_F(Callbacks, VideoRequests_StopCreatingSegmentsAtTheLimit) {
   EXPECT_NE(callbacks->RequestVideoBuffer(format, 0), nullptr);
 }
 
-class ForeignVideoBuffer : public pm::VideoBuffer {
- public:
+// A video buffer of some other kind than the queue's.
+struct ForeignVideoBuffer : pm::VideoBuffer {
   pm::VideoPlanes Planes() override { return {}; }
   std::pair<std::uint8_t*, std::int32_t> MapData() override { return {nullptr, 0}; }
   void UnmapData() override {}
