@@ -4,14 +4,13 @@
 // the video record's contents reach the host in the whole-chain tests.)
 #include <gtest/gtest.h>
 
-#include <cstring>
+#include <functional>
 
-#include "pm/shm/shared_memory_queue.h"
+#include "pm/shm/formats.h"
 #include "pm/task/callbacks.h"
 #include "support/host_link.h"
 #include "support/log_capture.h"
 #include "support/video_format.h"
-#include "support/wait.h"
 
 namespace {
 
