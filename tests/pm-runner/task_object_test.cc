@@ -3,9 +3,9 @@
 // destructor stops connections without running the derived Shutdown.
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <memory>
 #include <numeric>
+#include <utility>
 #include <vector>
 
 #include "pm/ipc/dispatcher.h"
@@ -47,21 +47,18 @@ TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndTheDestructorOn
   task.SetServer(std::move(server));
 
   task.StopTask();
-  EXPECT_EQ(shutdowns, 1);
-  EXPECT_EQ(counted.Stops(), 2);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(1, 2));  // shutdowns, stops
   EXPECT_EQ(task.DispatcherCount(), 0u);
   EXPECT_TRUE(weakServer.expired());
   // Again (the destructor does it too): Shutdown runs, nothing is stopped twice.
   task.StopTask();
-  EXPECT_EQ(shutdowns, 2);
-  EXPECT_EQ(counted.Stops(), 2);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(2, 2));
 
   auto dispatcher = counted.Make();
   auto* other = new CountingTask();
   other->AddDispatcher(dispatcher);
   delete static_cast<pm::TaskBase*>(other);  // through the base, as the runner does
-  EXPECT_EQ(shutdowns, 2);
-  EXPECT_EQ(counted.Stops(), 3);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(2, 3));
   EXPECT_EQ(dispatcher.use_count(), 1);  // the queue let go
 }
 
