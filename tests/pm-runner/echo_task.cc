@@ -26,14 +26,11 @@ class EchoTask : public pm::Task {
       response["pid"] = ::getpid();
     });
     dispatcher->RegisterHandler("test::stop_task", [this](const Json&, Json&) { StopTask(); });
-    std::weak_ptr<pm::RpcDispatcher> weak = dispatcher;
     // A handler that never comes back in time (it tells the host it started):
     // the runner must not wait for it for ever when it ends.
-    dispatcher->RegisterHandler("test::hang", [weak](const Json&, Json&) {
-      if (auto self = weak.lock()) {
-        Json note = Json::object();
-        self->RpcRequest("test::hanging", note, 10000);
-      }
+    dispatcher->RegisterHandler("test::hang", [weak = std::weak_ptr(dispatcher)](const Json&, Json&) {
+      Json note = Json::object();
+      if (auto self = weak.lock()) self->RpcRequest("test::hanging", note, 10000);
       std::this_thread::sleep_for(std::chrono::seconds(60));
     });
   }

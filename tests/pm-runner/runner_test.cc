@@ -16,10 +16,7 @@
 namespace {
 
 using namespace std::chrono_literals;
-using pmtest::Args;
-using pmtest::HostListener;
-using pmtest::HostPeer;
-using pmtest::RunnerProcess;
+using namespace pmtest;
 
 // The orderly end: Shutdown, then the task is destroyed.
 void ExpectOrderlyEnd(RunnerProcess& runner) {

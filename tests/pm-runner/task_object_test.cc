@@ -3,8 +3,9 @@
 // destructor stops connections without running the derived Shutdown.
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <memory>
+#include <numeric>
+#include <utility>
 #include <vector>
 
 #include "pm/ipc/dispatcher.h"
@@ -15,9 +16,8 @@
 namespace {
 
 struct CountingTask : pm::Task {
-  explicit CountingTask(int* counter) : shutdowns(counter) {}
-  void Shutdown() override { ++*shutdowns; }
-  int* shutdowns;
+  void Shutdown() override { ++shutdowns; }
+  static inline int shutdowns = 0;
 };
 
 // Dispatchers without a connection, each on a manual clock of its own, which
@@ -31,16 +31,14 @@ struct CountedDispatchers {
     return dispatcher;
   }
   int Stops() const {
-    int stops = 0;
-    for (const auto& clock : clocks) stops += clock->Sleeps();
-    return stops;
+    return std::accumulate(clocks.begin(), clocks.end(), 0, [](int n, const auto& c) { return n + c->Sleeps(); });
   }
 };
 
 TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndTheDestructorOnlyStopsThem) {
   CountedDispatchers counted;
-  int shutdowns = 0;
-  CountingTask task(&shutdowns);
+  const int& shutdowns = CountingTask::shutdowns;
+  CountingTask task;
   task.AddDispatcher(counted.Make());
   task.AddDispatcher(counted.Make());
   std::shared_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
@@ -49,21 +47,18 @@ TEST(TaskObject, StopTaskShutsDownThenStopsEveryDispatcherOnceAndTheDestructorOn
   task.SetServer(std::move(server));
 
   task.StopTask();
-  EXPECT_EQ(shutdowns, 1);
-  EXPECT_EQ(counted.Stops(), 2);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(1, 2));  // shutdowns, stops
   EXPECT_EQ(task.DispatcherCount(), 0u);
   EXPECT_TRUE(weakServer.expired());
   // Again (the destructor does it too): Shutdown runs, nothing is stopped twice.
   task.StopTask();
-  EXPECT_EQ(shutdowns, 2);
-  EXPECT_EQ(counted.Stops(), 2);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(2, 2));
 
   auto dispatcher = counted.Make();
-  auto* other = new CountingTask(&shutdowns);
+  auto* other = new CountingTask();
   other->AddDispatcher(dispatcher);
   delete static_cast<pm::TaskBase*>(other);  // through the base, as the runner does
-  EXPECT_EQ(shutdowns, 2);
-  EXPECT_EQ(counted.Stops(), 3);
+  EXPECT_EQ(std::make_pair(shutdowns, counted.Stops()), std::make_pair(2, 3));
   EXPECT_EQ(dispatcher.use_count(), 1);  // the queue let go
 }
 

@@ -16,8 +16,7 @@ TEST(ContextRegistry, CreatesOnceAndKeepsEmptyEntriesEmpty) {
     return std::make_shared<Thing>();
   };
   auto a = pm::FindSingleton("registry-test", make);
-  auto b = pm::FindSingleton("registry-test", make);
-  EXPECT_EQ(a, b);
+  EXPECT_EQ(pm::FindSingleton("registry-test", make), a);
   EXPECT_EQ(created, 1);
   EXPECT_TRUE(std::dynamic_pointer_cast<Thing>(a));
 

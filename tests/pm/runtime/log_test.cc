@@ -10,22 +10,19 @@
 
 namespace {
 
-using pm::Log;
-using pm::LogText;
-using pm::LogType;
 using Lines = std::vector<std::string>;
 
 // Exactly one newline ends each line; a null tag or text counts as empty; a
 // null format writes nothing.
 TEST(Log, JoinsTagAndTextWithExactlyOneNewline) {
   pmtest::LogCapture capture;
-  Log(LogType::Normal, "t: ", "%s", "x");
-  Log(LogType::Normal, "t: ", "already %d\n", 1);
-  Log(LogType::Normal, nullptr, "%s", "");
-  Log(LogType::Normal, "", nullptr);
-  LogText("t: ", "text\n");
-  LogText("", nullptr);
-  LogText(nullptr, "plain");
+  pm::Log(pm::LogType::Normal, "t: ", "%s", "x");
+  pm::Log(pm::LogType::Normal, "t: ", "already %d\n", 1);
+  pm::Log(pm::LogType::Normal, nullptr, "%s", "");
+  pm::Log(pm::LogType::Normal, "", nullptr);
+  pm::LogText("t: ", "text\n");
+  pm::LogText("", nullptr);
+  pm::LogText(nullptr, "plain");
   EXPECT_EQ(capture.Lines(), (Lines{"t: x\n", "t: already 1\n", "\n", "t: text\n", "\n", "plain\n"}));
 }
 
@@ -34,11 +31,11 @@ TEST(Log, LongLinesAreDeliveredWholeByBothEntryPointsAndLeaveNothingBehind) {
   Lines expected;
   for (std::size_t size : {1021u, 1022u, 1023u, 2000u, 100000u}) {
     const std::string message(size, 'm');
-    Log(LogType::Normal, "tag: ", "%s", message.c_str());
-    LogText("tag: ", message.c_str());
+    pm::Log(pm::LogType::Normal, "tag: ", "%s", message.c_str());
+    pm::LogText("tag: ", message.c_str());
     expected.insert(expected.end(), 2, "tag: " + message + "\n");
   }
-  Log(LogType::Normal, "", "short");
+  pm::Log(pm::LogType::Normal, "", "short");
   expected.push_back("short\n");
   EXPECT_EQ(capture.Lines(), expected);
 }

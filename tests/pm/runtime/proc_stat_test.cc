@@ -9,6 +9,7 @@
 #include <chrono>
 #include <fstream>
 #include <string>
+#include <tuple>
 
 #include "pm/runtime/proc_stat.h"
 #include "pm/runtime/system.h"
@@ -20,9 +21,7 @@ TEST(ProcStat, ReadsALiveProcessAZombieChildAndNothingOfOneGone) {
   std::getline(std::ifstream("/proc/self/comm"), command);
   pm::ProcStat self;
   ASSERT_TRUE(pm::ReadProcStat(::getpid(), &self));
-  EXPECT_EQ(self.command, command);
-  EXPECT_EQ(self.state, 'R');
-  EXPECT_EQ(self.parent, ::getppid());
+  EXPECT_EQ(std::tie(self.command, self.state, self.parent), std::make_tuple(command, 'R', ::getppid()));
   EXPECT_TRUE(pm::ProcessAlive(::getpid()));
   // Busy until a clock tick of CPU time was used (10 ms).
   const auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(20);
@@ -35,8 +34,7 @@ TEST(ProcStat, ReadsALiveProcessAZombieChildAndNothingOfOneGone) {
   if (child == 0) ::_exit(0);
   pm::ProcStat ended;
   while (pm::ReadProcStat(child, &ended) && ended.state != 'Z') ::usleep(1000);
-  EXPECT_EQ(ended.state, 'Z');
-  EXPECT_EQ(ended.parent, ::getpid());
+  EXPECT_EQ(std::tie(ended.state, ended.parent), std::make_tuple('Z', ::getpid()));
   EXPECT_FALSE(pm::ProcessAlive(child));
   EXPECT_EQ(pm::ChildrenNamed(::getpid(), command), std::vector<pid_t>{child});
   int status = 0;
