@@ -51,8 +51,7 @@ TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
   StartedQueue q;
   auto a = q.queue->AllocateCpuBuffer(1);
   auto b = q.queue->AllocateCpuBuffer(1);
-  EXPECT_EQ(a->id, 1u);
-  EXPECT_EQ(b->id, 2u);
+  EXPECT_EQ(std::make_pair(a->id, b->id), std::make_pair(1u, 2u));
   q.queue->DeleteBuffer(b);
   EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 3u);  // ids keep growing after a delete
   q.queue->SeedNextId(0xFFFFFFFFu);
@@ -69,12 +68,10 @@ TEST(QueueSizes, AreRoundedUpTo4096AndNothingIsLeftAfterTheQueueGoes) {
     StartedQueue q;
     one = q.base + std::to_string(q.queue->AllocateCpuBuffer(1)->id);
     more = q.base + std::to_string(q.queue->AllocateCpuBuffer(4097)->id);
-    EXPECT_EQ(SegmentBytes(one), 4096u);
-    EXPECT_EQ(SegmentBytes(more), 8192u);
+    EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(4096u, 8192u));
     EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
   }
-  EXPECT_EQ(SegmentBytes(one), 0u);
-  EXPECT_EQ(SegmentBytes(more), 0u);
+  EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(0u, 0u));
 }
 
 TEST(QueueReuse, PicksTheSmallestFreeSegmentThatFitsAndNeverAHeldOne) {
@@ -144,17 +141,14 @@ TEST(QueueRecords, WithoutAHostTheHoldGoesAtOnceAndUnstartedOrDeletedAreRefused)
 
 // A GPU memory manager that a runner could register in the context: its
 // segments hold no memory (size 1, nothing to lock).
-class FakeGpuSegment : public pm::SharedGpuMemory {
- public:
-  explicit FakeGpuSegment(const pm::VideoFormat& f) : format_(f) { descriptor.size = 1; }
+struct FakeGpuSegment : pm::SharedGpuMemory {
+  explicit FakeGpuSegment(const pm::VideoFormat& f) : format(f) { descriptor.size = 1; }
   std::uint64_t Size() const override { return descriptor.size; }
   std::pair<std::uint8_t*, std::int32_t> Lock() override { return {nullptr, 0}; }
   void Unlock() override {}
   bool IsLocked() const override { return false; }
-  pm::VideoFormat Format() const override { return format_; }
-
- private:
-  pm::VideoFormat format_;
+  pm::VideoFormat Format() const override { return format; }
+  pm::VideoFormat format;
 };
 
 struct FakeGpuManager : pm::SharedGpuMemoryManager {
@@ -167,10 +161,7 @@ struct FakeGpuManager : pm::SharedGpuMemoryManager {
 
 TEST(QueueGpu, ARegisteredManagerIsPreferredAndMatchedFieldByField) {
   auto manager = std::make_shared<FakeGpuManager>();
-  {
-    std::lock_guard<std::mutex> guard(pm::GetContext()->registryLock);
-    pm::GetContext()->registry["SharedGpuMemoryManager"] = manager;
-  }
+  ASSERT_EQ(pm::FindSingleton("SharedGpuMemoryManager", [&] { return manager; }), manager);
   {
     StartedQueue q;
     const pm::VideoFormat format = VideoFormatOf(pm::kCodeNV12, 1920, 1080);
