@@ -33,8 +33,7 @@ struct StartedQueue {
   std::string base = "pmtestq" + std::to_string(pm::CurrentProcessId()) + "_";
   std::atomic<bool> hostConnected{false};
 
-  explicit StartedQueue(bool start = true) {
-    if (!start) return;
+  StartedQueue() {
     queue->StartQueue(link.Dispatcher(), "NDICaptureDevice~CAM", base, [this] { hostConnected = true; });
     EXPECT_TRUE(link.ReadCommand("NDICaptureDevice~CAM::start_queue"));
   }
@@ -124,8 +123,8 @@ TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnRe
 // and a deleted segment (announced to the host) is refused with a log line.
 TEST(QueueRecords, WithoutAHostTheHoldGoesAtOnceAndUnstartedOrDeletedAreRefused) {
   std::uint8_t payload[34] = {};
-  StartedQueue unstarted(false);
-  EXPECT_FALSE(unstarted.queue->SendBuffer(unstarted.queue->AllocateCpuBuffer(100), payload));
+  const auto unstarted = std::make_shared<SharedMemoryQueueProducer>();
+  EXPECT_FALSE(unstarted->SendBuffer(unstarted->AllocateCpuBuffer(100), payload));
   StartedQueue q;
   auto segment = q.queue->AllocateCpuBuffer(100);
   EXPECT_TRUE(q.queue->SendBuffer(segment, payload));
