@@ -7,9 +7,7 @@
 // above (tests/pm/ipc).
 #include "pm/ip/socket.h"
 
-#include <arpa/inet.h>
 #include <fcntl.h>
-#include <netinet/in.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/time.h>

@@ -4,7 +4,6 @@
 
 #include "pm/shm/shared_cpu_memory_posix.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -14,9 +13,9 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <filesystem>
 #include <functional>
 #include <string>
-#include <vector>
 
 #include "support/log_capture.h"
 #include "support/segment_probe.h"
@@ -35,12 +34,8 @@ std::string UniqueName() {
   return Prefix() + std::to_string(++counter);
 }
 
-int OpenDescriptors() {
-  int count = 0;
-  DIR* dir = ::opendir("/proc/self/fd");
-  while (dirent* entry = ::readdir(dir)) count += entry->d_name[0] != '.';
-  ::closedir(dir);
-  return count - 1;  // the directory's own descriptor
+int OpenDescriptors() {  // less the listing's own
+  return static_cast<int>(std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {})) - 1;
 }
 
 // A private entry of the whole size, whose mapping keeps no descriptor open;
