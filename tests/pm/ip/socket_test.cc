@@ -66,8 +66,7 @@ TEST(SocketErrors, ClassifyByTheirNumbers) {
 
 TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLine) {
   pmtest::LogCapture log;
-  Listening a;
-  Listening b;
+  Listening a, b;
   EXPECT_GT(a.port(), 0);
   EXPECT_NE(a.port(), b.port());
 

@@ -86,7 +86,10 @@ TEST(ConnectionSend, ConcurrentSendersNeverInterleaveFrames) {
   for (int t = 0; t < kThreads; ++t) EXPECT_EQ(seen[char('a' + t)], kEach);
 }
 
-TEST(ConnectionRead, BlockCutShortByATimeoutIsCompletedByTheNextRead) {
+// A block cut short by a timeout is completed by the next read. A reset peer
+// (its close discards what was not read) reads as gone, not as a timeout:
+// reads fail for good. (A plain end of stream: the dispatcher's tests.)
+TEST(ConnectionRead, BlockCutShortByATimeoutIsCompletedAndAResettingPeerClearsConnected) {
   Pair pair;
   const std::uint8_t bytes[8] = {1, 2, 3, 4, 5, 6, 7, 8};
   ASSERT_TRUE(pair.task->Send({{bytes, 2}}));
@@ -96,20 +99,12 @@ TEST(ConnectionRead, BlockCutShortByATimeoutIsCompletedByTheNextRead) {
   ASSERT_TRUE(pair.task->Send({{bytes + 2, 6}}));
   EXPECT_EQ(ReadBytes(*pair.host, 4), (Bytes{1, 2, 3, 4}));
   EXPECT_EQ(ReadBytes(*pair.host, 4), (Bytes{5, 6, 7, 8}));
-}
-
-// A reset peer (its close discards what was not read) reads as gone, not as
-// a timeout: reads fail for good. (A plain end of stream: the dispatcher's
-// tests.)
-TEST(ConnectionRead, PeerResettingClearsConnected) {
-  Pair pair;
   const linger abort{1, 0};  // close sends a reset instead of an end of stream
   ASSERT_EQ(::setsockopt(pair.task->GetSocket().GetHandle(), SOL_SOCKET, SO_LINGER, &abort, sizeof abort), 0);
   pair.task.reset();  // destroyed: its end closes
-  std::uint8_t byte = 0;
-  EXPECT_FALSE(pair.host->ReadFromSocket(&byte, 1, 5000));
+  EXPECT_FALSE(pair.host->ReadFromSocket(buffer, 1, 5000));
   EXPECT_FALSE(pair.host->IsConnected());
-  EXPECT_FALSE(pair.host->ReadFromSocket(&byte, 1, 5000));
+  EXPECT_FALSE(pair.host->ReadFromSocket(buffer, 1, 5000));
 }
 
 // Close shuts the socket down before it takes the send lock: a sender blocked
@@ -194,8 +189,7 @@ TEST(ServerListener, RunningOutOfDescriptorsDoesNotMakeItSpin) {
   // connection is queued but the listener has no descriptor to take it.
   rlimit saved{};
   ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &saved), 0);
-  rlimit low = saved;
-  low.rlim_cur = std::min<rlim_t>(saved.rlim_cur, 1024);
+  const rlimit low{std::min<rlim_t>(saved.rlim_cur, 1024), saved.rlim_max};
   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &low), 0);
   std::vector<int> filler;
   for (int fd; (fd = ::dup(0)) >= 0;) filler.push_back(fd);

@@ -141,8 +141,8 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
   dispatcher_->RegisterHandler("scalar", [](const Json&, Json& response) { response = 5; });
   StartReceiving();
 
-  const Json reply = pmtest::Ask(host_, "echo", 41, {{"value", "héllo"}});
-  EXPECT_EQ(reply, (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
+  EXPECT_EQ(pmtest::Ask(host_, "echo", 41, {{"value", "héllo"}}),
+            (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
   const std::pair<const char*, const char*> failures[] = {  // command, error (null: any text)
       {"pm::tsrc::nope", "unknown command"}, {"boom", "no such source"}, {"strict", nullptr}, {"scalar", nullptr}};
   std::uint64_t id = 100;

@@ -39,13 +39,6 @@ struct StartedQueue {
   }
 };
 
-// The host checks records with Fletcher-16: 'abc' is the reference vector.
-TEST(QueueCheckBytes, MatchTheReferenceVectorAndZeroTheSums) {
-  const std::uint8_t abc[3] = {'a', 'b', 'c'};
-  EXPECT_EQ(Sums(abc, 3), std::make_pair(39u, 76u));
-  EXPECT_EQ(pm::FletcherCheckBytes(abc, 3), (std::array<std::uint8_t, 2>{0x8C, 0x4C}));
-}
-
 TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
   StartedQueue q;
   auto a = q.queue->AllocateCpuBuffer(1);
@@ -112,7 +105,11 @@ TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnRe
   EXPECT_EQ(std::memcmp(record, ".UPC", 4), 0);  // the CPU type tag
   EXPECT_EQ(pm::LoadLe64(record + 12), 4096u);  // the segment's size
   EXPECT_EQ(std::memcmp(record + 24, payload, 34), 0);
+  // The host checks records with Fletcher-16 ('abc' is its reference vector).
   EXPECT_EQ(Sums(record, 60), std::make_pair(0u, 0u));
+  const std::uint8_t abc[3] = {'a', 'b', 'c'};
+  EXPECT_EQ(Sums(abc, 3), std::make_pair(39u, 76u));
+  EXPECT_EQ(pm::FletcherCheckBytes(abc, 3), (std::array<std::uint8_t, 2>{0x8C, 0x4C}));
 
   EXPECT_EQ(segment->inUse.load(), 1);  // held until the host returns the token
   ASSERT_TRUE(host.ReturnToken(token));
