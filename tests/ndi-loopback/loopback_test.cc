@@ -249,8 +249,7 @@ TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact
     NDIlib_send_send_video_v2(sender, &frame);
   };
   // Two frames held by the caller while twenty more go through.
-  send(0);
-  send(1);
+  for (int n = 0; n < 2; ++n) send(n);
   const Frame held[2] = {rx.Take(kNdiFrameVideo), rx.Take(kNdiFrameVideo)};
   for (int n = 2; n < 22; ++n) send(n);
   // A metadata frame after the pictures: once it can be captured (pictures

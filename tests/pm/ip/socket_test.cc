@@ -110,16 +110,14 @@ TEST(SocketAccept, CloseWakesAWaitingAcceptAndKeepsTheNumberUntilReleased) {
 // (A timeout that expires reads as one, not as a dead peer: tests/pm/ipc.)
 TEST(SocketReceive, TimeoutIsSetExactlyAndTheLargestValueWaitsForEver) {
   Pair pair;
-  const auto timeout = [&] {
+  // Milliseconds set, and the seconds and microseconds the socket holds.
+  for (const auto& [ms, sec, usec] : {std::tuple{std::int64_t{1500}, 1, 500000}, {pm::ip::kNoTimeout, 0, 0}}) {
+    ASSERT_TRUE(pair.server.SetReceiveTimeout(ms));
     timeval value{};
     socklen_t length = sizeof(value);
     EXPECT_EQ(::getsockopt(pair.server.GetHandle(), SOL_SOCKET, SO_RCVTIMEO, &value, &length), 0);
-    return std::make_pair(value.tv_sec, value.tv_usec);
-  };
-  ASSERT_TRUE(pair.server.SetReceiveTimeout(1500));
-  EXPECT_EQ(timeout(), std::make_pair(time_t{1}, suseconds_t{500000}));
-  ASSERT_TRUE(pair.server.SetReceiveTimeout(pm::ip::kNoTimeout));
-  EXPECT_EQ(timeout(), std::make_pair(time_t{0}, suseconds_t{0}));
+    EXPECT_EQ(std::make_pair(value.tv_sec, value.tv_usec), std::make_pair(time_t{sec}, suseconds_t{usec}));
+  }
 }
 
 // SIGPIPE is blocked on this thread for the test, so that one raised by a send
