@@ -153,14 +153,11 @@ TEST(ServerListener, StopInsideTheCallbackOrWhileWaitingEndsTheListenerAtOnce) {
       server->Stop();  // must not join its own thread
       handed.set_value(std::move(c));
     });
-    if (inside) {
-      // (That the connection handed over carries data: the queue's records,
-      // tests/pm/shm.)
-      auto host = Connection::Open(server->GetPort());
-      ASSERT_EQ(handed.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
-    } else {
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));  // into the listener's wait
-    }
+    // Inside: a connection comes (that the one handed over carries data: the
+    // queue's records, tests/pm/shm); else 20 ms pass, into the listener's wait.
+    const auto host = inside ? Connection::Open(server->GetPort()) : nullptr;
+    ASSERT_EQ(handed.get_future().wait_for(std::chrono::milliseconds(inside ? 20000 : 20)),
+              inside ? std::future_status::ready : std::future_status::timeout);
     // The listener waits up to 10 s per pass; Stop must end that wait.
     auto destroyed = std::async(std::launch::async, [&] { server.reset(); });
     EXPECT_EQ(destroyed.wait_for(std::chrono::seconds(5)), std::future_status::ready);

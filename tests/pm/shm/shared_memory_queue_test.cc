@@ -39,28 +39,25 @@ struct StartedQueue {
   }
 };
 
-TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
-  StartedQueue q;
-  auto a = q.queue->AllocateCpuBuffer(1);
-  auto b = q.queue->AllocateCpuBuffer(1);
-  EXPECT_EQ(std::make_pair(a->id, b->id), std::make_pair(1u, 2u));
-  q.queue->DeleteBuffer(b);
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 3u);  // ids keep growing after a delete
-  q.queue->SeedNextId(0xFFFFFFFFu);
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 0xFFFFFFFFu);
-  // Wrapped: 0 is never used, 1 is still in the pool, 2 is free again.
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 2u);
-}
-
-// Segments are named after the memory base and their id, sized in whole
-// pages, and all gone from the system with the queue.
-TEST(QueueSizes, AreRoundedUpTo4096AndNothingIsLeftAfterTheQueueGoes) {
+// Ids count from one, skip those in use and wrap past zero; segments are
+// named after the memory base and their id, sized in whole pages, and all gone
+// from the system with the queue.
+TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZeroAndNameSegmentsOfWholePages) {
   std::string one, more;
   {
     StartedQueue q;
-    one = q.base + std::to_string(q.queue->AllocateCpuBuffer(1)->id);
-    more = q.base + std::to_string(q.queue->AllocateCpuBuffer(4097)->id);
+    auto a = q.queue->AllocateCpuBuffer(1);
+    auto b = q.queue->AllocateCpuBuffer(4097);
+    EXPECT_EQ(std::make_pair(a->id, b->id), std::make_pair(1u, 2u));
+    one = q.base + "1";
+    more = q.base + "2";
     EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(4096u, 8192u));
+    q.queue->DeleteBuffer(b);
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 3u);  // ids keep growing after a delete
+    q.queue->SeedNextId(0xFFFFFFFFu);
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 0xFFFFFFFFu);
+    // Wrapped: 0 is never used, 1 is still in the pool, 2 is free again.
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 2u);
     EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
   }
   EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(0u, 0u));
