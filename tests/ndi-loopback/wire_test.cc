@@ -15,7 +15,6 @@
 namespace {
 
 using ndilb::Decoder;
-using ndilb::MessageType;
 using Bytes = std::vector<std::uint8_t>;
 
 // A message on the wire: its head, its text, then `payload` bytes of `fill`.
@@ -35,7 +34,7 @@ Bytes Video(std::uint8_t fill, const std::string& text = "") {
 }
 
 Bytes Metadata(const std::string& text) {
-  return Message(ndilb::EncodeMetadata(MessageType::Metadata, 42, static_cast<std::uint32_t>(text.size())), text);
+  return Message(ndilb::EncodeMetadata(ndilb::MessageType::Metadata, 42, static_cast<std::uint32_t>(text.size())), text);
 }
 
 Decoder ReceiverDecoder() { return Decoder(ndilb::ReceiverSideLimits(), std::make_shared<ndilb::BufferPool>(2)); }

@@ -17,7 +17,6 @@
 
 namespace {
 
-using pm::ip::Acceptor;
 using pm::ip::LastSocketError;
 using pm::ip::Socket;
 
@@ -25,7 +24,7 @@ bool DescriptorOpen(int fd) { return fd >= 0 && ::fcntl(fd, F_GETFD) != -1; }
 
 // A listening acceptor on a system-assigned port.
 struct Listening {
-  Acceptor acceptor;
+  pm::ip::Acceptor acceptor;
   Listening() { EXPECT_TRUE(acceptor.Init(0) && acceptor.Bind() && acceptor.Listen()); }
   int port() const { return acceptor.StoredPort(); }
 };

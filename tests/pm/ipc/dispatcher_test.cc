@@ -23,7 +23,6 @@
 namespace {
 
 using Json = nlohmann::json;
-using namespace std::chrono_literals;
 
 constexpr std::int64_t kMs = 1'000'000;
 

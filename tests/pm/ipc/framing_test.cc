@@ -14,7 +14,6 @@ namespace {
 
 using pm::ipc::EncodeFrame;
 using pm::ipc::FrameReader;
-using pm::ipc::kMaxFrameBytes;
 using Messages = std::vector<std::string>;
 
 Messages Drain(FrameReader& reader) {
@@ -58,7 +57,7 @@ TEST(FrameReader, AnySplitOfTheStreamGivesTheSameMessagesInOrder) {
 // 32-bit sum, are not consumed and the reader stays stopped whatever comes
 // next; frames before it are kept.
 TEST(FrameReader, LengthOverTheLimitStopsTheStreamForGood) {
-  for (const std::uint32_t length : {kMaxFrameBytes + 1, 0xFFFFFFFFu}) {
+  for (const std::uint32_t length : {pm::ipc::kMaxFrameBytes + 1, 0xFFFFFFFFu}) {
     SCOPED_TRACE(length);
     FrameReader reader;
     const std::string before = EncodeFrame("ok");
