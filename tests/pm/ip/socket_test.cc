@@ -74,11 +74,10 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   EXPECT_FALSE(second.Bind());
   EXPECT_EQ(log.Count("Bind failed"), 1);
 
-  const int closedPort = b.port();
   b.acceptor.Close();
   b.acceptor.ReleaseDescriptor();
   Socket client;
-  ASSERT_TRUE(client.Init(closedPort));
+  ASSERT_TRUE(client.Init(b.port()));  // the port it had
   EXPECT_FALSE(client.Connect());
   EXPECT_EQ(errno, ECONNREFUSED);  // the caller classifies this after the log line
   EXPECT_EQ(log.Count("Connect Failed"), 1);

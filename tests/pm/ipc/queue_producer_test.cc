@@ -217,8 +217,7 @@ TEST_F(QueueProducer, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
       reader.ReadRecord();
       producer.Stop();  // releases 1
     }
-    reader.Return(1);
-    reader.Return(4);
+    for (std::uint32_t token : {1u, 4u}) reader.Return(token);
     ASSERT_TRUE(pmtest::WaitFor([&] { return !Connection::WaitReadableConnections({reader.task}, 10).empty(); }));
     ASSERT_TRUE(restart ? Start(60) : producer.AddConnection(reader.task));
     EXPECT_EQ(producer.ReaderCount(), 1u);
