@@ -35,9 +35,7 @@ class DispatcherTest : public ::testing::Test {
     ASSERT_TRUE(host_.Valid());
   }
 
-  void StartReceiving() {
-    dispatcher_->Start([this] { endedCalls_.fetch_add(1); });
-  }
+  void StartReceiving() { dispatcher_->Start([this] { endedCalls_.fetch_add(1); }); }
   void RegisterEcho() {
     dispatcher_->RegisterHandler("echo", [](const Json& request, Json& response) {
       response["value"] = request.value("value", Json());

@@ -63,9 +63,7 @@ struct QueueProducer : ::testing::Test {
     std::lock_guard<std::mutex> hold(mutex);
     return onTheTestThread ? releasedOnTheTestThread : released;
   }
-  bool WaitForReleases(std::size_t n) {
-    return pmtest::WaitFor([&] { return Released().size() >= n; });
-  }
+  bool WaitForReleases(std::size_t n) { return pmtest::WaitFor([&] { return Released().size() >= n; }); }
   bool Send(std::uint32_t token) { return producer.Send(token, {{record.data(), 60}}); }
   // The producer thread passes its loop about once per 250 ms wait; one that
   // still watched a dead socket, which keeps reporting a hang-up, would pass
