@@ -50,24 +50,22 @@ struct Frame {
   ndi_metadata_frame m{};
 };
 
-class Receiver {
- public:
+struct Receiver {
   explicit Receiver(const std::string& name, std::int32_t bandwidth = kNdiBandwidthHighest, const char* url = nullptr) {
     const ndi_recv_create settings{{name.c_str(), url}, kNdiColorUyvyBgra, bandwidth, false};
-    handle_ = NDIlib_recv_create_v2(&settings);
+    handle = NDIlib_recv_create_v2(&settings);
   }
-  ~Receiver() { NDIlib_recv_destroy(handle_); }
-  void* get() const { return handle_; }
-  int Connections() const { return NDIlib_recv_get_no_connections(handle_); }
+  ~Receiver() { NDIlib_recv_destroy(handle); }
+  int Connections() const { return NDIlib_recv_get_no_connections(handle); }
   bool WaitConnected() const { return pmtest::WaitFor([&] { return Connections() == 1; }, kPatience); }
   Frame Capture(std::uint32_t timeout_ms) {
     Frame f;
-    f.type = NDIlib_recv_capture_v2(handle_, &f.v, nullptr, &f.m, timeout_ms);
+    f.type = NDIlib_recv_capture_v2(handle, &f.v, nullptr, &f.m, timeout_ms);
     return f;
   }
   void Free(const Frame& f) {
-    if (f.type == kNdiFrameVideo) NDIlib_recv_free_video_v2(handle_, &f.v);
-    if (f.type == kNdiFrameMetadata) NDIlib_recv_free_metadata(handle_, &f.m);
+    if (f.type == kNdiFrameVideo) NDIlib_recv_free_video_v2(handle, &f.v);
+    if (f.type == kNdiFrameMetadata) NDIlib_recv_free_metadata(handle, &f.m);
   }
   // Captures until a frame of `type` comes (freeing the others) and returns
   // it held; of type kNdiFrameNone on timeout.
@@ -87,9 +85,7 @@ class Receiver {
     Free(f);
     return f.type == type;
   }
-
- private:
-  void* handle_ = nullptr;
+  void* handle = nullptr;
 };
 
 bool Write(ndilb::SocketHandle fd, const void* bytes, std::size_t n) {
@@ -103,13 +99,17 @@ bool Readable(ndilb::SocketHandle fd, std::chrono::milliseconds timeout) {
   return ::poll(&p, 1, static_cast<int>(timeout.count())) == 1;
 }
 
-// True when the peer closes the socket within the timeout (whatever it sent first).
-bool ClosedByPeer(ndilb::SocketHandle fd, std::chrono::milliseconds timeout) {
+// Writes `bytes` to the peer and closes the socket; true when the peer closed
+// it first, within the timeout (whatever it sent before).
+bool DroppedAfter(ndilb::SocketHandle fd, const std::string& bytes, std::chrono::milliseconds timeout) {
   char buffer[65536];
-  for (const auto deadline = Clock::now() + timeout; Clock::now() < deadline;) {
-    if (Readable(fd, 50ms) && ::recv(fd, buffer, sizeof buffer, 0) <= 0) return true;
+  bool closed = false;
+  const bool written = bytes.empty() || Write(fd, bytes.data(), bytes.size());
+  for (const auto deadline = Clock::now() + timeout; written && !closed && Clock::now() < deadline;) {
+    closed = Readable(fd, 50ms) && ::recv(fd, buffer, sizeof buffer, 0) <= 0;
   }
-  return false;
+  ndilb::CloseSocket(fd);
+  return closed;
 }
 
 class Loopback : public ::testing::Test {
@@ -249,8 +249,7 @@ TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact
     NDIlib_send_send_video_v2(sender, &frame);
   };
   // Two frames held by the caller while twenty more go through.
-  send(0);
-  send(1);
+  for (int n = 0; n < 2; ++n) send(n);
   const Frame held[2] = {rx.Take(kNdiFrameVideo), rx.Take(kNdiFrameVideo)};
   for (int n = 2; n < 22; ++n) send(n);
   // A metadata frame after the pictures: once it can be captured (pictures
@@ -259,22 +258,20 @@ TEST_F(Loopback, QueuesDropTheOldestFramesOfASlowReceiverAndHeldFramesStayIntact
   ndi_metadata_frame marker{sizeof end, 0, end};
   NDIlib_send_send_metadata(sender, &marker);
   ndi_metadata_frame got{};
-  ASSERT_EQ(NDIlib_recv_capture_v2(rx.get(), nullptr, nullptr, &got, 5000), kNdiFrameMetadata);
+  ASSERT_EQ(NDIlib_recv_capture_v2(rx.handle, nullptr, nullptr, &got, 5000), kNdiFrameMetadata);
   EXPECT_STREQ(got.data, end);
-  NDIlib_recv_free_metadata(rx.get(), &got);
+  NDIlib_recv_free_metadata(rx.handle, &got);
+  // A picture's number; -1 when it is no intact ramp.
+  auto number = [](const Frame& f) {
+    std::int64_t n = -1;
+    return Ramp(f.v, &n).empty() ? n : -1;
+  };
   std::vector<std::int64_t> numbers;
-  for (Frame f = rx.Capture(0); f.type == kNdiFrameVideo; rx.Free(f), f = rx.Capture(0)) {
-    std::int64_t n = -1;
-    EXPECT_EQ(Ramp(f.v, &n), "");
-    numbers.push_back(n);
-  }
-  // Bounded at eight pictures: the oldest went first, the newest is kept.
-  EXPECT_EQ(numbers, (std::vector<std::int64_t>{14, 15, 16, 17, 18, 19, 20, 21}));
-  for (std::int64_t i = 0; i < 2; ++i) {
-    std::int64_t n = -1;
-    EXPECT_EQ(Ramp(held[i].v, &n), "");
-    EXPECT_EQ(n, i);
-  }
+  for (Frame f = rx.Capture(0); f.type == kNdiFrameVideo; rx.Free(f), f = rx.Capture(0)) numbers.push_back(number(f));
+  numbers.insert(numbers.end(), {number(held[0]), number(held[1])});
+  // Bounded at eight pictures: the oldest went first, the newest is kept; the
+  // held ones last.
+  EXPECT_EQ(numbers, (std::vector<std::int64_t>{14, 15, 16, 17, 18, 19, 20, 21, 0, 1}));
   rx.Free(held[1]);
   rx.Free(held[0]);
   rx.Free(held[0]);  // a second free is ignored
@@ -295,8 +292,8 @@ TEST_F(Loopback, AnInProcessSenderCountsItsReceiversAndCombinesTheirTally) {
   EXPECT_TRUE(pmtest::WaitFor([&] { return NDIlib_send_get_no_connections(sender, 0) == 2; }, kPatience));
   ndi_tally t{};
   const ndi_tally program{true, false}, preview{false, true};
-  ASSERT_TRUE(NDIlib_recv_set_tally(live->get(), &program));
-  ASSERT_TRUE(NDIlib_recv_set_tally(look.get(), &preview));
+  ASSERT_TRUE(NDIlib_recv_set_tally(live->handle, &program));
+  ASSERT_TRUE(NDIlib_recv_set_tally(look.handle, &preview));
   EXPECT_TRUE(pmtest::WaitFor([&] {
     NDIlib_send_get_tally(sender, &t, 50);
     return t.on_program && t.on_preview;
@@ -328,12 +325,12 @@ TEST_F(Loopback, PtzSupportFollowsTheSendersAnnouncementAndCallsReachItAsTheVend
                           {"--width", "16", "--height", "8", "--fps", "10", ptz ? "--ptz" : "--no-audio"}));
     Receiver rx(src.Name());
     ASSERT_EQ(rx.Capture(0).type, kNdiFrameStatusChange);
-    EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.get()));
+    EXPECT_FALSE(NDIlib_recv_ptz_is_supported(rx.handle));
     ASSERT_TRUE(rx.WaitConnected());
     EXPECT_EQ(rx.Next(kNdiFrameStatusChange, {}, ptz ? kPatience : 300ms), ptz);
-    EXPECT_EQ(NDIlib_recv_ptz_is_supported(rx.get()), ptz);
+    EXPECT_EQ(NDIlib_recv_ptz_is_supported(rx.handle), ptz);
     for (const auto& [call, xml] : calls) {
-      EXPECT_TRUE(call(rx.get())) << xml;
+      EXPECT_TRUE(call(rx.handle)) << xml;
       EXPECT_TRUE(src.WaitFor("ptz", [&](const nlohmann::json& e) { return e.value("xml", "") == xml; })) << xml;
     }
   }
@@ -350,10 +347,7 @@ TEST_F(Loopback, GarbageOnASendersPortDropsOnlyThatConnection) {
   // are wire_test's).
   for (const std::string& bytes : {std::string(100, 'Z'), std::string()}) {
     SCOPED_TRACE(bytes);
-    const ndilb::SocketHandle fd = ndilb::ConnectTo(src.Find("ready").value("url", ""), 1000);
-    EXPECT_TRUE(bytes.empty() || Write(fd, bytes.data(), bytes.size()));
-    EXPECT_TRUE(ClosedByPeer(fd, 4s));
-    ndilb::CloseSocket(fd);
+    EXPECT_TRUE(DroppedAfter(ndilb::ConnectTo(src.Find("ready").value("url", ""), 1000), bytes, 4s));
   }
   // The real receiver kept its connection and its frames.
   EXPECT_EQ(rx.Connections(), 1);
@@ -384,17 +378,13 @@ TEST_F(Loopback, AFakeSendersGarbageAndHalfPictureReachNothingAndTheReceiverTrie
     }
     return false;
   };
-  ndilb::SocketHandle fd = accept();
-  ASSERT_NE(fd, ndilb::kNoSocket);
-  ASSERT_TRUE(Write(fd, std::string(64, 'Z').data(), 64));
-  EXPECT_TRUE(ClosedByPeer(fd, 2s));
-  ndilb::CloseSocket(fd);
+  EXPECT_TRUE(DroppedAfter(accept(), std::string(64, 'Z'), 2s));
   const ndi_tally program{true, false}, both{true, true};
-  EXPECT_TRUE(NDIlib_recv_set_tally(rx->get(), &program)) << "taken between connections";
-  fd = accept();
+  EXPECT_TRUE(NDIlib_recv_set_tally(rx->handle, &program)) << "taken between connections";
+  const ndilb::SocketHandle fd = accept();
   ASSERT_NE(fd, ndilb::kNoSocket) << "the receiver comes again";
   EXPECT_TRUE(tally(fd, false)) << "the tally set between connections";
-  EXPECT_TRUE(NDIlib_recv_set_tally(rx->get(), &both));
+  EXPECT_TRUE(NDIlib_recv_set_tally(rx->handle, &both));
   EXPECT_TRUE(tally(fd, true)) << "the tally set before the sender's Ready";
   const ndilb::EncodedHead ready = ndilb::EncodeReady(false),
                            head = ndilb::EncodeVideo({.xres = 1920, .yres = 1080, .fourcc = kNdiFourCCUYVY,

@@ -15,7 +15,6 @@
 namespace {
 
 using ndilb::Decoder;
-using ndilb::MessageType;
 using Bytes = std::vector<std::uint8_t>;
 
 // A message on the wire: its head, its text, then `payload` bytes of `fill`.
@@ -35,7 +34,7 @@ Bytes Video(std::uint8_t fill, const std::string& text = "") {
 }
 
 Bytes Metadata(const std::string& text) {
-  return Message(ndilb::EncodeMetadata(MessageType::Metadata, 42, static_cast<std::uint32_t>(text.size())), text);
+  return Message(ndilb::EncodeMetadata(ndilb::MessageType::Metadata, 42, static_cast<std::uint32_t>(text.size())), text);
 }
 
 Decoder ReceiverDecoder() { return Decoder(ndilb::ReceiverSideLimits(), std::make_shared<ndilb::BufferPool>(2)); }
@@ -59,9 +58,9 @@ TEST(WireDecoder, WholeMessagesComeOutWhateverTheFragmentation) {
                                    : std::make_tuple(0, 0, "<hello/>", 42, Bytes()));
       }
     }
-    ASSERT_EQ(ends.size(), 2u);
-    EXPECT_GE(ends[0], video.size()) << "never before its last byte";
-    EXPECT_EQ(ends[1], stream.size());
+    // Never before its last byte: the first comes with the piece that holds it.
+    EXPECT_EQ(ends, (std::vector<std::size_t>{std::min((video.size() + chunk - 1) / chunk * chunk, stream.size()),
+                                              stream.size()}));
   }
 }
 
@@ -103,9 +102,9 @@ TEST(WireDecoder, RejectsBadHeadersAndTheOtherEndsMessagesBeforeAllocatingAndSta
 }
 
 TEST(RegistryEntry, MalformedEntriesAreRefused) {
+  // (Well-formed entries, also with since= and gone=: the listing's case in
+  // loopback_test.)
   ndilb::RegistryEntry e;
-  EXPECT_TRUE(ndilb::ParseRegistryEntry("ndi-loopback 1\nname=H (a)\nurl=127.0.0.1:5\npid=7\n", &e));
-  EXPECT_EQ(std::make_pair(e.name, e.pid), std::make_pair(std::string("H (a)"), 7));
   for (const char* bad : {"", "garbage", "ndi-loopback 2\nname=a\nurl=b\npid=1\n", "ndi-loopback 1\nname=a\nurl=b\n",
                           "ndi-loopback 1\nname=a\nurl=b\npid=x1\n", "ndi-loopback 1\nname=a\nurl=b\npid=1",
                           "ndi-loopback 1\nname=\nurl=b\npid=1\n", "ndi-loopback 1\nname=a\nurl=b\npid=99999999999\n"}) {

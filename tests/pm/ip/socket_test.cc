@@ -7,9 +7,7 @@
 // above (tests/pm/ipc).
 #include "pm/ip/socket.h"
 
-#include <arpa/inet.h>
 #include <fcntl.h>
-#include <netinet/in.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/time.h>
@@ -19,7 +17,6 @@
 
 namespace {
 
-using pm::ip::Acceptor;
 using pm::ip::LastSocketError;
 using pm::ip::Socket;
 
@@ -27,7 +24,7 @@ bool DescriptorOpen(int fd) { return fd >= 0 && ::fcntl(fd, F_GETFD) != -1; }
 
 // A listening acceptor on a system-assigned port.
 struct Listening {
-  Acceptor acceptor;
+  pm::ip::Acceptor acceptor;
   Listening() { EXPECT_TRUE(acceptor.Init(0) && acceptor.Bind() && acceptor.Listen()); }
   int port() const { return acceptor.StoredPort(); }
 };
@@ -68,8 +65,7 @@ TEST(SocketErrors, ClassifyByTheirNumbers) {
 
 TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLine) {
   pmtest::LogCapture log;
-  Listening a;
-  Listening b;
+  Listening a, b;
   EXPECT_GT(a.port(), 0);
   EXPECT_NE(a.port(), b.port());
 
@@ -78,11 +74,10 @@ TEST(SocketPorts, PortZeroGivesDistinctPortsAndTakenOrClosedPortsFailWithALogLin
   EXPECT_FALSE(second.Bind());
   EXPECT_EQ(log.Count("Bind failed"), 1);
 
-  const int closedPort = b.port();
   b.acceptor.Close();
   b.acceptor.ReleaseDescriptor();
   Socket client;
-  ASSERT_TRUE(client.Init(closedPort));
+  ASSERT_TRUE(client.Init(b.port()));  // the port it had
   EXPECT_FALSE(client.Connect());
   EXPECT_EQ(errno, ECONNREFUSED);  // the caller classifies this after the log line
   EXPECT_EQ(log.Count("Connect Failed"), 1);
@@ -113,16 +108,14 @@ TEST(SocketAccept, CloseWakesAWaitingAcceptAndKeepsTheNumberUntilReleased) {
 // (A timeout that expires reads as one, not as a dead peer: tests/pm/ipc.)
 TEST(SocketReceive, TimeoutIsSetExactlyAndTheLargestValueWaitsForEver) {
   Pair pair;
-  const auto timeout = [&] {
+  // Milliseconds set, and the seconds and microseconds the socket holds.
+  for (const auto& [ms, sec, usec] : {std::tuple{std::int64_t{1500}, 1, 500000}, {pm::ip::kNoTimeout, 0, 0}}) {
+    ASSERT_TRUE(pair.server.SetReceiveTimeout(ms));
     timeval value{};
     socklen_t length = sizeof(value);
     EXPECT_EQ(::getsockopt(pair.server.GetHandle(), SOL_SOCKET, SO_RCVTIMEO, &value, &length), 0);
-    return std::make_pair(value.tv_sec, value.tv_usec);
-  };
-  ASSERT_TRUE(pair.server.SetReceiveTimeout(1500));
-  EXPECT_EQ(timeout(), std::make_pair(time_t{1}, suseconds_t{500000}));
-  ASSERT_TRUE(pair.server.SetReceiveTimeout(pm::ip::kNoTimeout));
-  EXPECT_EQ(timeout(), std::make_pair(time_t{0}, suseconds_t{0}));
+    EXPECT_EQ(std::make_pair(value.tv_sec, value.tv_usec), std::make_pair(time_t{sec}, suseconds_t{usec}));
+  }
 }
 
 // SIGPIPE is blocked on this thread for the test, so that one raised by a send
@@ -140,10 +133,8 @@ TEST(SocketSigpipe, SendingToAPeerThatClosedNeverRaisesSigpipe) {
     // EPIPE, which is where SIGPIPE would be raised.
     EXPECT_TRUE(pmtest::WaitFor([&] { return pair.client.Send(data, sizeof data) < 0; }));
     EXPECT_TRUE(LastSocketError::Read().Gone());
-    for (int i = 0; i < 3; ++i) {
-      EXPECT_EQ(pair.client.SendAll({{data, 32}, {data, 32}}), 0);
-      EXPECT_LT(pair.client.Send(data, sizeof data), 0);
-    }
+    EXPECT_EQ(pair.client.SendAll({{data, 32}, {data, 32}}), 0);
+    EXPECT_LT(pair.client.Send(data, sizeof data), 0);
   }
   sigpending(&pending);
   const bool raised = sigismember(&pending, SIGPIPE) == 1;

@@ -23,7 +23,6 @@
 namespace {
 
 using Json = nlohmann::json;
-using namespace std::chrono_literals;
 
 constexpr std::int64_t kMs = 1'000'000;
 
@@ -35,13 +34,8 @@ class DispatcherTest : public ::testing::Test {
     host_ = listener_.Accept();
     ASSERT_TRUE(host_.Valid());
   }
-  void TearDown() override {
-    if (dispatcher_) dispatcher_->Stop();
-  }
 
-  void StartReceiving() {
-    dispatcher_->Start([this] { endedCalls_.fetch_add(1); });
-  }
+  void StartReceiving() { dispatcher_->Start([this] { endedCalls_.fetch_add(1); }); }
   void RegisterEcho() {
     dispatcher_->RegisterHandler("echo", [](const Json& request, Json& response) {
       response["value"] = request.value("value", Json());
@@ -72,12 +66,10 @@ class DispatcherTest : public ::testing::Test {
 
 TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) {
   StartReceiving();
-  for (const char* command : {"same", "same", "same"}) {
+  for (const auto& [command, ms] : {std::pair{"same", 100}, {"same", 100}, {"same", 100}, {"later", 200}}) {
     Json payload;
-    dispatcher_->RpcRequest(command, payload, 100, Collect());
+    dispatcher_->RpcRequest(command, payload, ms, Collect());
   }
-  Json later;
-  dispatcher_->RpcRequest("later", later, 200, Collect());
 
   // Just before the deadline nothing goes: once the expiry thread waits on
   // the clock for the earliest deadline, 99 ms later it is still in that wait.
@@ -89,10 +81,9 @@ TEST_F(DispatcherTest, RequestsWithEqualDeadlinesAllExpireWithATimeoutCallback) 
   clock_->Advance(1 * kMs);
   // The expired requests leave the table before their callbacks run.
   ASSERT_TRUE(pmtest::WaitFor([&] { return dispatcher_->PendingCount() == 1u && Replies().size() == 3u; }));
-  for (const Json& reply : Replies()) {
-    EXPECT_EQ(reply.value("pm::error", ""), "timeout");
-    EXPECT_EQ(reply.value("pm::command", ""), "same");
-    EXPECT_EQ(reply.value("pm::response", false), true);
+  for (Json reply : Replies()) {
+    EXPECT_EQ(reply.erase("pm::unique_id"), 1u);
+    EXPECT_EQ(reply, (Json{{"pm::error", "timeout"}, {"pm::command", "same"}, {"pm::response", true}}));
   }
   clock_->Advance(100 * kMs);
   ASSERT_TRUE(pmtest::WaitFor([&] { return Replies().size() == 4u; }));
@@ -121,8 +112,8 @@ TEST_F(DispatcherTest, RequestsCarryTheirEnvelopeAndAReplyCompletesThemOnce) {
   host_.WriteJson({{"pm::response", true}, {"pm::unique_id", sent["pm::unique_id"]}});
   host_.WriteJson({{"pm::response", true}, {"pm::unique_id", 999999}});
   host_.WriteJson({{"pm::response", true}, {"pm::unique_id", "not a number"}});
-  ASSERT_TRUE(pmtest::WaitFor([&] { return log_.Count("reply to unknown request") == 2; }));
-  ASSERT_TRUE(pmtest::WaitFor([&] { return log_.Contains("reply without a request id"); }));
+  ASSERT_TRUE(pmtest::WaitFor(
+      [&] { return log_.Count("reply to unknown request") == 2 && log_.Contains("reply without a request id"); }));
 
   // Its deadline passing later runs nothing more.
   clock_->Advance(1000 * kMs);
@@ -147,8 +138,8 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
   dispatcher_->RegisterHandler("scalar", [](const Json&, Json& response) { response = 5; });
   StartReceiving();
 
-  const Json reply = pmtest::Ask(host_, "echo", 41, {{"value", "héllo"}});
-  EXPECT_EQ(reply, (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
+  EXPECT_EQ(pmtest::Ask(host_, "echo", 41, {{"value", "héllo"}}),
+            (Json{{"value", "héllo"}, {"pm::unique_id", 41}, {"pm::command", "echo"}, {"pm::response", true}}));
   const std::pair<const char*, const char*> failures[] = {  // command, error (null: any text)
       {"pm::tsrc::nope", "unknown command"}, {"boom", "no such source"}, {"strict", nullptr}, {"scalar", nullptr}};
   std::uint64_t id = 100;
@@ -163,10 +154,7 @@ TEST_F(DispatcherTest, HandlerRepliesCarryTheRequestAndFailuresGetAnErrorReply) 
   // A request without a command is an unknown command too.
   EXPECT_TRUE(host_.WriteJson({{"pm::unique_id", 5}}));
   EXPECT_EQ(host_.ReadJson()["pm::error"], "unknown command");
-
-  EXPECT_EQ(pmtest::Ask(host_, "echo", 6, {{"value", 3}})["value"], 3);
   EXPECT_TRUE(log_.Contains("no such source"));
-  EXPECT_FALSE(dispatcher_->Ended());
 }
 
 TEST_F(DispatcherTest, TextThatIsNotAJsonObjectIsSkippedAndTheConnectionStays) {
@@ -181,29 +169,25 @@ TEST_F(DispatcherTest, TextThatIsNotAJsonObjectIsSkippedAndTheConnectionStays) {
                                std::string(50000, '[') + std::string(50000, ']') + "}"));
 
   // The first reply the host sees is the one to its valid request.
-  ASSERT_TRUE(host_.WriteJson(pmtest::Request("echo", 7, {{"value", "after"}})));
-  const Json reply = host_.ReadJson();
-  EXPECT_EQ(reply["value"], "after");
-  EXPECT_EQ(reply["pm::unique_id"], 7);
+  EXPECT_EQ(pmtest::Ask(host_, "echo", 7, {{"value", "after"}}),
+            (Json{{"value", "after"}, {"pm::unique_id", 7}, {"pm::command", "echo"}, {"pm::response", true}}));
   EXPECT_EQ(log_.Count("is not JSON, skipped"), 4);          // bad text, also the empty one
   EXPECT_EQ(log_.Count("is not a JSON object, skipped"), 3);  // array, string, null
   EXPECT_EQ(log_.Count("message nests deeper than 256 levels, skipped: '{\"pm::command\":\"echo\""), 1);
-  EXPECT_FALSE(dispatcher_->Ended());
 }
 
 TEST_F(DispatcherTest, RequestOfExactlyTheLimitIsHandled) {
   RegisterEcho();
   StartReceiving();
   Json request = {{"pm::command", "echo"}, {"pm::unique_id", 9}, {"value", ""}};
-  const std::size_t overhead = request.dump().size();
-  request["value"] = std::string(524288 - overhead, 'v');
+  request["value"] = std::string(524288 - request.dump().size(), 'v');
   ASSERT_EQ(request.dump().size(), 524288u);
   auto sent = std::async(std::launch::async, [&] { return host_.WriteJson(request); });
   const Json reply = host_.ReadJson();
   EXPECT_TRUE(sent.get());
   // The echo is longer than a frame may be: the host gets an error instead.
-  EXPECT_EQ(reply["pm::unique_id"], 9);
-  EXPECT_EQ(reply["pm::error"], "reply too long");
+  EXPECT_EQ(reply, (Json{{"pm::unique_id", 9}, {"pm::command", "echo"}, {"pm::response", true},
+                         {"pm::error", "reply too long"}}));
 }
 
 // Every way receiving ends, it ends once: the ended callback runs once, the
@@ -240,10 +224,10 @@ TEST_P(DispatcherEnding, EndsReceivingOnce) {
   EXPECT_LE(sleeps, 1);
   dispatcher_->Stop();
   EXPECT_EQ(clock_->Sleeps(), sleeps);
-  EXPECT_EQ(endedCalls_.load(), 1);
-  EXPECT_EQ(echoes.load(), 0);
-  EXPECT_EQ(log_.Contains("connection ended inside a frame"), ending == Ending::kHostLeavesInsideAFrame);
-  EXPECT_EQ(log_.Contains("frame of 524289 bytes exceeds 524288"), ending == Ending::kOversizeLength);
+  EXPECT_EQ(std::make_pair(endedCalls_.load(), echoes.load()), std::make_pair(1, 0));
+  EXPECT_EQ(std::make_pair(log_.Contains("connection ended inside a frame"),
+                           log_.Contains("frame of 524289 bytes exceeds 524288")),
+            std::make_pair(ending == Ending::kHostLeavesInsideAFrame, ending == Ending::kOversizeLength));
   Json payload;
   EXPECT_FALSE(dispatcher_->RpcRequest("late", payload, 100));
   EXPECT_EQ(dispatcher_->PendingCount(), 1u);

@@ -34,12 +34,7 @@ struct Reader {
     EXPECT_TRUE(host->ReadFromSocket(record.data(), bytes, 5000));
     return record;
   }
-  std::uint32_t NextToken() { return pm::LoadLe32(ReadRecord().data()); }
-  void Return(std::uint32_t token) {
-    std::uint8_t bytes[4];
-    pm::StoreLe32(bytes, token);
-    EXPECT_TRUE(host->Send({{bytes, 4}}));
-  }
+  void Return(std::uint32_t token) { EXPECT_TRUE(host->Send({{&token, 4}})); }  // little-endian hosts only
 };
 
 struct QueueProducer : ::testing::Test {
@@ -48,7 +43,7 @@ struct QueueProducer : ::testing::Test {
   pmtest::LogCapture log;
   std::unique_ptr<pm::ipc::Server> server = pm::ipc::Server::CreateListening();
   std::mutex mutex;
-  std::vector<std::pair<std::uint32_t, bool>> released;  // token, on the test's thread; guarded by mutex
+  Tokens released, releasedOnTheTestThread;  // guarded by mutex
   std::array<std::uint8_t, 60> record{};
   Producer producer;
 
@@ -60,22 +55,15 @@ struct QueueProducer : ::testing::Test {
     const auto test = std::this_thread::get_id();
     return producer.Start(size, [this, test](std::uint32_t token) {
       std::lock_guard<std::mutex> hold(mutex);
-      released.emplace_back(token, std::this_thread::get_id() == test);
+      released.push_back(token);
+      if (std::this_thread::get_id() == test) releasedOnTheTestThread.push_back(token);
     });
   }
-  Tokens Released() {
+  Tokens Released(bool onTheTestThread = false) {
     std::lock_guard<std::mutex> hold(mutex);
-    Tokens tokens;
-    for (const auto& entry : released) tokens.push_back(entry.first);
-    return tokens;
+    return onTheTestThread ? releasedOnTheTestThread : released;
   }
-  bool ReleasedOnTheTestThread(std::size_t i) {
-    std::lock_guard<std::mutex> hold(mutex);
-    return released.at(i).second;
-  }
-  bool WaitForReleases(std::size_t n) {
-    return pmtest::WaitFor([&] { return Released().size() >= n; });
-  }
+  bool WaitForReleases(std::size_t n) { return pmtest::WaitFor([&] { return Released().size() >= n; }); }
   bool Send(std::uint32_t token) { return producer.Send(token, {{record.data(), 60}}); }
   // The producer thread passes its loop about once per 250 ms wait; one that
   // still watched a dead socket, which keeps reporting a hang-up, would pass
@@ -123,8 +111,8 @@ TEST_F(QueueProducer, TokenReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIg
   auto a = Add();
   auto b = Add();
   ASSERT_TRUE(Send(5));
-  EXPECT_EQ(a->NextToken(), 5u);
-  EXPECT_EQ(b->NextToken(), 5u);
+  EXPECT_EQ(pm::LoadLe32(a->ReadRecord().data()), 5u);
+  EXPECT_EQ(pm::LoadLe32(b->ReadRecord().data()), 5u);
   for (std::uint32_t token : {5u, 5u, 77u}) a->Return(token);
   ASSERT_TRUE(pmtest::WaitFor([&] {
     return log.Contains("Connection not found for token (5).") && log.Contains("Token (77) not found.");
@@ -132,7 +120,7 @@ TEST_F(QueueProducer, TokenReleasedOnlyWhenEveryReaderReturnedAndBadReturnsAreIg
   EXPECT_TRUE(Released().empty());
   b->Return(5);
   ASSERT_TRUE(WaitForReleases(1));
-  EXPECT_FALSE(ReleasedOnTheTestThread(0));
+  EXPECT_TRUE(Released(true).empty());
   b->Return(5);
   ASSERT_TRUE(pmtest::WaitFor([&] { return log.Contains("Token (5) not found."); }));
   EXPECT_EQ(Released(), Tokens{5});
@@ -151,8 +139,8 @@ TEST_F(QueueProducer, SendBeforeAnyReaderAndStopReleaseOnTheCallingThreadDestruc
   for (std::uint32_t token : {30u, 10u, 20u}) ASSERT_TRUE(Send(token));
   producer.Stop();
   producer.Stop();  // nothing more
-  EXPECT_EQ(Released(), (Tokens{9, 10, 20, 30}));
-  for (std::size_t i = 0; i < 4; ++i) EXPECT_TRUE(ReleasedOnTheTestThread(i));
+  EXPECT_EQ(Released(true), (Tokens{9, 10, 20, 30}));
+  EXPECT_EQ(Released(), Released(true));
 
   auto destroyed = std::make_unique<Producer>();
   ASSERT_TRUE(destroyed->Start(60, [&](std::uint32_t token) { ADD_FAILURE() << token; }));
@@ -227,8 +215,7 @@ TEST_F(QueueProducer, ReturnsFromBeforeTheReaderWasWatchedAreDiscarded) {
       reader.ReadRecord();
       producer.Stop();  // releases 1
     }
-    reader.Return(1);
-    reader.Return(4);
+    for (std::uint32_t token : {1u, 4u}) reader.Return(token);
     ASSERT_TRUE(pmtest::WaitFor([&] { return !Connection::WaitReadableConnections({reader.task}, 10).empty(); }));
     ASSERT_TRUE(restart ? Start(60) : producer.AddConnection(reader.task));
     EXPECT_EQ(producer.ReaderCount(), 1u);
@@ -248,10 +235,8 @@ TEST_F(QueueProducer, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   auto a = Add();
   auto b = Add();
   for (std::uint32_t token : {7u, 2u, 5u, 6u}) ASSERT_TRUE(Send(token));
-  for (int i = 0; i < 4; ++i) {
-    a->ReadRecord();
-    b->ReadRecord();
-  }
+  a->ReadRecord(4 * 64);
+  b->ReadRecord(4 * 64);
   // 6 released marks b's earlier returns as taken before a goes.
   for (std::uint32_t token : {5u, 7u, 6u}) b->Return(token);
   a->Return(6);
@@ -267,8 +252,7 @@ TEST_F(QueueProducer, ReaderThatGoesAwayGivesUpWhatItOwedWithoutSpinning) {
   // New records go to b alone, and b's return alone releases them.
   ASSERT_TRUE(Send(11));
   b->ReadRecord();
-  b->Return(2);
-  b->Return(11);
+  for (std::uint32_t token : {2u, 11u}) b->Return(token);
   ASSERT_TRUE(WaitForReleases(5));
   EXPECT_EQ(Released(), (Tokens{6, 5, 7, 2, 11}));
 

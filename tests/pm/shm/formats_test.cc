@@ -62,9 +62,7 @@ TEST(FrameFormats, LayoutPlanesPutsNV12ChromaAfterTheLumaRowsAndNeedsABase) {
   EXPECT_TRUE(nv12.plane[1].data == base + 9 * 16 && nv12.plane[1].rows == 4 && nv12.plane[1].stride == 16);
 
   const pm::VideoPlanes rgba = pm::LayoutPlanes(Format(pm::kCodeRgba, 16, 9), base, 100);
-  ASSERT_EQ(rgba.planeCount, 1);
-  EXPECT_EQ(rgba.plane[0].stride, 100);
-  EXPECT_EQ(rgba.plane[1].data, nullptr);
+  EXPECT_EQ(std::make_tuple(rgba.planeCount, rgba.plane[0].stride, rgba.plane[1].data), std::make_tuple(1, 100, nullptr));
   // Unknown codes still give one plane (with no default stride).
   EXPECT_EQ(pm::LayoutPlanes(Format(0, 16, 9), base, 0).planeCount, 1);
 }

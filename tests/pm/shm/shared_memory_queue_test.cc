@@ -33,48 +33,34 @@ struct StartedQueue {
   std::string base = "pmtestq" + std::to_string(pm::CurrentProcessId()) + "_";
   std::atomic<bool> hostConnected{false};
 
-  explicit StartedQueue(bool start = true) {
-    if (!start) return;
+  StartedQueue() {
     queue->StartQueue(link.Dispatcher(), "NDICaptureDevice~CAM", base, [this] { hostConnected = true; });
     EXPECT_TRUE(link.ReadCommand("NDICaptureDevice~CAM::start_queue"));
   }
 };
 
-// The host checks records with Fletcher-16: 'abc' is the reference vector.
-TEST(QueueCheckBytes, MatchTheReferenceVectorAndZeroTheSums) {
-  const std::uint8_t abc[3] = {'a', 'b', 'c'};
-  EXPECT_EQ(Sums(abc, 3), std::make_pair(39u, 76u));
-  EXPECT_EQ(pm::FletcherCheckBytes(abc, 3), (std::array<std::uint8_t, 2>{0x8C, 0x4C}));
-}
-
-TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZero) {
-  StartedQueue q;
-  auto a = q.queue->AllocateCpuBuffer(1);
-  auto b = q.queue->AllocateCpuBuffer(1);
-  EXPECT_EQ(a->id, 1u);
-  EXPECT_EQ(b->id, 2u);
-  q.queue->DeleteBuffer(b);
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 3u);  // ids keep growing after a delete
-  q.queue->SeedNextId(0xFFFFFFFFu);
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 0xFFFFFFFFu);
-  // Wrapped: 0 is never used, 1 is still in the pool, 2 is free again.
-  EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 2u);
-}
-
-// Segments are named after the memory base and their id, sized in whole
-// pages, and all gone from the system with the queue.
-TEST(QueueSizes, AreRoundedUpTo4096AndNothingIsLeftAfterTheQueueGoes) {
+// Ids count from one, skip those in use and wrap past zero; segments are
+// named after the memory base and their id, sized in whole pages, and all gone
+// from the system with the queue.
+TEST(QueueIds, CountFromOneSkipInUseIdsAndWrapPastZeroAndNameSegmentsOfWholePages) {
   std::string one, more;
   {
     StartedQueue q;
-    one = q.base + std::to_string(q.queue->AllocateCpuBuffer(1)->id);
-    more = q.base + std::to_string(q.queue->AllocateCpuBuffer(4097)->id);
-    EXPECT_EQ(SegmentBytes(one), 4096u);
-    EXPECT_EQ(SegmentBytes(more), 8192u);
+    auto a = q.queue->AllocateCpuBuffer(1);
+    auto b = q.queue->AllocateCpuBuffer(4097);
+    EXPECT_EQ(std::make_pair(a->id, b->id), std::make_pair(1u, 2u));
+    one = q.base + "1";
+    more = q.base + "2";
+    EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(4096u, 8192u));
+    q.queue->DeleteBuffer(b);
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 3u);  // ids keep growing after a delete
+    q.queue->SeedNextId(0xFFFFFFFFu);
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 0xFFFFFFFFu);
+    // Wrapped: 0 is never used, 1 is still in the pool, 2 is free again.
+    EXPECT_EQ(q.queue->AllocateCpuBuffer(1)->id, 2u);
     EXPECT_EQ(q.queue->AllocateCpuBuffer(0), nullptr);
   }
-  EXPECT_EQ(SegmentBytes(one), 0u);
-  EXPECT_EQ(SegmentBytes(more), 0u);
+  EXPECT_EQ(std::make_tuple(SegmentBytes(one), SegmentBytes(more)), std::make_tuple(0u, 0u));
 }
 
 TEST(QueueReuse, PicksTheSmallestFreeSegmentThatFitsAndNeverAHeldOne) {
@@ -101,7 +87,6 @@ TEST(QueueReuse, PicksTheSmallestFreeSegmentThatFitsAndNeverAHeldOne) {
 TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnReturn) {
   StartedQueue q;
   pmtest::QueueReader host(q.queue->Port());
-  ASSERT_TRUE(host.Connected());
   auto segment = q.queue->AllocateCpuBuffer(100);
   segment->descriptor.stride = 1;
   std::uint8_t payload[34];
@@ -116,7 +101,11 @@ TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnRe
   EXPECT_EQ(std::memcmp(record, ".UPC", 4), 0);  // the CPU type tag
   EXPECT_EQ(pm::LoadLe64(record + 12), 4096u);  // the segment's size
   EXPECT_EQ(std::memcmp(record + 24, payload, 34), 0);
+  // The host checks records with Fletcher-16 ('abc' is its reference vector).
   EXPECT_EQ(Sums(record, 60), std::make_pair(0u, 0u));
+  const std::uint8_t abc[3] = {'a', 'b', 'c'};
+  EXPECT_EQ(Sums(abc, 3), std::make_pair(39u, 76u));
+  EXPECT_EQ(pm::FletcherCheckBytes(abc, 3), (std::array<std::uint8_t, 2>{0x8C, 0x4C}));
 
   EXPECT_EQ(segment->inUse.load(), 1);  // held until the host returns the token
   ASSERT_TRUE(host.ReturnToken(token));
@@ -127,8 +116,8 @@ TEST(QueueRecords, CarryTokenDescriptorPayloadAndCheckBytesAndFreeTheSegmentOnRe
 // and a deleted segment (announced to the host) is refused with a log line.
 TEST(QueueRecords, WithoutAHostTheHoldGoesAtOnceAndUnstartedOrDeletedAreRefused) {
   std::uint8_t payload[34] = {};
-  StartedQueue unstarted(false);
-  EXPECT_FALSE(unstarted.queue->SendBuffer(unstarted.queue->AllocateCpuBuffer(100), payload));
+  const auto unstarted = std::make_shared<SharedMemoryQueueProducer>();
+  EXPECT_FALSE(unstarted->SendBuffer(unstarted->AllocateCpuBuffer(100), payload));
   StartedQueue q;
   auto segment = q.queue->AllocateCpuBuffer(100);
   EXPECT_TRUE(q.queue->SendBuffer(segment, payload));
@@ -144,17 +133,14 @@ TEST(QueueRecords, WithoutAHostTheHoldGoesAtOnceAndUnstartedOrDeletedAreRefused)
 
 // A GPU memory manager that a runner could register in the context: its
 // segments hold no memory (size 1, nothing to lock).
-class FakeGpuSegment : public pm::SharedGpuMemory {
- public:
-  explicit FakeGpuSegment(const pm::VideoFormat& f) : format_(f) { descriptor.size = 1; }
+struct FakeGpuSegment : pm::SharedGpuMemory {
+  explicit FakeGpuSegment(const pm::VideoFormat& f) : format(f) { descriptor.size = 1; }
   std::uint64_t Size() const override { return descriptor.size; }
   std::pair<std::uint8_t*, std::int32_t> Lock() override { return {nullptr, 0}; }
   void Unlock() override {}
   bool IsLocked() const override { return false; }
-  pm::VideoFormat Format() const override { return format_; }
-
- private:
-  pm::VideoFormat format_;
+  pm::VideoFormat Format() const override { return format; }
+  pm::VideoFormat format;
 };
 
 struct FakeGpuManager : pm::SharedGpuMemoryManager {
@@ -167,10 +153,7 @@ struct FakeGpuManager : pm::SharedGpuMemoryManager {
 
 TEST(QueueGpu, ARegisteredManagerIsPreferredAndMatchedFieldByField) {
   auto manager = std::make_shared<FakeGpuManager>();
-  {
-    std::lock_guard<std::mutex> guard(pm::GetContext()->registryLock);
-    pm::GetContext()->registry["SharedGpuMemoryManager"] = manager;
-  }
+  ASSERT_EQ(pm::FindSingleton("SharedGpuMemoryManager", [&] { return manager; }), manager);
   {
     StartedQueue q;
     const pm::VideoFormat format = VideoFormatOf(pm::kCodeNV12, 1920, 1080);
