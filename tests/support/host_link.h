@@ -48,7 +48,6 @@ class HostLink {
 class QueueReader {
  public:
   explicit QueueReader(int port) : connection_(pm::ipc::Connection::Open(port)) {}
-  bool Connected() const { return connection_ != nullptr; }
   // Reads one record; false on timeout or a closed connection.
   bool ReadRecord(std::uint32_t* token, std::uint8_t record[60], std::int64_t timeoutMs = 5000) {
     return connection_ && connection_->ReadFromSocket(token, 4, timeoutMs) &&
