@@ -210,13 +210,13 @@ TEST_F(Vendor, TallyMetadataShotEventsAndPtzGoBothWaysExactlyAndAudioOnlyBringsN
 // (UYVY_BGRA): pictures without alpha arrive as UYVY, with alpha as BGRA;
 // each whole and in order.
 TEST_F(Vendor, SendersArriveWholeAndInOrderInTheHostCodeOfTheColourFormat) {
-  const std::pair<const char*, const char*> cases[] = {
-      {"uyvy", "2vuy"}, {"bgra", "2vuy"}, {"uyva", "rgba"}, {"nv12", "2vuy"}};
-  for (const auto& [format, code] : cases) {
+  const std::tuple<const char*, const char*, int, int> cases[] = {
+      {"uyvy", "2vuy", 1920, 1080}, {"bgra", "2vuy", 640, 360}, {"uyva", "rgba", 640, 360}, {"nv12", "2vuy", 640, 360}};
+  for (const auto& [format, code, width, height] : cases) {
     SCOPED_TRACE(format);
     Sender sender;
     ASSERT_TRUE(sender.Start(Place(), std::string("Vendor ") + format,
-                             BlocksArgs(640, 360, {"--format", format, "--no-audio"})));
+                             BlocksArgs(width, height, {"--format", format, "--no-audio"})));
     Watch watch;
     pmhost::ReceiveOptions o = From(sender, watch);
     o.frames = 30;
@@ -224,7 +224,7 @@ TEST_F(Vendor, SendersArriveWholeAndInOrderInTheHostCodeOfTheColourFormat) {
     const pmhost::ReceiveResult result = pmhost::Receive(o);
     pmtest::ExpectOrderlyEnd(result, Place());
     EXPECT_EQ(pmhost::CodeText(result.stats.videoCode), code);
-    EXPECT_EQ(std::vector<int>({result.stats.width, result.stats.height}), std::vector<int>({640, 360}));
+    EXPECT_EQ(std::vector<int>({result.stats.width, result.stats.height}), std::vector<int>({width, height}));
     const Seen seen = watch.Now();
     EXPECT_GE(seen.Pictures(), o.frames);
     EXPECT_EQ(seen.damaged, 0) << seen.problem;
