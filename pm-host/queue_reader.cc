@@ -52,6 +52,7 @@ bool QueueReader::Handle(const std::uint8_t* wire, std::size_t length, std::uint
   if (parsed) {
     mapping = cache_.Map(record.token, record.descriptor.size);
     if (!mapping) reason = "segment " + std::to_string(record.token) + " cannot be mapped";
+    if (!mapping && stopping_) return hasToken;  // the segment went with the stopped source
   }
   if (!mapping) {
     ++badRecords_;

@@ -70,6 +70,10 @@ class QueueReader {
   void Stop();
   // "::delete_memory": the segment `id` goes away.
   void Forget(std::uint32_t id) { cache_.Forget(id); }
+  // The host has asked the source to stop: the task removes the queue's
+  // segments, so a record still on its way may name one that is gone. From
+  // now on such a record is dropped quietly instead of counted as bad.
+  void Stopping() { stopping_ = true; }
 
   // Reads one record of `length` bytes already taken off the wire: checks,
   // maps, delivers; returns the token to give back (also for a refused
@@ -94,6 +98,7 @@ class QueueReader {
   std::thread thread_;  // touched by Start, Stop and the destructor (one owner thread)
   std::atomic<bool> running_{false};
   std::atomic<bool> ended_{false};
+  std::atomic<bool> stopping_{false};
   std::atomic<std::uint64_t> records_{0};
   std::atomic<std::uint64_t> badRecords_{0};
 };

@@ -90,6 +90,10 @@ std::optional<json> Session::StartSource(const std::string& id, const json& conf
 }
 
 std::optional<json> Session::StopSource(const std::string& id) {
+  {
+    std::lock_guard<std::mutex> guard(lock_);
+    if (const auto found = queues_.find(id); found != queues_.end()) found->second->Stopping();
+  }
   auto reply = Request("pm::tsrc::stop_source", {{"unique_id", id}}, 10000);
   std::shared_ptr<QueueReader> queue;
   {

@@ -144,6 +144,20 @@ TEST(RecordRefusals, EveryRefusedRecordIsSkippedWithItsReasonAndItsTokenReturned
   EXPECT_EQ(sink.frames, 0);
 }
 
+// Once the host has asked the source to stop, the task removes its segments:
+// a record still on its way that names one of them is no fault of the task.
+TEST(RecordRefusals, ARecordNamingAGoneSegmentAfterStopSourceIsDroppedQuietly) {
+  pmtest::LogCapture log;
+  CountingSink sink;
+  pmhost::QueueReader reader("src", Base(), &sink);
+  reader.Stopping();
+  const Wire gone = Video(5, 4096, 0, pm::kCode2vuy, 32, 16);
+  std::uint32_t token = 0;
+  EXPECT_TRUE(reader.Handle(gone.data(), gone.size(), &token));
+  EXPECT_EQ(std::make_tuple(token, sink.frames, sink.bad, reader.BadRecords(), log.Count("record skipped: ")),
+            std::make_tuple(5u, 0, 0, std::uint64_t{0}, 0));
+}
+
 TEST(SegmentCache, RemapsWhenTheSizeChangesKeepsOldHoldersValidAndRefusesShortSegments) {
   pmtest::LogCapture log;
   pmhost::SegmentCache cache(Base());
