@@ -51,8 +51,8 @@ bool QueueReader::Handle(const std::uint8_t* wire, std::size_t length, std::uint
   std::shared_ptr<const SegmentMapping> mapping;
   if (parsed) {
     mapping = cache_.Map(record.token, record.descriptor.size);
-    if (!mapping) reason = "segment " + std::to_string(record.token) + " cannot be mapped";
     if (!mapping && stopping_) return hasToken;  // the segment went with the stopped source
+    if (!mapping) reason = "segment " + std::to_string(record.token) + " cannot be mapped";
   }
   if (!mapping) {
     ++badRecords_;
