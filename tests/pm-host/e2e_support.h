@@ -318,8 +318,11 @@ struct Chain {
   void EndAndExpectOrderlyExit(const std::vector<std::string>& sources = {}) {
     const std::vector<std::string> bases = Session().MemoryBases();
     for (const std::string& source : sources) Session().StopSource(source);
-    EXPECT_EQ(sources.empty() ? std::optional<int>(0) : host.WaitRunner(kPatience), std::optional<int>(0)) << Log();
-    EXPECT_TRUE(!sources.empty() || Session().StopDiscovery());
+    if (sources.empty()) {
+      EXPECT_TRUE(Session().StopDiscovery());
+    } else {
+      EXPECT_EQ(host.WaitRunner(kPatience), std::optional<int>(0)) << Log();
+    }
     EXPECT_EQ(host.Stop(), 0) << Log();
     EXPECT_EQ(SegmentsOf(bases), 0);
     EXPECT_EQ(host.RemovedSegments(), 0) << "an orderly runner removes its own segments";
